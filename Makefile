@@ -1,0 +1,49 @@
+# Front door: every target installs what is missing, configures and builds as needed.
+PREFIX ?= /usr/local
+FUZZ_SECONDS ?= 60
+
+.PHONY: all deps build test run asan tsan bench fuzz install format clean
+
+all: build
+
+deps:
+	@./scripts/install-deps.sh
+
+build: deps
+	cmake --preset default
+	cmake --build --preset default
+
+test: build
+	ctest --preset default
+
+run: build
+	./build/default/examples/core_tour
+
+asan: deps
+	cmake --preset asan
+	cmake --build --preset asan
+	ctest --preset asan
+
+tsan: deps
+	cmake --preset tsan
+	cmake --build --preset tsan
+	setarch $$(uname -m) -R ctest --preset tsan
+
+bench: deps
+	cmake --preset bench
+	cmake --build --preset bench
+	./scripts/run-benchmarks.sh build/bench/bench
+
+fuzz: deps
+	cmake --preset fuzz
+	cmake --build --preset fuzz
+	./scripts/run-fuzzers.sh build/fuzz/fuzz $(FUZZ_SECONDS)
+
+install: build
+	cmake --install build/default --prefix $(PREFIX)
+
+format:
+	git ls-files '*.h' '*.cpp' | xargs clang-format -i
+
+clean:
+	rm -rf build

@@ -1,0 +1,26 @@
+#pragma once
+// The debug settings that shape diagnostics, owned by the application: how many frames
+// of an exception's backtrace FormatThrowable prints (0: none), and the reference frames
+// (the stack shared by every thread's outer end) trimmed from those backtraces.
+// Thread-safe.
+
+#include "pelmora/object/ref.h"
+#include "pelmora/system/backtrace.h"
+
+namespace Pelmora::Service {
+
+class DebugConfig {
+public:
+   virtual int GetExceptionBacktrace() const = 0;
+   virtual void SetExceptionBacktrace(int maxFrames) = 0;
+   virtual Ref<System::Backtrace> GetReferenceFrames() const = 0;
+   virtual void SetReferenceFrames(const Ref<System::Backtrace>& frames) = 0;
+
+protected:
+   ~DebugConfig() = default;
+};
+
+// The process-wide debug configuration; alive until exit.
+DebugConfig& GetDebugConfig();
+
+}  // namespace Pelmora::Service

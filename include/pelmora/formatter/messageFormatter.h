@@ -1,0 +1,35 @@
+#pragma once
+// MessageFormatter fills "%1".."%9" placeholders of a format string with its arguments.
+// "%%" writes one percent sign; any other "%x" is copied unchanged (so printf-style
+// conversions pass through as text); a trailing lone "%" ends the text; "%10" is argument
+// 1 followed by "0". A placeholder beyond the arguments throws
+// InvalidFormatStringException with the format string as its message. Thread-safe.
+
+#include <string>
+
+#include "pelmora/formatter/printFormatter.h"
+
+namespace Pelmora {
+
+class MessageFormatter {
+public:
+   template <class... Args>
+   static void Print(Writer* writer, const char* format, const Args&... args) {
+      static_assert(sizeof...(Args) >= 1 && sizeof...(Args) <= 9, "one to nine arguments");
+      const PrintFormatter formatters[] = {PrintFormatter(args)...};
+      PrintArgs(writer, format, formatters, sizeof...(Args));
+   }
+
+   template <class... Args>
+   static std::string ASPrint(const char* format, const Args&... args) {
+      static_assert(sizeof...(Args) >= 1 && sizeof...(Args) <= 9, "one to nine arguments");
+      const PrintFormatter formatters[] = {PrintFormatter(args)...};
+      return ASPrintArgs(format, formatters, sizeof...(Args));
+   }
+
+   // The walk behind every overload.
+   static void PrintArgs(Writer* writer, const char* format, const PrintFormatter* args, int count);
+   static std::string ASPrintArgs(const char* format, const PrintFormatter* args, int count);
+};
+
+}  // namespace Pelmora

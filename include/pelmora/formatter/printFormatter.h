@@ -1,0 +1,121 @@
+#pragma once
+// A PrintFormatter wraps one argument of a message: its value, an optional printf-style
+// conversion text and the function that writes it. It is built implicitly from the
+// argument, refers to (never copies) strings and objects, and must not outlive them.
+// A plain value; formatting has no shared state.
+
+#include <cstddef>
+#include <cstdint>
+#include <exception>
+#include <string>
+#include <string_view>
+
+#include "pelmora/formatter/dateTime.h"
+#include "pelmora/io/readerWriter.h"
+
+namespace Pelmora {
+
+class Throwable;
+namespace Xml {
+class Node;
+}
+
+class PrintFormatter {
+public:
+   union FormatValue {
+      bool boolean;
+      char character;
+      int32_t int32;
+      uint32_t uint32;
+      int64_t int64;
+      uint64_t uint64;
+      float float32;
+      double float64;
+      const void* pointer;
+      const char* string;
+      const std::string* stlString;
+      const std::string_view* stringView;
+      const Object* object;
+      const Xml::Node* xmlNode;
+      const std::exception* exception;
+      const Throwable* throwable;
+      const DateTime* dateTime;
+   };
+   using FormatFunction = void (*)(Writer*, const FormatValue&, const char* option);
+
+   PrintFormatter(bool value, const char* option = nullptr);
+   PrintFormatter(char value, const char* option = nullptr);
+   PrintFormatter(int value, const char* option = nullptr);
+   PrintFormatter(unsigned int value, const char* option = nullptr);
+   PrintFormatter(long value, const char* option = nullptr);
+   PrintFormatter(unsigned long value, const char* option = nullptr);
+   PrintFormatter(long long value, const char* option = nullptr);
+   PrintFormatter(unsigned long long value, const char* option = nullptr);
+   PrintFormatter(float value, const char* option = nullptr);
+   PrintFormatter(double value, const char* option = nullptr);
+   PrintFormatter(const void* value, const char* option = nullptr);
+   PrintFormatter(const char* value, const char* option = nullptr);
+   PrintFormatter(std::nullptr_t, const char* option = nullptr);
+   PrintFormatter(const std::string& value, const char* option = nullptr);
+   PrintFormatter(const std::string_view& value, const char* option = nullptr);
+   PrintFormatter(const Object* value, const char* option = nullptr);
+   PrintFormatter(const Object& value, const char* option = nullptr);
+   PrintFormatter(const std::exception& value, const char* option = nullptr);
+   PrintFormatter(const Throwable& value, const char* option = nullptr);
+   template <class T>
+   PrintFormatter(const Ref<T>& value, const char* option = nullptr)
+      : PrintFormatter(static_cast<const Object*>(value.Get()), option) {}
+
+   void Print(Writer* writer) const { _function(writer, _value, _option); }
+   // Appends what Print would write to `out`.
+   void PrintToString(std::string& out) const;
+
+   static void FormatBoolean(Writer*, const FormatValue&, const char* option);
+   static void FormatChar(Writer*, const FormatValue&, const char* option);
+   static void FormatInt(Writer*, const FormatValue&, const char* option);
+   static void FormatUInt(Writer*, const FormatValue&, const char* option);
+   static void FormatLong(Writer*, const FormatValue&, const char* option);
+   static void FormatULong(Writer*, const FormatValue&, const char* option);
+   static void FormatFloat(Writer*, const FormatValue&, const char* option);
+   static void FormatDouble(Writer*, const FormatValue&, const char* option);
+   static void FormatPtr(Writer*, const FormatValue&, const char* option);
+   static void FormatString(Writer*, const FormatValue&, const char* option);
+   static void FormatSTLString(Writer*, const FormatValue&, const char* option);
+   static void FormatStringView(Writer*, const FormatValue&, const char* option);
+   static void FormatObject(Writer*, const FormatValue&, const char* option);
+   static void FormatException(Writer*, const FormatValue&, const char* option);
+   static void FormatThrowable(Writer*, const FormatValue&, const char* option);
+
+protected:
+   PrintFormatter(FormatValue value, const char* option, FormatFunction function)
+      : _value(value), _option(option), _function(function) {}
+
+private:
+   FormatValue _value;
+   const char* _option;
+   FormatFunction _function;
+};
+
+// Formats a date-time (or a 64-bit UTC time in microseconds) as its short text.
+class DatePrintFormatter : public PrintFormatter {
+public:
+   DatePrintFormatter(const DateTime& value, const char* option = nullptr);
+   DatePrintFormatter(int64_t microsecondsSinceEpoch, const char* option = nullptr);
+
+   static void FormatDate(Writer*, const FormatValue&, const char* option);
+   static void FormatLongDate(Writer*, const FormatValue&, const char* option);
+   // Appends the short text to `out`.
+   static void FormatDate(const DateTime& value, std::string& out);
+};
+
+// Formats a date-time as its full text.
+class DateTimePrintFormatter : public PrintFormatter {
+public:
+   DateTimePrintFormatter(const DateTime& value, const char* option = nullptr);
+
+   static void FormatDateTime(Writer*, const FormatValue&, const char* option);
+   // Appends the full text to `out`.
+   static void FormatDateTime(const DateTime& value, std::string& out);
+};
+
+}  // namespace Pelmora

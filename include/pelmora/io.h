@@ -1,0 +1,6 @@
+#pragma once
+// Readers and writers.
+
+#include "pelmora/io/readerWriter.h"
+#include "pelmora/io/readers.h"
+#include "pelmora/io/writers.h"

@@ -1,0 +1,42 @@
+#pragma once
+// The scoreboard counts live referenced instances per class, keyed by the address of
+// the class's type-name string. It is a best-effort statistic: a fixed table allocated
+// once, updated lock-free, that silently drops classes whose row is full. Thread-safe.
+// The reference tracker records where instances of chosen classes were first referenced.
+
+#include <string>
+#include <unordered_set>
+
+#include "pelmora/object/ref.h"
+
+namespace Pelmora {
+
+class Scoreboard {
+public:
+   virtual void Increment(const char* name) = 0;
+   virtual void Decrement(const char* name) = 0;
+   // One line "(row, cell) => name - count" per counted class.
+   virtual void Serialize(std::string& out) const = 0;
+   // The number of classes counted.
+   virtual int GetSize() const = 0;
+   virtual ~Scoreboard() = default;
+};
+
+// The process-wide scoreboard; null until the first object is referenced. Lives until exit.
+Scoreboard* GetScoreboard();
+
+class RefTracker : public virtual Object {
+public:
+   // Appends, per tracked class, the backtraces of first references by descending count.
+   virtual void GetScores(std::string& out) = 0;
+   virtual void OnFirstIncRef(const Object* object, const std::type_info& type) = 0;
+   virtual void OnFinalDecRef(const Object* object, const std::type_info& type) = 0;
+};
+
+// Creates the reference tracker for the named classes (mangled names) and installs it
+// process-wide. The installed tracker lives until exit.
+void CreateRefTracker(const std::unordered_set<std::string>& classNames, Ref<RefTracker>& out);
+// The installed tracker, or null.
+RefTracker* GetRefTracker();
+
+}  // namespace Pelmora

@@ -1,0 +1,8 @@
+#pragma once
+// Every public family of the library.
+
+#include "pelmora/exception.h"
+#include "pelmora/formatter.h"
+#include "pelmora/io.h"
+#include "pelmora/object.h"
+#include "pelmora/system.h"

@@ -1,0 +1,314 @@
+// The argument formatters and the placeholder walk behind every message of the library.
+
+#include <algorithm>
+#include <charconv>
+#include <climits>
+#include <cstring>
+#include <typeinfo>
+
+#include "pelmora/exception/debugConfig.h"
+#include "pelmora/exception/exceptions.h"
+#include "pelmora/exception/panic.h"
+#include "pelmora/formatter/messageFormatter.h"
+#include "pelmora/formatter/printFormatter.h"
+#include "src/core/conversion.h"
+
+namespace Pelmora {
+namespace {
+
+// Conversion buffer sizes, in bytes.
+constexpr int kCharBuffer = 5;
+constexpr int kIntBuffer = 24;
+constexpr int kLongBuffer = 50;
+constexpr int kFloatingBuffer = 50;
+constexpr int kPointerBuffer = 20;
+
+constexpr char kNull[] = "(null)";
+
+// Writer::Write takes an int length; longer pieces go in several writes.
+void WriteAll(Writer* writer, const char* data, size_t length) {
+   while (length > static_cast<size_t>(INT_MAX)) {
+      writer->Write(data, INT_MAX);
+      data += INT_MAX;
+      length -= INT_MAX;
+   }
+   writer->Write(data, static_cast<int>(length));
+}
+
+void WriteText(Writer* writer, const char* text) {
+   WriteAll(writer, text, std::strlen(text));
+}
+
+void WriteNull(Writer* writer) {
+   writer->Write(kNull, sizeof(kNull) - 1);
+}
+
+// The default integer conversions ("%d", "%u", "%Ld", "%Lu") without parsing a format.
+template <class T>
+void WriteDecimal(Writer* writer, T value) {
+   char buffer[kIntBuffer];
+   auto result = std::to_chars(buffer, buffer + sizeof(buffer), value);
+   writer->Write(buffer, static_cast<int>(result.ptr - buffer));
+}
+
+// The default floating conversions: to_chars matches printf's "%f" and "%g" digit for digit.
+void WriteFloating(Writer* writer, double value, std::chars_format style,
+                   const char* defaultOption) {
+   char buffer[kFloatingBuffer];
+   // snprintf needs room for the terminating zero; keep the same capacity.
+   auto result = std::to_chars(buffer, buffer + sizeof(buffer) - 1, value, style, 6);
+   if (result.ec != std::errc()) throw InvalidFormatStringException(defaultOption);
+   writer->Write(buffer, static_cast<int>(result.ptr - buffer));
+}
+
+template <int Size, class T>
+void WriteConverted(Writer* writer, const char* option, T value) {
+   char buffer[Size];
+   int length = Internal::Convert(option, value, buffer, Size);
+   writer->Write(buffer, length);
+}
+
+// Collects the text of ASPrint on the stack; only output past the inline buffer allocates.
+class StackStringWriter final : public ObjectImpl, public virtual Writer {
+public:
+   void Write(const char* data, int length) override {
+      if (length <= 0) return;
+      if (_spill.empty() && _length + length <= static_cast<int>(sizeof(_inline))) {
+         std::memcpy(_inline + _length, data, length);
+         _length += length;
+         return;
+      }
+      if (_spill.empty()) {
+         _spill.reserve(static_cast<size_t>(_length + length) * 2);
+         _spill.assign(_inline, _length);
+      }
+      _spill.append(data, length);
+   }
+   void Close() override {}
+
+   std::string TakeString() {
+      if (_spill.empty()) return std::string(_inline, _length);
+      return std::move(_spill);
+   }
+
+private:
+   char _inline[256];
+   int _length = 0;
+   std::string _spill;
+};
+
+// Appends everything written to a caller's string.
+class AppendWriter final : public ObjectImpl, public virtual Writer {
+public:
+   explicit AppendWriter(std::string& out) : _out(out) {}
+   void Write(const char* data, int length) override {
+      if (length > 0) _out.append(data, length);
+   }
+   void Close() override {}
+
+private:
+   std::string& _out;
+};
+
+}  // namespace
+
+PrintFormatter::PrintFormatter(bool value, const char* option)
+    : PrintFormatter(FormatValue{.boolean = value}, option, FormatBoolean) {}
+PrintFormatter::PrintFormatter(char value, const char* option)
+    : PrintFormatter(FormatValue{.character = value}, option, FormatChar) {}
+PrintFormatter::PrintFormatter(int value, const char* option)
+    : PrintFormatter(FormatValue{.int32 = value}, option, FormatInt) {}
+PrintFormatter::PrintFormatter(unsigned int value, const char* option)
+    : PrintFormatter(FormatValue{.uint32 = value}, option, FormatUInt) {}
+PrintFormatter::PrintFormatter(long value, const char* option)
+    : PrintFormatter(FormatValue{.int64 = value}, option, FormatLong) {}
+PrintFormatter::PrintFormatter(unsigned long value, const char* option)
+    : PrintFormatter(FormatValue{.uint64 = value}, option, FormatULong) {}
+PrintFormatter::PrintFormatter(long long value, const char* option)
+    : PrintFormatter(FormatValue{.int64 = value}, option, FormatLong) {}
+PrintFormatter::PrintFormatter(unsigned long long value, const char* option)
+    : PrintFormatter(FormatValue{.uint64 = value}, option, FormatULong) {}
+PrintFormatter::PrintFormatter(float value, const char* option)
+    : PrintFormatter(FormatValue{.float32 = value}, option, FormatFloat) {}
+PrintFormatter::PrintFormatter(double value, const char* option)
+    : PrintFormatter(FormatValue{.float64 = value}, option, FormatDouble) {}
+PrintFormatter::PrintFormatter(const void* value, const char* option)
+    : PrintFormatter(FormatValue{.pointer = value}, option, FormatPtr) {}
+PrintFormatter::PrintFormatter(const char* value, const char* option)
+    : PrintFormatter(FormatValue{.string = value}, option, FormatString) {}
+PrintFormatter::PrintFormatter(std::nullptr_t, const char* option)
+    : PrintFormatter(FormatValue{.string = nullptr}, option, FormatString) {}
+PrintFormatter::PrintFormatter(const std::string& value, const char* option)
+    : PrintFormatter(FormatValue{.stlString = &value}, option, FormatSTLString) {}
+PrintFormatter::PrintFormatter(const std::string_view& value, const char* option)
+    : PrintFormatter(FormatValue{.stringView = &value}, option, FormatStringView) {}
+PrintFormatter::PrintFormatter(const Object* value, const char* option)
+    : PrintFormatter(FormatValue{.object = value}, option, FormatObject) {}
+PrintFormatter::PrintFormatter(const Object& value, const char* option)
+    : PrintFormatter(FormatValue{.object = &value}, option, FormatObject) {}
+PrintFormatter::PrintFormatter(const std::exception& value, const char* option)
+    : PrintFormatter(FormatValue{.exception = &value}, option, FormatException) {}
+PrintFormatter::PrintFormatter(const Throwable& value, const char* option)
+    : PrintFormatter(FormatValue{.throwable = &value}, option, FormatThrowable) {}
+
+void PrintFormatter::PrintToString(std::string& out) const {
+   AppendWriter writer(out);
+   Print(&writer);
+}
+
+void PrintFormatter::FormatBoolean(Writer* writer, const FormatValue& value, const char*) {
+   if (value.boolean) {
+      writer->Write("true", 4);
+   } else {
+      writer->Write("false", 5);
+   }
+}
+
+void PrintFormatter::FormatChar(Writer* writer, const FormatValue& value, const char* option) {
+   if (!option) {
+      writer->Write(&value.character, 1);
+      return;
+   }
+   WriteConverted<kCharBuffer>(writer, option, value.character);
+}
+
+void PrintFormatter::FormatInt(Writer* writer, const FormatValue& value, const char* option) {
+   if (!option) return WriteDecimal(writer, value.int32);
+   WriteConverted<kIntBuffer>(writer, option, value.int32);
+}
+
+void PrintFormatter::FormatUInt(Writer* writer, const FormatValue& value, const char* option) {
+   if (!option) return WriteDecimal(writer, value.uint32);
+   WriteConverted<kIntBuffer>(writer, option, value.uint32);
+}
+
+void PrintFormatter::FormatLong(Writer* writer, const FormatValue& value, const char* option) {
+   if (!option) return WriteDecimal(writer, value.int64);
+   WriteConverted<kLongBuffer>(writer, option, value.int64);
+}
+
+void PrintFormatter::FormatULong(Writer* writer, const FormatValue& value, const char* option) {
+   if (!option) return WriteDecimal(writer, value.uint64);
+   WriteConverted<kLongBuffer>(writer, option, value.uint64);
+}
+
+void PrintFormatter::FormatFloat(Writer* writer, const FormatValue& value, const char* option) {
+   double promoted = value.float32;
+   if (!option) return WriteFloating(writer, promoted, std::chars_format::fixed, "%f");
+   WriteConverted<kFloatingBuffer>(writer, option, promoted);
+}
+
+void PrintFormatter::FormatDouble(Writer* writer, const FormatValue& value, const char* option) {
+   if (!option) return WriteFloating(writer, value.float64, std::chars_format::general, "%g");
+   WriteConverted<kFloatingBuffer>(writer, option, value.float64);
+}
+
+void PrintFormatter::FormatPtr(Writer* writer, const FormatValue& value, const char* option) {
+   if (option) return WriteConverted<kPointerBuffer>(writer, option, value.pointer);
+   // "%08x" over the whole address: at least eight hexadecimal digits, zero-padded.
+   char digits[kPointerBuffer];
+   auto result = std::to_chars(digits, digits + sizeof(digits),
+                               reinterpret_cast<uintptr_t>(value.pointer), 16);
+   int length = static_cast<int>(result.ptr - digits);
+   if (length < 8) {
+      char padded[8];
+      std::memset(padded, '0', 8 - length);
+      std::memcpy(padded + 8 - length, digits, length);
+      writer->Write(padded, 8);
+   } else {
+      writer->Write(digits, length);
+   }
+}
+
+void PrintFormatter::FormatString(Writer* writer, const FormatValue& value, const char*) {
+   if (!value.string) return WriteNull(writer);
+   WriteText(writer, value.string);
+}
+
+void PrintFormatter::FormatSTLString(Writer* writer, const FormatValue& value, const char*) {
+   if (!value.stlString) return WriteNull(writer);
+   WriteAll(writer, value.stlString->data(), value.stlString->size());
+}
+
+void PrintFormatter::FormatStringView(Writer* writer, const FormatValue& value, const char*) {
+   if (!value.stringView) return WriteNull(writer);
+   WriteAll(writer, value.stringView->data(), value.stringView->size());
+}
+
+void PrintFormatter::FormatObject(Writer* writer, const FormatValue& value, const char*) {
+   if (!value.object) return WriteNull(writer);
+   std::string text = value.object->ToString();
+   WriteAll(writer, text.data(), text.size());
+}
+
+void PrintFormatter::FormatException(Writer* writer, const FormatValue& value, const char*) {
+   const std::exception* exception = value.exception;
+   if (!exception) return WriteNull(writer);
+   WriteText(writer, TypeName(typeid(*exception)));
+   writer->Write("(", 1);
+   WriteText(writer, exception->what());
+   writer->Write(")", 1);
+}
+
+void PrintFormatter::FormatThrowable(Writer* writer, const FormatValue& value, const char* option) {
+   const Throwable* throwable = value.throwable;
+   FormatValue asException{.exception = throwable};
+   FormatException(writer, asException, option);
+   if (!throwable) return;
+
+   Service::DebugConfig& config = Service::GetDebugConfig();
+   int maxFrames = config.GetExceptionBacktrace();
+   if (maxFrames == 0) return;
+   const Ref<System::Backtrace>& backtrace = throwable->GetBacktrace();
+   if (!backtrace) return;
+
+   // The outer frames every thread shares (start-up, thread entry) say nothing; drop them.
+   int frames = backtrace->GetFrameCount();
+   Ref<System::Backtrace> reference = config.GetReferenceFrames();
+   if (reference) {
+      int referenceFrames = reference->GetFrameCount();
+      while (frames > 0 && referenceFrames > 0 &&
+             backtrace->GetFrame(frames - 1) == reference->GetFrame(referenceFrames - 1)) {
+         --frames;
+         --referenceFrames;
+      }
+   }
+   if (maxFrames > 0) frames = std::min(frames, maxFrames);
+   if (frames == 0) return;
+   std::string text = backtrace->GetText(0, frames);
+   writer->Write("\n", 1);
+   WriteAll(writer, text.data(), text.size());
+}
+
+void MessageFormatter::PrintArgs(Writer* writer, const char* format, const PrintFormatter* args,
+                                 int count) {
+   size_t index = 0;
+   for (;;) {
+      size_t end = static_cast<size_t>(strchrnul(format + index, '%') - format);
+      if (end > index) WriteAll(writer, format + index, end - index);
+      index = end;
+      if (format[index] == '\0') return;
+      PELMORA_VERIFY(format[index] == '%');
+      char next = format[index + 1];
+      if (next == '\0') return;
+      if (next >= '1' && next <= '9') {
+         int number = next - '0';
+         if (number > count) throw InvalidFormatStringException(format);
+         args[number - 1].Print(writer);
+      } else if (next == '%') {
+         writer->Write("%", 1);
+      } else {
+         writer->Write(format + index, 2);
+      }
+      index += 2;
+   }
+}
+
+std::string MessageFormatter::ASPrintArgs(const char* format, const PrintFormatter* args,
+                                          int count) {
+   StackStringWriter writer;
+   PrintArgs(&writer, format, args, count);
+   return writer.TakeString();
+}
+
+}  // namespace Pelmora

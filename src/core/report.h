@@ -1,0 +1,31 @@
+#pragma once
+// Where exception dumps and panic reports go. The core writes them to standard error;
+// the logging layer installs a sink at start-up that writes through the default logger
+// and its in-memory output. Levels use the logger's bit values.
+
+#include <string>
+
+namespace Pelmora::Internal {
+
+constexpr int kReportPanicLevel = 2;
+constexpr int kReportErrorLevel = 4;
+
+class ReportSink {
+public:
+   // Whether `level` is enabled in the default logger's log or memory mask.
+   virtual bool IsLevelEnabled(int level) = 0;
+   virtual void Log(int level, const std::string& text) = 0;
+   // Writes out the in-memory buffer of recent lines with `message`; `detach` takes the
+   // memory output away first (a panic report, whose process is about to die).
+   virtual void LogMemoryBuffer(int level, const std::string& message, bool detach) = 0;
+   virtual void Flush() = 0;
+
+protected:
+   ~ReportSink() = default;
+};
+
+// `sink` must stay alive until exit; null restores the standard-error sink.
+void SetReportSink(ReportSink* sink);
+ReportSink& GetReportSink();
+
+}  // namespace Pelmora::Internal

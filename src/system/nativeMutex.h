@@ -1,0 +1,56 @@
+#pragma once
+// NativeMutex is the operating-system mutex plus the identity of the thread holding it,
+// used by value inside other objects. Not recursive; locking it twice from one thread
+// and unlocking it from another thread are caught as broken invariants.
+// NativeSynchronized locks one for the extent of a scope.
+
+#include <pthread.h>
+
+#include <atomic>
+
+#include "pelmora/exception/panic.h"
+
+namespace Pelmora::System {
+
+class NativeMutex {
+public:
+   NativeMutex() = default;
+   NativeMutex(const NativeMutex&) = delete;
+   NativeMutex& operator=(const NativeMutex&) = delete;
+   ~NativeMutex() { pthread_mutex_destroy(&_mutex); }
+
+   void Lock() {
+      int error = pthread_mutex_lock(&_mutex);
+      PELMORA_VERIFY(0 == error);
+      PELMORA_VERIFY(0 == _owner);
+      _owner.store(pthread_self(), std::memory_order_relaxed);
+   }
+   void Unlock() {
+      PELMORA_VERIFY(IsLocked());
+      _owner.store(0, std::memory_order_relaxed);
+      int error = pthread_mutex_unlock(&_mutex);
+      PELMORA_VERIFY(0 == error);
+   }
+   // Whether the calling thread holds it.
+   bool IsLocked() const {
+      return _owner.load(std::memory_order_relaxed) == pthread_self();
+   }
+   pthread_mutex_t* GetNativeHandle() { return &_mutex; }
+
+private:
+   pthread_mutex_t _mutex = PTHREAD_MUTEX_INITIALIZER;
+   std::atomic<pthread_t> _owner{0};
+};
+
+class NativeSynchronized {
+public:
+   explicit NativeSynchronized(NativeMutex& mutex) : _mutex(mutex) { _mutex.Lock(); }
+   ~NativeSynchronized() { _mutex.Unlock(); }
+   NativeSynchronized(const NativeSynchronized&) = delete;
+   NativeSynchronized& operator=(const NativeSynchronized&) = delete;
+
+private:
+   NativeMutex& _mutex;
+};
+
+}  // namespace Pelmora::System

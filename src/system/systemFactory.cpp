@@ -1,0 +1,29 @@
+// The process-wide system factory.
+
+#include "pelmora/system/systemFactory.h"
+
+#include "src/system/backtracePosix.h"
+
+namespace Pelmora::System {
+
+namespace {
+
+class SystemFactoryImpl : public SystemFactory {
+public:
+   void CreateBacktrace(int skipFrames, Ref<Backtrace>& out) override {
+      // One more: this function. The barrier keeps this frame on the stack (no tail
+      // call), so that the count of frames to skip stays right.
+      CaptureBacktrace(skipFrames + 1, out);
+      asm volatile("" ::: "memory");
+   }
+};
+
+}  // namespace
+
+SystemFactory* GetSystemFactory() {
+   // Never destroyed: exceptions may be built during static destruction.
+   static SystemFactoryImpl* const factory = new SystemFactoryImpl();
+   return factory;
+}
+
+}  // namespace Pelmora::System
