@@ -5,6 +5,7 @@
 // NativeSynchronized locks one for the extent of a scope.
 
 #include <pthread.h>
+#include <time.h>
 
 #include <atomic>
 
@@ -32,8 +33,18 @@ public:
       PELMORA_VERIFY(0 == error);
    }
    // Whether the calling thread holds it.
-   bool IsLocked() const {
-      return _owner.load(std::memory_order_relaxed) == pthread_self();
+   bool IsLocked() const { return _owner.load(std::memory_order_relaxed) == pthread_self(); }
+   // Waits on `condition`, which releases the mutex meanwhile, until woken or (with a
+   // deadline on the condition's clock) until then. The caller holds the mutex and holds
+   // it again on return. Returns the system's result: 0, ETIMEDOUT or an error.
+   int WaitOn(pthread_cond_t* condition, const timespec* deadline = nullptr) {
+      PELMORA_VERIFY(IsLocked());
+      _owner.store(0, std::memory_order_relaxed);
+      int result = deadline ? pthread_cond_timedwait(condition, &_mutex, deadline)
+                            : pthread_cond_wait(condition, &_mutex);
+      PELMORA_VERIFY(0 == _owner);
+      _owner.store(pthread_self(), std::memory_order_relaxed);
+      return result;
    }
    pthread_mutex_t* GetNativeHandle() { return &_mutex; }
 

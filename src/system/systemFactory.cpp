@@ -3,6 +3,7 @@
 #include "pelmora/system/systemFactory.h"
 
 #include "src/system/backtracePosix.h"
+#include "src/system/systemImpl.h"
 
 namespace Pelmora::System {
 
@@ -16,6 +17,10 @@ public:
       CaptureBacktrace(skipFrames + 1, out);
       asm volatile("" ::: "memory");
    }
+   void CreateMutex(Ref<Mutex>& out) override { CreateMutexImpl(out); }
+   void CreateCondition(Ref<Condition>& out) override { CreateConditionPosix(out); }
+   void CreateRWLock(int mode, Ref<RWLock>& out) override { CreateRWLockImpl(mode, out); }
+   void CreateThreadControl(Ref<ThreadControl>& out) override { CreateThreadControlPosix(out); }
 };
 
 }  // namespace

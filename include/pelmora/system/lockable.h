@@ -1,0 +1,51 @@
+#pragma once
+// A Mutex is the library's non-recursive lock: relocking it from the thread that holds it
+// and unlocking it from another thread are panics, not deadlocks or silent errors.
+// LockableObjectImpl is the base of objects that are themselves lockable; it owns one
+// Mutex and forwards to it. Synchronized holds a lock for a scope. All thread-safe except
+// a Synchronized guard, which belongs to the scope that made it.
+
+#include "pelmora/object/ref.h"
+
+namespace Pelmora::System {
+
+class LockableObject : public virtual Object {
+public:
+   virtual void Lock() = 0;
+   virtual void Unlock() = 0;
+   // Whether the calling thread holds the lock; another thread holding it gives false.
+   virtual bool IsLocked() const = 0;
+};
+
+class Mutex : public virtual LockableObject {};
+
+class LockableObjectImpl : public virtual LockableObject, public ObjectImpl {
+public:
+   // With a new mutex from the system factory.
+   LockableObjectImpl();
+   // Shares `mutex` (an object locked together with another).
+   explicit LockableObjectImpl(Mutex* mutex);
+
+   void Lock() override;
+   void Unlock() override;
+   bool IsLocked() const override;
+
+   Mutex* GetMutex() const { return _mutex.Get(); }
+
+private:
+   Ref<Mutex> _mutex;
+};
+
+// Locks `lockable` until the end of the scope.
+class Synchronized {
+public:
+   explicit Synchronized(LockableObject* lockable) : _lockable(lockable) { _lockable->Lock(); }
+   ~Synchronized() { _lockable->Unlock(); }
+   Synchronized(const Synchronized&) = delete;
+   Synchronized& operator=(const Synchronized&) = delete;
+
+private:
+   LockableObject* _lockable;
+};
+
+}  // namespace Pelmora::System

@@ -1,0 +1,64 @@
+#pragma once
+// An RWLock lets many readers or one writer in. Each thread's holds are kept per thread,
+// so a reader may read-lock again without waiting behind a writer, and the Is...Locked
+// queries answer for the calling thread without locking. A reader may upgrade to the write
+// lock and a writer downgrade to a read hold. RWLockableObjectImpl is the base of objects
+// that are themselves reader/writer lockable; it owns one RWLock. Thread-safe.
+
+#include "pelmora/object/ref.h"
+
+namespace Pelmora::System {
+
+class RWLockableObject : public virtual Object {
+public:
+   enum LockMode {
+      // Readers enter while no writer holds the lock; writers may starve.
+      LOCK_MODE_DEFAULT = 0,
+      // A waiting writer (or upgrader) holds back new readers.
+      LOCK_MODE_WRITER_PRIORITY = 1,
+      // Accepted from older callers; behaves as LOCK_MODE_WRITER_PRIORITY.
+      LOCK_MODE_WRITER_PRIORITY_LEGACY = 2,
+   };
+
+   virtual void ReadLock() = 0;
+   // The calling thread must hold no read or write lock on it.
+   virtual void WriteLock() = 0;
+   // Releases one read hold or the write lock of the calling thread.
+   virtual void Unlock() = 0;
+   // With exactly one read hold: waits until the caller is the only reader and returns
+   // with the write lock. False at once when another upgrade is pending; the read hold
+   // is then kept (waiting would deadlock both).
+   virtual bool UpgradeReadLock() = 0;
+   // Turns the caller's write lock into one read hold.
+   virtual void DowngradeWriteLock() = 0;
+   // These three describe the calling thread's holds.
+   virtual bool IsReadLocked() const = 0;
+   virtual bool IsWriteLocked() const = 0;
+   virtual bool IsUnlocked() const = 0;
+};
+
+class RWLock : public virtual RWLockableObject {};
+
+class RWLockableObjectImpl : public virtual RWLockableObject, public ObjectImpl {
+public:
+   // With a new lock of `mode` from the system factory.
+   explicit RWLockableObjectImpl(int mode = LOCK_MODE_DEFAULT);
+   // Shares `lock`.
+   explicit RWLockableObjectImpl(RWLock* lock);
+
+   void ReadLock() override;
+   void WriteLock() override;
+   void Unlock() override;
+   bool UpgradeReadLock() override;
+   void DowngradeWriteLock() override;
+   bool IsReadLocked() const override;
+   bool IsWriteLocked() const override;
+   bool IsUnlocked() const override;
+
+   RWLock* GetRWLock() const { return _lock.Get(); }
+
+private:
+   Ref<RWLock> _lock;
+};
+
+}  // namespace Pelmora::System
