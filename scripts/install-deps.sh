@@ -7,7 +7,9 @@ packages=(
   g++ cmake ninja-build ccache pkg-config make
   libboost-dev libboost-regex-dev libboost-date-time-dev
   libexpat1-dev zlib1g-dev libssl-dev
-  libgtest-dev libgmock-dev libbenchmark-dev libfmt-dev
+  libgtest-dev libgmock-dev libbenchmark-dev libfmt-dev libxml2-dev libpugixml-dev
+  libspdlog-dev
+  prometheus  # promtool checks the metrics export in the tests
   clang libclang-rt-14-dev clang-format
 )
 

@@ -5,4 +5,5 @@
 #include "pelmora/formatter.h"
 #include "pelmora/io.h"
 #include "pelmora/object.h"
+#include "pelmora/perfCounter.h"
 #include "pelmora/system.h"

@@ -5,6 +5,7 @@
 #include <cstdlib>
 
 #include "pelmora/formatter/messageFormatter.h"
+#include "pelmora/perfCounter/lwStats.h"
 
 namespace Pelmora {
 
@@ -48,6 +49,21 @@ void ScoreboardHash2D::Serialize(std::string& out) const {
          out += "\n";
       }
    }
+}
+
+void ScoreboardHash2D::GetStats(PerfCounter::LwStatsBuilder& builder) {
+   static const PerfCounter::CounterFactory factory;
+   builder.Push("Scoreboard");
+   for (const Row& row : _rows) {
+      for (const Cell& cell : row.cells) {
+         const char* key = cell.key.load(std::memory_order_acquire);
+         if (!key) continue;
+         builder.Push("Class", key);
+         builder.Insert("Instances", cell.count.Read(), factory);
+         builder.Pop();
+      }
+   }
+   builder.Pop();
 }
 
 int ScoreboardHash2D::GetSize() const {

@@ -16,6 +16,7 @@ public:
    static constexpr int kRows = 2003;
    static constexpr int kCells = 8;
 
+   void GetStats(PerfCounter::LwStatsBuilder& builder) override;
    void Increment(const char* name) override { Add(name, 1); }
    void Decrement(const char* name) override { Add(name, -1); }
    void Add(const char* name, int delta);

@@ -8,11 +8,14 @@
 #include <unordered_set>
 
 #include "pelmora/object/ref.h"
+#include "pelmora/perfCounter/lwStatsProvider.h"
 
 namespace Pelmora {
 
-class Scoreboard {
+class Scoreboard : public PerfCounter::LwStatsProvider {
 public:
+   // Reports each counted class as Scoreboard/Class='<mangled name>'/Instances.
+   void GetStats(PerfCounter::LwStatsBuilder& builder) override = 0;
    virtual void Increment(const char* name) = 0;
    virtual void Decrement(const char* name) = 0;
    // One line "(row, cell) => name - count" per counted class.

@@ -1,0 +1,327 @@
+// The registry in the Prometheus text exposition format 0.0.4; the naming rule is in the
+// public header.
+
+#include "pelmora/perfCounter/prometheus.h"
+
+#include <charconv>
+#include <initializer_list>
+#include <map>
+#include <optional>
+#include <string_view>
+#include <unordered_map>
+#include <unordered_set>
+
+#include "pelmora/perfCounter/meter.h"
+
+namespace Pelmora::PerfCounter {
+
+namespace {
+
+using Labels = std::vector<std::pair<std::string, std::string>>;
+
+struct MappedPath {
+   std::string name;
+   Labels labels;
+   std::string pattern;  // the path with label values shown as '*'
+};
+
+bool IsNameStart(char c) { return (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || c == '_'; }
+bool IsNameChar(char c) { return IsNameStart(c) || (c >= '0' && c <= '9'); }
+
+// Name='value' with a usable label name; `quantile` belongs to summaries.
+bool AsLabel(std::string_view part, std::string& name, std::string& value) {
+   size_t equals = part.find("='");
+   if (equals == std::string_view::npos || equals == 0 || part.size() < equals + 3 ||
+       part.back() != '\'') {
+      return false;
+   }
+   std::string_view labelName = part.substr(0, equals);
+   if (!IsNameStart(labelName[0]) || labelName.substr(0, 2) == "__" || labelName == "quantile") {
+      return false;
+   }
+   for (char c : labelName) {
+      if (!IsNameChar(c)) return false;
+   }
+   name = std::string(labelName);
+   value = std::string(part.substr(equals + 2, part.size() - equals - 3));
+   return true;
+}
+
+// Fills `mapped` (reused across counters to keep its buffers).
+void MapPath(std::string_view path, MappedPath& mapped) {
+   mapped.name.clear();
+   mapped.labels.clear();
+   mapped.pattern.clear();
+   std::string labelName, labelValue;
+   for (size_t start = 1; start <= path.size();) {
+      size_t slash = path.find('/', start);
+      // The last component names the measurement and is never a label.
+      bool last = slash == std::string_view::npos;
+      if (last) slash = path.size();
+      std::string_view part = path.substr(start, slash - start);
+      start = slash + 1;
+      if (!last && AsLabel(part, labelName, labelValue)) {
+         bool taken = false;
+         for (const auto& label : mapped.labels) taken = taken || label.first == labelName;
+         if (!taken) {
+            mapped.pattern += '/';
+            mapped.pattern += labelName;
+            mapped.pattern += "='*'";
+            mapped.labels.emplace_back(std::move(labelName), std::move(labelValue));
+            continue;
+         }
+      }
+      mapped.pattern += '/';
+      mapped.pattern += part;
+      if (!mapped.name.empty()) mapped.name += '_';
+      for (char c : part) mapped.name += IsNameChar(c) ? c : '_';
+   }
+   if (mapped.name.empty() || (mapped.name[0] >= '0' && mapped.name[0] <= '9')) {
+      mapped.name.insert(mapped.name.begin(), '_');
+   }
+}
+
+void AppendEscaped(std::string& out, std::string_view text, bool quotes) {
+   for (char c : text) {
+      if (c == '\\') {
+         out += "\\\\";
+      } else if (c == '\n') {
+         out += "\\n";
+      } else if (c == '"' && quotes) {
+         out += "\\\"";
+      } else {
+         out += c;
+      }
+   }
+}
+
+// `base` followed by the label set, with one extra label when `extraName` is given.
+std::string SeriesName(std::string_view base, const Labels& labels,
+                       const char* extraName = nullptr, const char* extraValue = nullptr) {
+   std::string text(base);
+   if (labels.empty() && !extraName) return text;
+   text += '{';
+   bool first = true;
+   for (const auto& [name, value] : labels) {
+      if (!first) text += ',';
+      first = false;
+      text += name;
+      text += "=\"";
+      AppendEscaped(text, value, true);
+      text += '"';
+   }
+   if (extraName) {
+      if (!first) text += ',';
+      text += extraName;
+      text += "=\"";
+      text += extraValue;
+      text += '"';
+   }
+   text += '}';
+   return text;
+}
+
+struct Series {
+   std::string name;  // the sample's metric name with labels
+   long long value;
+   bool nan;  // the value is not a number: a meter without samples
+};
+
+struct Family {
+   const char* type;
+   std::string help;
+   std::vector<Series> series;
+};
+
+// The families being built, and who owns each sample name so that a family of another
+// type cannot claim it.
+class Exposition {
+public:
+   // Whether `family` of `type` may take `sampleNames`: no family of that name has another
+   // type and no other family owns one of the names.
+   bool CanAdd(const std::string& family, const char* type,
+               std::initializer_list<const std::string*> sampleNames) const {
+      auto existing = _families.find(family);
+      if (existing != _families.end() && existing->second.type != type) return false;
+      for (const std::string* sample : sampleNames) {
+         auto owner = _owners.find(*sample);
+         if (owner != _owners.end() && *owner->second != family) return false;
+      }
+      return true;
+   }
+
+   // Adds the series of one family if nothing clashes; all or nothing. The help text,
+   // `helpPrefix` and `pattern`, is kept from the family's first series.
+   bool Add(const std::string& family, const char* type, const char* helpPrefix,
+            const std::string& pattern, std::initializer_list<const std::string*> sampleNames,
+            std::vector<Series>& series) {
+      if (!CanAdd(family, type, sampleNames)) return false;
+      for (const Series& s : series) {
+         if (_seriesNames.count(s.name)) return false;
+      }
+      auto [entry, added] = _families.try_emplace(family);
+      Family& target = entry->second;
+      if (added) {
+         target.type = type;
+         target.help = helpPrefix;
+         target.help += pattern;
+      }
+      for (const std::string* sample : sampleNames) _owners.try_emplace(*sample, &entry->first);
+      for (Series& s : series) {
+         _seriesNames.insert(s.name);
+         target.series.push_back(std::move(s));
+      }
+      return true;
+   }
+
+   void Write(Writer* writer) const {
+      std::string text;
+      text.reserve(kFlushSize + 4096);
+      char number[24];
+      for (const auto& [name, family] : _families) {
+         text += "# HELP ";
+         text += name;
+         text += ' ';
+         AppendEscaped(text, family.help, false);
+         text += "\n# TYPE ";
+         text += name;
+         text += ' ';
+         text += family.type;
+         text += '\n';
+         for (const Series& s : family.series) {
+            text += s.name;
+            text += ' ';
+            if (s.nan) {
+               text += "NaN";
+            } else {
+               char* end = std::to_chars(number, number + sizeof number, s.value).ptr;
+               text.append(number, static_cast<size_t>(end - number));
+            }
+            text += '\n';
+         }
+         if (text.size() >= kFlushSize) Flush(writer, text);
+      }
+      Flush(writer, text);
+   }
+
+private:
+   static constexpr size_t kFlushSize = 64 * 1024;
+
+   static void Flush(Writer* writer, std::string& text) {
+      if (!text.empty()) writer->Write(text.data(), static_cast<int>(text.size()));
+      text.clear();
+   }
+
+   std::map<std::string, Family> _families;
+   // Sample name to the name of the family that owns it (a key of _families).
+   std::unordered_map<std::string, const std::string*> _owners;
+   std::unordered_set<std::string> _seriesNames;
+};
+
+const char* const kSummary = "summary";
+const char* const kGauge = "gauge";
+const char* const kCounter = "counter";
+
+struct MeterParts {
+   std::string path;
+   std::optional<long long> fields[Meter::kCounterCount];
+};
+
+void AddMeter(Exposition& out, const MeterParts& meter, MappedPath& mapped) {
+   MapPath(meter.path, mapped);
+   const std::string& name = mapped.name;
+   const auto& fields = meter.fields;
+   bool empty = fields[Meter::COUNTER_NUM_SAMPLES] && *fields[Meter::COUNTER_NUM_SAMPLES] == 0;
+   auto series = [&](std::string seriesName, Meter::Counter c) {
+      return Series{std::move(seriesName), *fields[c],
+                    empty && c != Meter::COUNTER_TOTAL && c != Meter::COUNTER_NUM_SAMPLES};
+   };
+   std::vector<Series> summary;
+   if (fields[Meter::COUNTER_MIN]) {
+      summary.push_back(series(SeriesName(name, mapped.labels, "quantile", "0"), Meter::COUNTER_MIN));
+   }
+   if (fields[Meter::COUNTER_MAX]) {
+      summary.push_back(series(SeriesName(name, mapped.labels, "quantile", "1"), Meter::COUNTER_MAX));
+   }
+   const std::string sumName = name + "_sum", countName = name + "_count";
+   if (fields[Meter::COUNTER_TOTAL]) {
+      summary.push_back(series(SeriesName(sumName, mapped.labels), Meter::COUNTER_TOTAL));
+   }
+   if (fields[Meter::COUNTER_NUM_SAMPLES]) {
+      summary.push_back(series(SeriesName(countName, mapped.labels), Meter::COUNTER_NUM_SAMPLES));
+   }
+   const std::string meanName = name + "_mean";
+   bool hasMean = fields[Meter::COUNTER_MEAN].has_value();
+   if (hasMean && !out.CanAdd(meanName, kGauge, {&meanName})) return;
+   if (!summary.empty() &&
+       !out.Add(name, kSummary, "Meter ", mapped.pattern, {&name, &sumName, &countName}, summary)) {
+      return;
+   }
+   if (hasMean) {
+      std::vector<Series> mean;
+      mean.push_back(series(SeriesName(meanName, mapped.labels), Meter::COUNTER_MEAN));
+      out.Add(meanName, kGauge, "Mean of meter ", mapped.pattern, {&meanName}, mean);
+   }
+}
+
+void AddCounter(Exposition& out, const QueryResult& result, MappedPath& mapped,
+                std::vector<Series>& scratch) {
+   MapPath(result.metadata->GetName(), mapped);
+   bool isCounter = result.metadata->GetType() == Metadata::TYPE_COUNTER;
+   scratch.clear();
+   scratch.push_back({SeriesName(mapped.name, mapped.labels), result.value.Get(), false});
+   out.Add(mapped.name, isCounter ? kCounter : kGauge, isCounter ? "Counter " : "Gauge ",
+           mapped.pattern, {&mapped.name}, scratch);
+}
+
+bool IsMeterField(Metadata::Type type) {
+   return type >= Metadata::TYPE_METER_TOTAL && type <= Metadata::TYPE_METER_MEAN;
+}
+
+}  // namespace
+
+void WritePrometheusText(Registry* registry, Writer* writer) {
+   QueryResults results;
+   registry->CollectAll(results);
+
+   // Counters in name order; a meter takes the place of its first field.
+   struct Item {
+      const QueryResult* counter = nullptr;
+      size_t meter = 0;  // index into meters
+   };
+   std::vector<Item> items;
+   items.reserve(results.size());
+   std::vector<MeterParts> meters;
+   std::unordered_map<std::string_view, size_t> meterIndex;
+   for (const QueryResult& result : results) {
+      const std::string& name = result.metadata->GetName();
+      Metadata::Type type = result.metadata->GetType();
+      size_t slash = name.rfind('/');
+      if (!IsMeterField(type) || slash == 0) {
+         items.push_back({&result, 0});
+         continue;
+      }
+      std::string_view base(name.data(), slash);
+      auto [it, added] = meterIndex.try_emplace(base, meters.size());
+      if (added) {
+         meters.emplace_back();
+         meters.back().path = std::string(base);
+         items.push_back({nullptr, it->second});
+      }
+      meters[it->second].fields[type - Metadata::TYPE_METER_TOTAL] = result.value.Get();
+   }
+
+   Exposition exposition;
+   MappedPath mapped;
+   std::vector<Series> scratch;
+   for (const Item& item : items) {
+      if (item.counter) {
+         AddCounter(exposition, *item.counter, mapped, scratch);
+      } else {
+         AddMeter(exposition, meters[item.meter], mapped);
+      }
+   }
+   exposition.Write(writer);
+}
+
+}  // namespace Pelmora::PerfCounter
