@@ -7,3 +7,4 @@
 #include "pelmora/object.h"
 #include "pelmora/perfCounter.h"
 #include "pelmora/system.h"
+#include "pelmora/xml.h"

@@ -119,6 +119,7 @@ public:
 class InvalidStateException : public Exception {
 public:
    InvalidStateException() : Exception("Invalid state") {}
+   explicit InvalidStateException(const std::string& message) : Exception(message) {}
    PELMORA_EXCEPTION_CLONE(InvalidStateException)
 };
 

@@ -62,9 +62,13 @@ public:
    PrintFormatter(const Object& value, const char* option = nullptr);
    PrintFormatter(const std::exception& value, const char* option = nullptr);
    PrintFormatter(const Throwable& value, const char* option = nullptr);
+   // An XML node writes its compact serialisation.
+   PrintFormatter(const Xml::Node* value, const char* option = nullptr);
+   PrintFormatter(const Xml::Node& value, const char* option = nullptr);
+   // Picks the node form for references to XML nodes, the object form for the rest.
    template <class T>
    PrintFormatter(const Ref<T>& value, const char* option = nullptr)
-      : PrintFormatter(static_cast<const Object*>(value.Get()), option) {}
+      : PrintFormatter(static_cast<const T*>(value.Get()), option) {}
 
    void Print(Writer* writer) const { _function(writer, _value, _option); }
    // Appends what Print would write to `out`.
@@ -85,6 +89,7 @@ public:
    static void FormatObject(Writer*, const FormatValue&, const char* option);
    static void FormatException(Writer*, const FormatValue&, const char* option);
    static void FormatThrowable(Writer*, const FormatValue&, const char* option);
+   static void FormatXmlNode(Writer*, const FormatValue&, const char* option);
 
 protected:
    PrintFormatter(FormatValue value, const char* option, FormatFunction function)

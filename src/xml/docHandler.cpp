@@ -1,0 +1,196 @@
+// The standard handler: builds the document from the parser's events, merging adjacent
+// character data, and enforces the size, node and depth limits on restricted documents.
+
+#include <cstdint>
+#include <cstring>
+#include <initializer_list>
+#include <memory>
+#include <utility>
+#include <vector>
+
+#include "pelmora/exception/panic.h"
+#include "pelmora/xml/parser.h"
+#include "src/xml/nodeArena.h"
+#include "src/xml/nodeImpl.h"
+#include "src/xml/xmlLog.h"
+
+namespace Pelmora::Xml {
+namespace {
+
+// One limit as the configuration gives it. The application carries no configuration yet,
+// so each key answers its default; the configuration's 64-bit getter belongs here, and
+// only here, once it exists.
+long long ReadLimit(const char* key, long long def) {
+   PELMORA_VERIFY(def >= 0);
+   static_cast<void>(key);
+   long long out = def;
+   PELMORA_VERIFY(out >= 0);
+   return out;
+}
+
+// The limits of handlers created without explicit ones, read when each handler is made.
+DocLimits ReadDocLimits() {
+   const DocLimits defaults;
+   DocLimits limits;
+   limits.maxChars = ReadLimit("pelmora/xml/doc/maxChars", defaults.maxChars);
+   limits.maxNodes = ReadLimit("pelmora/xml/doc/maxNodes", defaults.maxNodes);
+   limits.maxDepth = ReadLimit("pelmora/xml/doc/maxDepth", defaults.maxDepth);
+   return limits;
+}
+
+// Limits given by the caller stand where configured values would.
+void VerifyLimits(const DocLimits& limits) {
+   for (long long out : {limits.maxChars, limits.maxNodes, limits.maxDepth})
+      PELMORA_VERIFY(out >= 0);
+}
+
+class XMLDocHandlerImpl final : public virtual XMLHandler, public ObjectImpl {
+public:
+   explicit XMLDocHandlerImpl(const DocLimits& limits)
+       : _maxChars(static_cast<uint64_t>(limits.maxChars)),
+         _maxNodes(static_cast<uint64_t>(limits.maxNodes)),
+         _maxDepth(static_cast<uint64_t>(limits.maxDepth)) {
+      VerifyLimits(limits);
+   }
+
+   void StartNewDocument(Ref<Object>& result) override { StartNewDocument(false, result); }
+
+   ~XMLDocHandlerImpl() override { ReleaseArena(); }
+
+   void StartNewDocument(bool restricted, Ref<Object>& result) override {
+      _stack.clear();
+      _bytes = 0;
+      _nodes = 0;
+      _restricted = restricted;
+      ReleaseArena();
+      _arena = new NodeArena();
+      _document = new (_arena) DocumentImpl();
+      _stack.push_back(_document.Get());
+      result = _document.Get();
+   }
+
+   void CleanUpDocument() override {
+      _stack.clear();
+      _document.Reset();
+      ReleaseArena();
+   }
+
+   void OnStartElement(const std::string& name, int line, int column,
+                       const char** attributes) override {
+      IncNodeCountAndValidate(name.size());
+      std::unique_ptr<ElementNodeImpl> element(new (_arena) ElementNodeImpl(name, line, column));
+      for (const char** attribute = attributes; *attribute; attribute += 2)
+         ValidateByteCount(std::strlen(attribute[0]) + std::strlen(attribute[1]));
+      element->DefineParsedAttributes(attributes);
+      Push(std::move(element));
+   }
+
+   void OnEndElement(const std::string&) override { Pop(); }
+
+   void OnCharacters(const char* data, int length) override {
+      // Expat splits character data at line ends and references: one text node takes all.
+      NodeImpl* last = _stack.back()->LastChildImpl();
+      if (last && last->GetNodeType() == kTextNode) {
+         ValidateByteCount(static_cast<uint64_t>(length));
+         static_cast<TextNodeImpl*>(last)->AppendText(data, length);
+         return;
+      }
+      IncNodeCountAndValidate(static_cast<uint64_t>(length));
+      AppendLeaf(std::unique_ptr<TextNodeImpl>(new (_arena) TextNodeImpl(data, length)));
+   }
+
+   void OnStartCData() override {
+      IncNodeCountAndValidate(0);
+      Push(std::unique_ptr<CDataNodeImpl>(new (_arena) CDataNodeImpl()));
+   }
+
+   void OnEndCData() override { Pop(); }
+
+   // Comments and processing instructions hold text too, so their bytes count as well.
+   void OnComment(const std::string& text) override {
+      IncNodeCountAndValidate(text.size());
+      AppendLeaf(std::unique_ptr<CommentNodeImpl>(new (_arena) CommentNodeImpl(text)));
+   }
+
+   void OnProcessingInstruction(const std::string& target, const std::string& data) override {
+      IncNodeCountAndValidate(target.size() + data.size());
+      AppendLeaf(std::unique_ptr<ProcessingInstructionNodeImpl>(
+          new (_arena) ProcessingInstructionNodeImpl(target, data)));
+   }
+
+   void OnXMLDeclaration(const std::string& version, const std::string& encoding, int) override {
+      _document->SetXMLVersion(version);
+      _document->SetEncoding(encoding);
+   }
+
+private:
+   // Appends `node` to the top node and makes it the top. Until the tree holds it, the
+   // node is owned here, so a refused insertion frees it.
+   template <class T>
+   void Push(std::unique_ptr<T> node) {
+      NodeImpl* added = node.get();
+      _stack.back()->AppendChildImpl(added);
+      static_cast<void>(node.release());  // the tree holds it now
+      _stack.push_back(added);
+      if (_restricted && _stack.size() > _maxDepth) {
+         LogXml(kXmlLogWarning, "XML document too deep: %1 (max: %2)", _stack.size(), _maxDepth);
+         throw ParsingAbortedException();
+      }
+   }
+
+   void Pop() {
+      PELMORA_VERIFY(_stack.size() > 1);
+      _stack.pop_back();
+   }
+
+   template <class T>
+   void AppendLeaf(std::unique_ptr<T> node) {
+      Push(std::move(node));
+      Pop();
+   }
+
+   void ValidateByteCount(uint64_t bytes) {
+      _bytes += bytes;
+      if (_restricted && _bytes > _maxChars) {
+         LogXml(kXmlLogWarning, "XML document too long: %1 (max: %2)", _bytes, _maxChars);
+         throw ParsingAbortedException();
+      }
+   }
+
+   void IncNodeCountAndValidate(uint64_t bytes) {
+      ValidateByteCount(bytes);
+      ++_nodes;
+      if (_restricted && _nodes > _maxNodes) {
+         LogXml(kXmlLogWarning, "XML document has too many nodes: %1 (max: %2)", _nodes, _maxNodes);
+         throw ParsingAbortedException();
+      }
+   }
+
+   // The nodes that remain keep the arena alive; the handler only stops allocating from it.
+   void ReleaseArena() {
+      if (_arena) std::exchange(_arena, nullptr)->Release();
+   }
+
+   // Open nodes, the document at the bottom. A vector keeps its capacity between documents.
+   std::vector<NodeImpl*> _stack;
+   uint64_t _maxChars;
+   uint64_t _maxNodes;
+   uint64_t _maxDepth;
+   bool _restricted = false;
+   uint64_t _bytes = 0;
+   uint64_t _nodes = 0;
+   Ref<DocumentImpl> _document;
+   NodeArena* _arena = nullptr;
+};
+
+}  // namespace
+
+void CreateXMLDocumentHandler(Ref<XMLHandler>& out) {
+   out = new XMLDocHandlerImpl(ReadDocLimits());
+}
+
+void CreateXMLDocumentHandler(const DocLimits& limits, Ref<XMLHandler>& out) {
+   out = new XMLDocHandlerImpl(limits);
+}
+
+}  // namespace Pelmora::Xml

@@ -1,0 +1,199 @@
+// The glue to expat: one expat parser per XMLParser, reset before every document, fed in
+// fixed blocks; its callbacks forwarded to the handler under a guard, since no exception
+// may cross expat's C frames. Entity declarations are refused in restricted parses.
+
+#include <expat.h>
+
+#include <climits>
+#include <cstddef>
+
+#include "pelmora/exception/exceptions.h"
+#include "pelmora/exception/panic.h"
+#include "pelmora/io/readers.h"
+#include "pelmora/xml/parser.h"
+#include "src/xml/xmlLog.h"
+
+namespace Pelmora::Xml {
+namespace {
+
+// Bytes read from the reader and handed to expat at a time.
+constexpr int kBlockSize = 10240;
+
+class XMLParserImpl final : public virtual XMLParser, public ObjectImpl {
+public:
+   explicit XMLParserImpl(XMLHandler* handler) {
+      SetXMLHandler(handler);
+      // No namespace separator: names arrive as written and the DOM splits them.
+      _parser = XML_ParserCreate_MM(nullptr, nullptr, nullptr);
+      if (!_parser) System::ThrowSystemMemoryException();
+      InstallCallbacks();
+   }
+
+   ~XMLParserImpl() override { XML_ParserFree(_parser); }
+
+   void SetXMLHandler(XMLHandler* handler) override {
+      PELMORA_VERIFY(handler != NULL);
+      _handler = handler;
+   }
+
+   XMLHandler* GetXMLHandler() const override { return _handler.Get(); }
+
+   void Parse(Reader* reader, bool restricted, Ref<Object>& result) override;
+
+   void Parse(const std::string& text, bool restricted, Ref<Object>& result) override {
+      if (text.size() > static_cast<size_t>(INT_MAX)) throw InvalidArgumentException("text");
+      Ref<StringReader> reader;
+      CreateStringReader(text.data(), static_cast<int>(text.size()), reader);
+      Parse(reader.Get(), restricted, result);
+   }
+
+   void Parse(Reader* reader, Ref<Object>& result) override { Parse(reader, false, result); }
+
+   void Parse(const std::string& text, Ref<Object>& result) override { Parse(text, false, result); }
+
+private:
+   // Runs the handler's CleanUpDocument when the parse ends, whichever way.
+   class CleanUpGuard {
+   public:
+      explicit CleanUpGuard(XMLHandler* handler) : _handler(handler) {}
+      ~CleanUpGuard() {
+         try {
+            _handler->CleanUpDocument();
+         } catch (...) {
+            // Already leaving with the parse's own outcome; that one is what counts.
+         }
+      }
+      CleanUpGuard(const CleanUpGuard&) = delete;
+      CleanUpGuard& operator=(const CleanUpGuard&) = delete;
+
+   private:
+      XMLHandler* _handler;
+   };
+
+   void InstallCallbacks();
+   [[noreturn]] void ThrowParseError();
+
+   // Calls the handler; any failure stops expat, so that the pending XML_Parse fails.
+   // Events expat still delivers after the stop are dropped.
+   template <class Event>
+   void Forward(Event&& event) noexcept {
+      if (_stopped) return;
+      try {
+         event(_handler.Get());
+      } catch (const ParsingAbortedException&) {
+         Stop();  // the handler has logged why
+      } catch (const Throwable& e) {
+         LogXml(kXmlLogError, "Unexpected exception parsing XML document: %1", e);
+         Stop();
+      } catch (...) {
+         LogXml(kXmlLogError, "Unknown exception parsing XML document");
+         Stop();
+      }
+   }
+
+   void Stop() {
+      _stopped = true;
+      XML_StopParser(_parser, XML_FALSE);
+   }
+
+   static XMLParserImpl* Self(void* userData) { return static_cast<XMLParserImpl*>(userData); }
+
+   static void XMLCALL StartElement(void* userData, const XML_Char* name, const XML_Char** atts) {
+      XMLParserImpl* self = Self(userData);
+      int line = static_cast<int>(XML_GetCurrentLineNumber(self->_parser));
+      int column = static_cast<int>(XML_GetCurrentColumnNumber(self->_parser));
+      self->Forward([&](XMLHandler* h) { h->OnStartElement(name, line, column, atts); });
+   }
+   static void XMLCALL EndElement(void* userData, const XML_Char* name) {
+      Self(userData)->Forward([&](XMLHandler* h) { h->OnEndElement(name); });
+   }
+   static void XMLCALL Characters(void* userData, const XML_Char* data, int length) {
+      Self(userData)->Forward([&](XMLHandler* h) { h->OnCharacters(data, length); });
+   }
+   static void XMLCALL ProcessingInstruction(void* userData, const XML_Char* target,
+                                             const XML_Char* data) {
+      Self(userData)->Forward([&](XMLHandler* h) { h->OnProcessingInstruction(target, data); });
+   }
+   static void XMLCALL Comment(void* userData, const XML_Char* text) {
+      Self(userData)->Forward([&](XMLHandler* h) { h->OnComment(text); });
+   }
+   static void XMLCALL StartCData(void* userData) {
+      Self(userData)->Forward([](XMLHandler* h) { h->OnStartCData(); });
+   }
+   static void XMLCALL EndCData(void* userData) {
+      Self(userData)->Forward([](XMLHandler* h) { h->OnEndCData(); });
+   }
+   static void XMLCALL XmlDeclaration(void* userData, const XML_Char* version,
+                                      const XML_Char* encoding, int standalone) {
+      Self(userData)->Forward([&](XMLHandler* h) {
+         h->OnXMLDeclaration(version ? version : "", encoding ? encoding : "", standalone);
+      });
+   }
+   static void XMLCALL EntityDeclaration(void* userData, const XML_Char* entityName, int,
+                                         const XML_Char*, int, const XML_Char*, const XML_Char*,
+                                         const XML_Char*, const XML_Char*) {
+      XMLParserImpl* self = Self(userData);
+      // Untrusted input may not define entities: expansion is the classic amplifier.
+      if (!self->_restricted || self->_stopped) return;
+      LogXml(kXmlLogError,
+             "XML entity \"%1\" was defined in the input.\n"
+             "The parser is configured to reject XML entity definitions.",
+             entityName);
+      self->Stop();
+   }
+
+   Ref<XMLHandler> _handler;
+   XML_Parser _parser = nullptr;
+   bool _restricted = false;
+   bool _stopped = false;
+};
+
+void XMLParserImpl::InstallCallbacks() {
+   XML_SetUserData(_parser, this);
+   XML_SetElementHandler(_parser, StartElement, EndElement);
+   XML_SetProcessingInstructionHandler(_parser, ProcessingInstruction);
+   XML_SetCdataSectionHandler(_parser, StartCData, EndCData);
+   XML_SetCommentHandler(_parser, Comment);
+   XML_SetCharacterDataHandler(_parser, Characters);
+   XML_SetXmlDeclHandler(_parser, XmlDeclaration);
+   XML_SetEntityDeclHandler(_parser, EntityDeclaration);
+}
+
+void XMLParserImpl::ThrowParseError() {
+   const XML_LChar* text = XML_ErrorString(XML_GetErrorCode(_parser));
+   throw XMLParseException(text ? text : "Unknown XML_Parse failure",
+                           static_cast<int>(XML_GetCurrentLineNumber(_parser)));
+}
+
+void XMLParserImpl::Parse(Reader* reader, bool restricted, Ref<Object>& result) {
+   PELMORA_VERIFY(reader != NULL);
+   // The reset clears the callbacks too.
+   XML_ParserReset(_parser, nullptr);
+   InstallCallbacks();
+   _restricted = restricted;
+   _stopped = false;
+
+   // A handler replaced during the parse must outlive it.
+   Ref<XMLHandler> handler = _handler;
+   CleanUpGuard cleanUp(handler.Get());
+   Ref<Object> document;
+   handler->StartNewDocument(restricted, document);
+
+   char buffer[kBlockSize];
+   for (;;) {
+      int length = reader->Read(buffer, kBlockSize);
+      bool last = length < 0;
+      if (last) length = 0;
+      if (XML_Parse(_parser, buffer, length, last) != XML_STATUS_OK) ThrowParseError();
+      if (last) break;
+   }
+   result = document;
+}
+
+}  // namespace
+
+void CreateXMLParser(XMLHandler* handler, Ref<XMLParser>& out) {
+   out = new XMLParserImpl(handler);
+}
+
+}  // namespace Pelmora::Xml

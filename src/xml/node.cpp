@@ -1,0 +1,393 @@
+// The tree links, the insertion rules of each node kind, element names and attributes,
+// and the factories.
+
+#include <algorithm>
+#include <cstddef>
+#include <vector>
+
+#include "pelmora/exception/exceptions.h"
+#include "pelmora/exception/panic.h"
+#include "src/xml/nodeImpl.h"
+
+namespace Pelmora::Xml {
+
+// ---- NodeImpl ----
+
+NodeImpl::~NodeImpl() {
+   if (!_firstChild) return;
+   // A child that dies with this node hands its own children to this loop before it goes,
+   // so a deep tree is released with a flat work list instead of one frame per level.
+   std::vector<NodeImpl*> orphans;
+   for (NodeImpl* node = this;;) {
+      for (NodeImpl* child = node->_firstChild; child;) {
+         NodeImpl* next = child->_nextSibling;
+         child->_parent = child->_nextSibling = child->_prevSibling = nullptr;
+         orphans.push_back(child);
+         child = next;
+      }
+      node->_firstChild = node->_lastChild = nullptr;
+      if (node != this) node->DecRef();
+
+      node = nullptr;
+      while (!orphans.empty() && !node) {
+         NodeImpl* orphan = orphans.back();
+         orphans.pop_back();
+         // Still referenced elsewhere: it keeps its subtree and merely loses its parent.
+         if (orphan->GetRefCount() == 1 && orphan->_firstChild) {
+            node = orphan;
+         } else {
+            orphan->DecRef();
+         }
+      }
+      if (!node) return;
+   }
+}
+
+Node* NodeImpl::GetParent() const {
+   return _parent;
+}
+Node* NodeImpl::GetFirstChild() const {
+   return _firstChild;
+}
+Node* NodeImpl::GetLastChild() const {
+   return _lastChild;
+}
+Node* NodeImpl::GetNextSibling() const {
+   return _nextSibling;
+}
+Node* NodeImpl::GetPrevSibling() const {
+   return _prevSibling;
+}
+
+NodeImpl* NodeImpl::FromNode(Node* node) {
+   NodeImpl* impl = dynamic_cast<NodeImpl*>(node);
+   PELMORA_VERIFY(impl != NULL);
+   return impl;
+}
+
+const NodeImpl* NodeImpl::FromNode(const Node* node) {
+   const NodeImpl* impl = dynamic_cast<const NodeImpl*>(node);
+   PELMORA_VERIFY(impl != NULL);
+   return impl;
+}
+
+void NodeImpl::VerifyFree() const {
+   PELMORA_VERIFY(GetParent() == NULL);
+   PELMORA_VERIFY(GetNextSibling() == NULL);
+}
+
+void NodeImpl::VerifyInsert(Node* node, Node* pos, bool hasPos) {
+   PELMORA_VERIFY(node != NULL);
+   VerifyInsertAllowed(node);
+   if (hasPos) {
+      PELMORA_VERIFY(pos != NULL);
+      PELMORA_VERIFY(pos->GetParent() == this);
+   }
+   // A free node that is the top of this node's own tree would close a cycle.
+   const NodeImpl* top = this;
+   while (top->_parent) top = top->_parent;
+   PELMORA_VERIFY(top != FromNode(node));
+}
+
+void NodeImpl::Insert(NodeImpl* child, NodeImpl* before) {
+   child->VerifyFree();
+   child->IncRef();
+   child->_parent = this;
+   child->_nextSibling = before;
+   child->_prevSibling = before ? before->_prevSibling : _lastChild;
+   if (child->_prevSibling) {
+      child->_prevSibling->_nextSibling = child;
+   } else {
+      _firstChild = child;
+   }
+   if (before) {
+      before->_prevSibling = child;
+   } else {
+      _lastChild = child;
+   }
+   PostInsertProcessing(child);
+}
+
+void NodeImpl::AppendChild(Node* node) {
+   VerifyInsert(node, nullptr, false);
+   Insert(FromNode(node), nullptr);
+}
+
+void NodeImpl::InsertAfterChild(Node* node, Node* pos) {
+   VerifyInsert(node, pos, true);
+   Insert(FromNode(node), FromNode(pos)->_nextSibling);
+}
+
+void NodeImpl::InsertBeforeChild(Node* node, Node* pos) {
+   VerifyInsert(node, pos, true);
+   Insert(FromNode(node), FromNode(pos));
+}
+
+void NodeImpl::RemoveChild(Node* node) {
+   PELMORA_VERIFY(node != NULL);
+   PELMORA_VERIFY(node->GetParent() == this);
+   NodeImpl* child = FromNode(node);
+   if (child->_prevSibling) {
+      child->_prevSibling->_nextSibling = child->_nextSibling;
+   } else {
+      _firstChild = child->_nextSibling;
+   }
+   if (child->_nextSibling) {
+      child->_nextSibling->_prevSibling = child->_prevSibling;
+   } else {
+      _lastChild = child->_prevSibling;
+   }
+   child->_parent = child->_nextSibling = child->_prevSibling = nullptr;
+   PostRemoveProcessing(child);
+   child->DecRef();
+}
+
+// ---- DocumentImpl ----
+
+ElementNode* DocumentImpl::GetRoot() const {
+   return _root.Get();
+}
+
+void DocumentImpl::SetRoot(ElementNode* root) {
+   Ref<ElementNodeImpl> old = _root;
+   if (old.Get() == root) return;
+   NodeImpl* next = nullptr;
+   if (old) {
+      next = old->NextSiblingImpl();
+      RemoveChild(old.Get());
+   }
+   if (!root) return;
+   if (next) {
+      InsertBeforeChild(root, next);
+   } else {
+      AppendChild(root);
+   }
+}
+
+void DocumentImpl::VerifyInsertAllowed(Node* child) const {
+   switch (child->GetNodeType()) {
+      case kElementNode:
+         if (_root) throw InvalidArgumentException("Document's Root Element Node already set");
+         break;
+      case kCDataNode:
+         throw InvalidArgumentException("DocumentNode cannot have CData node children");
+      case kTextNode:
+         throw InvalidArgumentException("DocumentNode cannot have text node children");
+      case kDocumentNode:
+         throw InvalidArgumentException("DocumentNode cannot have document node as child");
+      default:
+         break;
+   }
+}
+
+void DocumentImpl::PostInsertProcessing(NodeImpl* child) {
+   if (child->GetNodeType() != kElementNode) return;
+   PELMORA_VERIFY(_root == NULL);
+   _root = static_cast<ElementNodeImpl*>(child);
+}
+
+void DocumentImpl::PostRemoveProcessing(NodeImpl* child) {
+   if (child->GetNodeType() != kElementNode) return;
+   PELMORA_VERIFY(_root.Get() == child);
+   _root.Reset();
+}
+
+// ---- ElementNodeImpl ----
+
+ElementNodeImpl::ElementNodeImpl(const std::string& qualifiedName, int line, int column)
+    : _line(line), _column(column) {
+   // A leading colon separates nothing: ":" or ":x" kept whole still writes back as read.
+   size_t colon = qualifiedName.find(':');
+   if (colon == std::string::npos || colon == 0) {
+      _tag = qualifiedName;
+   } else {
+      _prefix.assign(qualifiedName, 0, colon);
+      _tag.assign(qualifiedName, colon + 1);
+   }
+}
+
+ElementNodeImpl::ElementNodeImpl(const std::string& prefix, const std::string& tag, int line,
+                                 int column)
+    : _prefix(prefix), _tag(tag), _line(line), _column(column) {}
+
+std::string ElementNodeImpl::GetName() const {
+   if (_prefix.empty()) return _tag;
+   std::string name;
+   name.reserve(_prefix.size() + 1 + _tag.size());
+   name.append(_prefix).append(1, ':').append(_tag);
+   return name;
+}
+
+void ElementNodeImpl::GetQName(QName& name) const {
+   if (!ResolvePrefix(_prefix, name.uri)) name.uri.clear();
+   name.localName = _tag;
+}
+
+namespace {
+
+bool NameBefore(const std::pair<std::string, std::string>& attribute, const std::string& name) {
+   return attribute.first < name;
+}
+
+}  // namespace
+
+const std::string* ElementNodeImpl::FindAttribute(const std::string& name) const {
+   auto found = std::lower_bound(_attributes.begin(), _attributes.end(), name, NameBefore);
+   return found != _attributes.end() && found->first == name ? &found->second : nullptr;
+}
+
+bool ElementNodeImpl::GetAttribute(const std::string& name, std::string& value) const {
+   const std::string* found = FindAttribute(name);
+   if (!found) return false;
+   value = *found;
+   return true;
+}
+
+bool ElementNodeImpl::GetAttributeByQName(const QName& name, std::string& value) const {
+   // Unprefixed attributes are in no namespace; the default namespace does not apply.
+   if (name.uri.empty()) return GetAttribute(name.localName, value);
+   std::string uri;
+   for (const auto& [key, attributeValue] : _attributes) {
+      size_t colon = key.find(':');
+      if (colon == std::string::npos || key.compare(colon + 1, std::string::npos, name.localName))
+         continue;
+      if (ResolvePrefix(key.substr(0, colon), uri) && uri == name.uri) {
+         value = attributeValue;
+         return true;
+      }
+   }
+   return false;
+}
+
+void ElementNodeImpl::GetAttributes(AttributeMap& attributes) const {
+   attributes.clear();
+   for (const auto& [name, value] : _attributes)
+      attributes.emplace_hint(attributes.end(), name, value);
+}
+
+void ElementNodeImpl::DefineAttribute(const std::string& name, const std::string& value) {
+   auto found = std::lower_bound(_attributes.begin(), _attributes.end(), name, NameBefore);
+   if (found != _attributes.end() && found->first == name) {
+      found->second = value;
+   } else {
+      _attributes.emplace(found, name, value);
+   }
+}
+
+void ElementNodeImpl::DefineAttribute(const std::string& name, const char* value) {
+   PELMORA_VERIFY(value != NULL);
+   DefineAttribute(name, std::string(value));
+}
+
+void ElementNodeImpl::DefineParsedAttributes(const char** attributes) {
+   size_t count = 0;
+   while (attributes[count * 2]) ++count;
+   if (count == 0) return;
+   _attributes.reserve(_attributes.size() + count);
+   for (const char** attribute = attributes; *attribute; attribute += 2)
+      _attributes.emplace_back(attribute[0], attribute[1]);
+   std::sort(_attributes.begin(), _attributes.end());
+}
+
+void ElementNodeImpl::RemoveAttribute(const std::string& name) {
+   auto found = std::lower_bound(_attributes.begin(), _attributes.end(), name, NameBefore);
+   if (found != _attributes.end() && found->first == name) _attributes.erase(found);
+}
+
+bool ElementNodeImpl::ResolvePrefix(const std::string& prefix, std::string& uri) const {
+   std::string key = prefix.empty() ? std::string("xmlns") : "xmlns:" + prefix;
+   for (const NodeImpl* node = this; node && node->GetNodeType() == kElementNode;
+        node = node->ParentImpl()) {
+      if (const std::string* found =
+              static_cast<const ElementNodeImpl*>(node)->FindAttribute(key)) {
+         uri = *found;
+         return true;
+      }
+   }
+   return false;
+}
+
+void ElementNodeImpl::VerifyInsertAllowed(Node* child) const {
+   int type = child->GetNodeType();
+   if (type == kDocumentNode || type == kProcessingInstructionNode)
+      throw InvalidArgumentException("Elements cannot have document or PI children.");
+}
+
+// ---- The leaf kinds ----
+
+void TextNodeImpl::AppendText(const char* data, int length) {
+   PELMORA_VERIFY(length >= 0);
+   _text.append(data, static_cast<size_t>(length));
+}
+
+void TextNodeImpl::VerifyInsertAllowed(Node*) const {
+   throw InvalidArgumentException("Cannot add child to text node.");
+}
+
+void CDataNodeImpl::VerifyInsertAllowed(Node* child) const {
+   if (child->GetNodeType() != kTextNode)
+      throw InvalidArgumentException("Cannot add non-text child to CData node.");
+}
+
+void CommentNodeImpl::VerifyInsertAllowed(Node*) const {
+   throw InvalidArgumentException("Cannot add child to Comment node.");
+}
+
+void ProcessingInstructionNodeImpl::VerifyInsertAllowed(Node*) const {
+   throw InvalidArgumentException("Cannot add child to PI node.");
+}
+
+// ---- Factories ----
+
+void CreateDocument(Ref<Document>& out) {
+   out = new DocumentImpl();
+}
+
+void CreateElementNode(const std::string& qualifiedName, Ref<ElementNode>& out) {
+   out = new ElementNodeImpl(qualifiedName, 0, 0);
+}
+
+void CreateElementNode(const std::string& qualifiedName, int line, int column,
+                       Ref<ElementNode>& out) {
+   out = new ElementNodeImpl(qualifiedName, line, column);
+}
+
+void CreateElementNode(const std::string& prefix, const std::string& tag, Ref<ElementNode>& out) {
+   out = new ElementNodeImpl(prefix, tag, 0, 0);
+}
+
+void CreateElementNode(const std::string& prefix, const std::string& tag, int line, int column,
+                       Ref<ElementNode>& out) {
+   out = new ElementNodeImpl(prefix, tag, line, column);
+}
+
+void CreateTextNode(Ref<TextNode>& out) {
+   out = new TextNodeImpl();
+}
+
+void CreateTextNode(const std::string& text, Ref<TextNode>& out) {
+   out = new TextNodeImpl(text);
+}
+
+void CreateCDataNode(Ref<CDataNode>& out) {
+   out = new CDataNodeImpl();
+}
+
+void CreateCommentNode(Ref<CommentNode>& out) {
+   out = new CommentNodeImpl();
+}
+
+void CreateCommentNode(const std::string& comment, Ref<CommentNode>& out) {
+   out = new CommentNodeImpl(comment);
+}
+
+void CreateProcessingInstructionNode(Ref<ProcessingInstructionNode>& out) {
+   out = new ProcessingInstructionNodeImpl();
+}
+
+void CreateProcessingInstructionNode(const std::string& target, const std::string& data,
+                                     Ref<ProcessingInstructionNode>& out) {
+   out = new ProcessingInstructionNodeImpl(target, data);
+}
+
+}  // namespace Pelmora::Xml

@@ -1,0 +1,83 @@
+// The node arena and the allocation functions of NodeImpl that choose between it and the
+// general heap.
+
+#include "src/xml/nodeArena.h"
+
+#include <algorithm>
+#include <new>
+
+#include "src/xml/nodeImpl.h"
+
+namespace Pelmora::Xml {
+namespace {
+
+// Blocks double from the first size, which suits a request-sized document, up to the
+// largest, which keeps block allocation rare while staying below the heap's mmap threshold.
+constexpr size_t kFirstBlockSize = 8 * 1024;
+constexpr size_t kLargestBlockSize = 64 * 1024;
+constexpr size_t kAlignment = 16;
+// Before each node: the arena it came from, or null for the general heap; one alignment
+// unit, so that the node itself stays aligned.
+constexpr size_t kHeaderSize = kAlignment;
+
+size_t RoundUp(size_t size) {
+   return (size + kAlignment - 1) & ~(kAlignment - 1);
+}
+
+}  // namespace
+
+NodeArena::~NodeArena() {
+   for (char* block : _blocks) ::operator delete(block);
+}
+
+void* NodeArena::Allocate(size_t size) {
+   size = RoundUp(size);
+   if (static_cast<size_t>(_end - _cursor) < size) {
+      size_t blockSize = _blocks.empty() ? kFirstBlockSize
+                                         : std::min(2 * static_cast<size_t>(_end - _blocks.back()),
+                                                    kLargestBlockSize);
+      blockSize = std::max(blockSize, size);
+      _blocks.reserve(_blocks.size() + 1);
+      char* block = static_cast<char*>(::operator new(blockSize));
+      _blocks.push_back(block);
+      _cursor = block;
+      _end = block + blockSize;
+   }
+   void* memory = _cursor;
+   _cursor += size;
+   _references.fetch_add(1, std::memory_order_relaxed);
+   return memory;
+}
+
+void NodeArena::Release() {
+   if (_references.fetch_sub(1, std::memory_order_acq_rel) == 1) delete this;
+}
+
+void* NodeImpl::operator new(size_t size) {
+   char* memory = static_cast<char*>(::operator new(kHeaderSize + size));
+   *reinterpret_cast<NodeArena**>(memory) = nullptr;
+   return memory + kHeaderSize;
+}
+
+void* NodeImpl::operator new(size_t size, NodeArena* arena) {
+   char* memory = static_cast<char*>(arena->Allocate(kHeaderSize + size));
+   *reinterpret_cast<NodeArena**>(memory) = arena;
+   return memory + kHeaderSize;
+}
+
+void NodeImpl::operator delete(void* node) {
+   if (!node) return;
+   char* memory = static_cast<char*>(node) - kHeaderSize;
+   NodeArena* arena = *reinterpret_cast<NodeArena**>(memory);
+   if (arena) {
+      arena->Release();
+   } else {
+      ::operator delete(memory);
+   }
+}
+
+void NodeImpl::operator delete(void* node, NodeArena*) {
+   NodeImpl::operator delete(node);
+}
+
+}  // namespace Pelmora::Xml

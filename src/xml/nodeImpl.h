@@ -1,0 +1,235 @@
+#pragma once
+// The implementations of the six node kinds. NodeImpl keeps the tree links and enforces
+// the insertion invariants; each kind says which children it accepts and how it writes
+// itself. The parser and the serialiser use the unchecked link accessors. Not locked.
+
+#include <cstddef>
+#include <map>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "pelmora/xml/node.h"
+
+namespace Pelmora::Xml {
+
+class NodeArena;
+
+class NodeImpl : public virtual Node, public ObjectImpl {
+public:
+   // Nodes come from the general heap, or from a parsed document's arena.
+   static void* operator new(size_t size);
+   static void* operator new(size_t size, NodeArena* arena);
+   static void operator delete(void* node);
+   static void operator delete(void* node, NodeArena* arena);
+
+   // Releases the children, without recursing once per level of the tree.
+   ~NodeImpl() override;
+
+   Node* GetParent() const override;
+   Node* GetFirstChild() const override;
+   Node* GetLastChild() const override;
+   Node* GetNextSibling() const override;
+   Node* GetPrevSibling() const override;
+   void AppendChild(Node* node) override;
+   void InsertAfterChild(Node* node, Node* pos) override;
+   void InsertBeforeChild(Node* node, Node* pos) override;
+   void RemoveChild(Node* node) override;
+   void WriteNode(Writer* writer) const override { WriteNode(writer, -1); }
+   void PrettyWriteNode(Writer* writer) const override { WriteNode(writer, 0); }
+   ElementNode* GetChildElementByTag(const std::string& tag) const override;
+   ElementNode* GetSiblingElementByTag(const std::string& tag) const override;
+   ElementNode* GetChildElementByQName(const QName& name) const override;
+   ElementNode* GetSiblingElementByQName(const QName& name) const override;
+
+   // -1 writes compactly; 0 or more pretty-prints at that indentation level.
+   virtual void WriteNode(Writer* writer, int indent) const = 0;
+   // Throws InvalidArgumentException when this node may not hold `child`.
+   virtual void VerifyInsertAllowed(Node* child) const = 0;
+   virtual void PostInsertProcessing(NodeImpl*) {}
+   virtual void PostRemoveProcessing(NodeImpl*) {}
+
+   NodeImpl* ParentImpl() const { return _parent; }
+   NodeImpl* FirstChildImpl() const { return _firstChild; }
+   NodeImpl* LastChildImpl() const { return _lastChild; }
+   NodeImpl* NextSiblingImpl() const { return _nextSibling; }
+   // AppendChild for callers that hold the implementation of a new node (no cycle check).
+   void AppendChildImpl(NodeImpl* child) {
+      VerifyInsertAllowed(child);
+      Insert(child, nullptr);
+   }
+
+   // The implementation behind a node of this model; any other Node is a panic.
+   static NodeImpl* FromNode(Node* node);
+   static const NodeImpl* FromNode(const Node* node);
+
+protected:
+   NodeImpl() = default;
+
+private:
+   // Links `child` before `before` (at the end when null) and takes one reference.
+   void Insert(NodeImpl* child, NodeImpl* before);
+   // The checks shared by the three insertion forms.
+   void VerifyInsert(Node* node, Node* pos, bool hasPos);
+   // The invariants of a node about to be linked: no parent and no next sibling.
+   void VerifyFree() const;
+
+   NodeImpl* _firstChild = nullptr;
+   NodeImpl* _lastChild = nullptr;
+   NodeImpl* _nextSibling = nullptr;
+   NodeImpl* _prevSibling = nullptr;
+   NodeImpl* _parent = nullptr;
+};
+
+class ElementNodeImpl;
+
+class DocumentImpl final : public virtual Document, public NodeImpl {
+public:
+   using NodeImpl::WriteNode;
+
+   int GetNodeType() const override { return kDocumentNode; }
+   ElementNode* GetRoot() const override;
+   void SetRoot(ElementNode* root) override;
+   const std::string& GetXMLVersion() const override { return _version; }
+   void SetXMLVersion(const std::string& version) override { _version = version; }
+   const std::string& GetEncoding() const override { return _encoding; }
+   void SetEncoding(const std::string& encoding) override { _encoding = encoding; }
+
+   void WriteNode(Writer* writer, int indent) const override;
+   void VerifyInsertAllowed(Node* child) const override;
+   void PostInsertProcessing(NodeImpl* child) override;
+   void PostRemoveProcessing(NodeImpl* child) override;
+
+   ElementNodeImpl* RootImpl() const { return _root.Get(); }
+
+private:
+   Ref<ElementNodeImpl> _root;
+   std::string _version;
+   std::string _encoding;
+};
+
+class ElementNodeImpl final : public virtual ElementNode, public NodeImpl {
+public:
+   using AttributeMap = std::map<std::string, std::string>;
+   // Sorted by name: the order of a map, at one allocation per element.
+   using AttributeList = std::vector<std::pair<std::string, std::string>>;
+   using NodeImpl::WriteNode;
+
+   // Splits the qualified name at the first ":"; no ":", or only a leading one, means no
+   // prefix.
+   ElementNodeImpl(const std::string& qualifiedName, int line, int column);
+   ElementNodeImpl(const std::string& prefix, const std::string& tag, int line, int column);
+
+   int GetNodeType() const override { return kElementNode; }
+   const std::string& GetPrefix() const override { return _prefix; }
+   void SetPrefix(const std::string& prefix) override { _prefix = prefix; }
+   const std::string& GetTag() const override { return _tag; }
+   void SetTag(const std::string& tag) override { _tag = tag; }
+   std::string GetName() const override;
+   void GetQName(QName& name) const override;
+   int GetLineNumber() const override { return _line; }
+   int GetColumnNumber() const override { return _column; }
+   bool GetAttribute(const std::string& name, std::string& value) const override;
+   bool GetAttributeByQName(const QName& name, std::string& value) const override;
+   void GetAttributes(AttributeMap& attributes) const override;
+   void DefineAttribute(const std::string& name, const std::string& value) override;
+   void DefineAttribute(const std::string& name, const char* value) override;
+   void RemoveAttribute(const std::string& name) override;
+   bool ResolvePrefix(const std::string& prefix, std::string& uri) const override;
+
+   void WriteNode(Writer* writer, int indent) const override;
+   void VerifyInsertAllowed(Node* child) const override;
+
+   // The attribute's value, or null; no copy.
+   const std::string* FindAttribute(const std::string& name) const;
+   // For the parser: defines the attributes of a start tag (name, value, ..., null), whose
+   // names expat has made unique.
+   void DefineParsedAttributes(const char** attributes);
+
+   // The serialiser's halves of an element, so that nesting needs no recursion. The start
+   // tag answers whether children follow (otherwise it was written as an empty tag).
+   bool WriteStartTag(Writer* writer, int indent) const;
+   void WriteEndTag(Writer* writer, int indent) const;
+   // Pretty mode with an element or comment first: one child per line.
+   bool IsBlockLayout(int indent) const;
+
+private:
+   // Allocated on the first DefineAttribute: most elements carry no attributes.
+   AttributeList _attributes;
+   std::string _prefix;
+   std::string _tag;
+   int _line;
+   int _column;
+};
+
+class TextNodeImpl final : public virtual TextNode, public NodeImpl {
+public:
+   using NodeImpl::WriteNode;
+
+   TextNodeImpl() = default;
+   explicit TextNodeImpl(const std::string& text) : _text(text) {}
+   TextNodeImpl(const char* data, int length) : _text(data, static_cast<size_t>(length)) {}
+
+   int GetNodeType() const override { return kTextNode; }
+   const std::string& GetText() const override { return _text; }
+   void SetText(const std::string& text) override { _text = text; }
+   void AppendText(const char* data, int length) override;
+
+   void WriteNode(Writer* writer, int indent) const override;
+   void VerifyInsertAllowed(Node* child) const override;
+
+private:
+   std::string _text;
+};
+
+class CDataNodeImpl final : public virtual CDataNode, public NodeImpl {
+public:
+   using NodeImpl::WriteNode;
+
+   int GetNodeType() const override { return kCDataNode; }
+   void WriteNode(Writer* writer, int indent) const override;
+   void VerifyInsertAllowed(Node* child) const override;
+};
+
+class CommentNodeImpl final : public virtual CommentNode, public NodeImpl {
+public:
+   using NodeImpl::WriteNode;
+
+   CommentNodeImpl() = default;
+   explicit CommentNodeImpl(const std::string& comment) : _comment(comment) {}
+
+   int GetNodeType() const override { return kCommentNode; }
+   const std::string& GetComment() const override { return _comment; }
+   void SetComment(const std::string& comment) override { _comment = comment; }
+
+   void WriteNode(Writer* writer, int indent) const override;
+   void VerifyInsertAllowed(Node* child) const override;
+
+private:
+   std::string _comment;
+};
+
+class ProcessingInstructionNodeImpl final : public virtual ProcessingInstructionNode,
+                                            public NodeImpl {
+public:
+   using NodeImpl::WriteNode;
+
+   ProcessingInstructionNodeImpl() = default;
+   ProcessingInstructionNodeImpl(const std::string& target, const std::string& data)
+       : _target(target), _data(data) {}
+
+   int GetNodeType() const override { return kProcessingInstructionNode; }
+   const std::string& GetTarget() const override { return _target; }
+   void SetTarget(const std::string& target) override { _target = target; }
+   const std::string& GetData() const override { return _data; }
+   void SetData(const std::string& data) override { _data = data; }
+
+   void WriteNode(Writer* writer, int indent) const override;
+   void VerifyInsertAllowed(Node* child) const override;
+
+private:
+   std::string _target;
+   std::string _data;
+};
+
+}  // namespace Pelmora::Xml
