@@ -1,6 +1,9 @@
-// A tour of the core: objects and a weak reference, a formatted message, and an
-// exception caught, cloned, rethrown and printed with its backtrace.
+// A tour of the core: objects and a weak reference, a formatted message, an exception
+// caught, cloned, rethrown and printed with its backtrace; then logging to the console
+// and to a rolling file.
 
+#include <cstdlib>
+#include <filesystem>
 #include <iostream>
 #include <memory>
 
@@ -53,6 +56,41 @@ int main() {
       std::cout << MessageFormatter::ASPrint("rethrown as its own type: %1 (path %2)\n", e,
                                              e.GetPath());
       std::cout << "thrown at:\n" << e.Where();
+   }
+
+   // Logging. The default logger already writes to the console (standard error); the
+   // console keeps warnings and worse, and every line at info goes to a rolling file.
+   const char* tmp = std::getenv("TMPDIR");
+   std::string logDir = std::string(tmp && *tmp ? tmp : "/tmp") + "/core_tour-logs";
+   std::filesystem::remove_all(logDir);
+   std::filesystem::create_directories(logDir);
+   Service::LogFileOptions fileOptions;
+   fileOptions.path = logDir + "/core_tour.log";
+   fileOptions.maxFileSize = 2048;  // small, to show the rollover
+   fileOptions.maxFileNum = 3;
+   Ref<Service::LogWriter> file;
+   Service::CreateFileLogWriter("file", fileOptions, file);
+   Service::Logger* logger = Service::GetDefaultLogger();
+   logger->GetLogOutput()->AddWriter("file", file.Get());
+   Ref<Service::LogWriter> console;
+   logger->GetLogOutput()->GetWriter("console", console);
+   if (console) console->SetLevelByName("warning");
+
+   Ref<Service::Logger> sessions;
+   logger->CreateLogger("sessions", sessions);
+   Service::SetLogContext("user", "operator");
+   for (int i = 1; i <= 60; ++i) {
+      PELMORA_LOG_INFO(sessions.Get(), "session %1 opened from %2", i, "10.0.0.7");
+   }
+   PELMORA_LOG_WARNING(sessions.Get(), "session table %1%% full", 85);
+   PELMORA_LOG_ERROR(logger, "kept exception: %1", *kept);
+   Service::SetLogContext("user", "");
+   logger->GetLogManager()->Flush();
+
+   std::cout << "log files in " << logDir << ":\n";
+   for (const auto& entry : std::filesystem::directory_iterator(logDir)) {
+      std::cout << "  " << entry.path().filename().string() << " (" << entry.file_size()
+                << " bytes)\n";
    }
 
    std::string scores;

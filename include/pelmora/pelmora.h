@@ -6,5 +6,6 @@
 #include "pelmora/io.h"
 #include "pelmora/object.h"
 #include "pelmora/perfCounter.h"
+#include "pelmora/service.h"
 #include "pelmora/system.h"
 #include "pelmora/xml.h"

@@ -41,6 +41,12 @@ std::atomic<ReportSink*> g_sink{nullptr};
 
 void SetReportSink(ReportSink* sink) { g_sink.store(sink, std::memory_order_release); }
 
+bool SetReportSinkIfUnset(ReportSink* sink) {
+   ReportSink* expected = nullptr;
+   return g_sink.compare_exchange_strong(expected, sink, std::memory_order_acq_rel) ||
+          expected == sink;
+}
+
 ReportSink& GetReportSink() {
    ReportSink* sink = g_sink.load(std::memory_order_acquire);
    return sink ? *sink : g_stderrSink;

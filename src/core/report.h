@@ -26,6 +26,8 @@ protected:
 
 // `sink` must stay alive until exit; null restores the standard-error sink.
 void SetReportSink(ReportSink* sink);
+// Installs `sink` unless another one is installed; true when it is now the sink.
+bool SetReportSinkIfUnset(ReportSink* sink);
 ReportSink& GetReportSink();
 
 }  // namespace Pelmora::Internal

@@ -1,0 +1,137 @@
+// Logging: a call below the logger's level, and a short line to a file with one and two
+// threads, against spdlog's synchronous file sink and against the floor, a preformatted
+// line written with fwrite under a mutex.
+
+#include <spdlog/sinks/basic_file_sink.h>
+#include <spdlog/spdlog.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <mutex>
+#include <string>
+
+#include "pelmora/service.h"
+#include "support/ratioMain.h"
+
+using namespace Pelmora;
+using namespace Pelmora::Service;
+
+namespace {
+
+const std::string& Dir() {
+   static const std::string dir = [] {
+      char pattern[] = "/tmp/pelmora-log-bench-XXXXXX";
+      return std::string(mkdtemp(pattern));
+   }();
+   return dir;
+}
+
+// "info" to the file, nothing in memory: the disabled call costs the level test alone.
+Logger* PelmoraFileLogger() {
+   static Logger* const logger = [] {
+      Ref<Logger> logger;
+      CreateLogger(nullptr, "bench", "info", nullptr, logger);
+      logger->SetMemLevelByName("none");
+      LogFileOptions options;
+      options.path = Dir() + "/pelmora.log";
+      options.maxFileSize = 64ll << 20;
+      options.maxFileNum = 2;
+      Ref<LogWriter> writer;
+      CreateFileLogWriter("file", options, writer);
+      logger->GetLogOutput()->AddWriter("file", writer.Get());
+      return logger.Release();
+   }();
+   return logger;
+}
+
+spdlog::logger* SpdlogFileLogger() {
+   static spdlog::logger* const logger = [] {
+      auto sink = std::make_shared<spdlog::sinks::basic_file_sink_mt>(Dir() + "/spdlog.log", true);
+      auto* made = new spdlog::logger("bench", sink);
+      made->set_level(spdlog::level::info);
+      return made;
+   }();
+   return logger;
+}
+
+struct FloorFile {
+   std::mutex mutex;
+   FILE* file;
+   FloorFile() : file(fopen((Dir() + "/floor.log").c_str(), "we")) {}
+};
+FloorFile& Floor() {
+   static FloorFile* const floor = new FloorFile();
+   return *floor;
+}
+
+const std::string kClient = "10.1.2.3:40112";
+
+void BM_PelmoraDisabled(benchmark::State& state) {
+   Logger* logger = PelmoraFileLogger();
+   int i = 0;
+   for (auto _ : state) {
+      PELMORA_LOG_VERBOSE(logger, "request %1 from %2", ++i, kClient);
+      benchmark::ClobberMemory();
+   }
+}
+BENCHMARK(BM_PelmoraDisabled);
+
+void BM_SpdlogDisabled(benchmark::State& state) {
+   spdlog::logger* logger = SpdlogFileLogger();
+   int i = 0;
+   for (auto _ : state) {
+      logger->debug("request {} from {}", ++i, kClient);
+      benchmark::ClobberMemory();
+   }
+}
+BENCHMARK(BM_SpdlogDisabled);
+
+// About 100 bytes with either prefix.
+void BM_PelmoraFile(benchmark::State& state) {
+   Logger* logger = PelmoraFileLogger();
+   int i = 0;
+   for (auto _ : state) {
+      PELMORA_LOG_INFO(logger, "request %1 served for client %2 in time", ++i, kClient);
+   }
+   state.SetItemsProcessed(state.iterations());
+}
+BENCHMARK(BM_PelmoraFile)->Threads(1)->Threads(2)->UseRealTime();
+
+void BM_SpdlogFile(benchmark::State& state) {
+   spdlog::logger* logger = SpdlogFileLogger();
+   int i = 0;
+   for (auto _ : state) {
+      logger->info("request {} served for client {} in time", ++i, kClient);
+   }
+   state.SetItemsProcessed(state.iterations());
+}
+BENCHMARK(BM_SpdlogFile)->Threads(1)->Threads(2)->UseRealTime();
+
+void BM_FloorFwrite(benchmark::State& state) {
+   FloorFile& floor = Floor();
+   const std::string line =
+       "2026-11-23T10:57:52.123+00:00 [0x1a2b info 'bench'] request 12345 served for client "
+       "10.1.2.3:40112 in time\n";
+   for (auto _ : state) {
+      std::lock_guard<std::mutex> lock(floor.mutex);
+      fwrite(line.data(), 1, line.size(), floor.file);
+   }
+   state.SetItemsProcessed(state.iterations());
+}
+BENCHMARK(BM_FloorFwrite)->Threads(1)->Threads(2)->UseRealTime();
+
+}  // namespace
+
+int main(int argc, char** argv) {
+   int result = PelmoraBench::RunWithRatios(
+       argc, argv,
+       {{"BM_PelmoraDisabled", "BM_SpdlogDisabled"},
+        {"BM_PelmoraFile/real_time/threads:1", "BM_SpdlogFile/real_time/threads:1"},
+        {"BM_PelmoraFile/real_time/threads:2", "BM_SpdlogFile/real_time/threads:2"},
+        {"BM_PelmoraFile/real_time/threads:1", "BM_FloorFwrite/real_time/threads:1"},
+        {"BM_PelmoraFile/real_time/threads:2", "BM_FloorFwrite/real_time/threads:2"}});
+   std::filesystem::remove_all(Dir());
+   return result;
+}

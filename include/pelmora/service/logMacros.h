@@ -1,0 +1,118 @@
+#pragma once
+// Writing a message: LogInternal formats "%1".."%9" placeholders into one line of a
+// logger; the PELMORA_LOG macros test the level first, so an unwanted message costs one
+// load and one test and no argument is evaluated. Nothing here throws to its caller: a
+// failure while formatting still ends the line and is dropped.
+
+#include <string>
+
+#include "pelmora/formatter/printFormatter.h"
+#include "pelmora/service/logger.h"
+
+namespace Pelmora::Service {
+
+// Writes one line always (the caller tested the level): Begin, the message, End.
+void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
+                     const PrintFormatter* args, int count) noexcept;
+
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format) noexcept {
+   LogInternalArgs(logger, level, format, nullptr, 0);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1) noexcept {
+   const PrintFormatter args[] = {a1};
+   LogInternalArgs(logger, level, format, args, 1);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1, const PrintFormatter& a2) noexcept {
+   const PrintFormatter args[] = {a1, a2};
+   LogInternalArgs(logger, level, format, args, 2);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1, const PrintFormatter& a2,
+                        const PrintFormatter& a3) noexcept {
+   const PrintFormatter args[] = {a1, a2, a3};
+   LogInternalArgs(logger, level, format, args, 3);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1, const PrintFormatter& a2,
+                        const PrintFormatter& a3, const PrintFormatter& a4) noexcept {
+   const PrintFormatter args[] = {a1, a2, a3, a4};
+   LogInternalArgs(logger, level, format, args, 4);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1, const PrintFormatter& a2,
+                        const PrintFormatter& a3, const PrintFormatter& a4,
+                        const PrintFormatter& a5) noexcept {
+   const PrintFormatter args[] = {a1, a2, a3, a4, a5};
+   LogInternalArgs(logger, level, format, args, 5);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1, const PrintFormatter& a2,
+                        const PrintFormatter& a3, const PrintFormatter& a4,
+                        const PrintFormatter& a5, const PrintFormatter& a6) noexcept {
+   const PrintFormatter args[] = {a1, a2, a3, a4, a5, a6};
+   LogInternalArgs(logger, level, format, args, 6);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1, const PrintFormatter& a2,
+                        const PrintFormatter& a3, const PrintFormatter& a4,
+                        const PrintFormatter& a5, const PrintFormatter& a6,
+                        const PrintFormatter& a7) noexcept {
+   const PrintFormatter args[] = {a1, a2, a3, a4, a5, a6, a7};
+   LogInternalArgs(logger, level, format, args, 7);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1, const PrintFormatter& a2,
+                        const PrintFormatter& a3, const PrintFormatter& a4,
+                        const PrintFormatter& a5, const PrintFormatter& a6,
+                        const PrintFormatter& a7, const PrintFormatter& a8) noexcept {
+   const PrintFormatter args[] = {a1, a2, a3, a4, a5, a6, a7, a8};
+   LogInternalArgs(logger, level, format, args, 8);
+}
+inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format,
+                        const PrintFormatter& a1, const PrintFormatter& a2,
+                        const PrintFormatter& a3, const PrintFormatter& a4,
+                        const PrintFormatter& a5, const PrintFormatter& a6,
+                        const PrintFormatter& a7, const PrintFormatter& a8,
+                        const PrintFormatter& a9) noexcept {
+   const PrintFormatter args[] = {a1, a2, a3, a4, a5, a6, a7, a8, a9};
+   LogInternalArgs(logger, level, format, args, 9);
+}
+
+// Writes the in-memory ring of `logger`'s manager (its "memory" output) out through
+// `logger`'s output at `level`, framed by lines naming `message`. Nothing without a
+// memory output.
+void LogMemoryBuffer(Logger* logger, Logger::LogLevel level, const std::string& message) noexcept;
+// Writes the ring of the memory output `memory` out through the default logger's output.
+void WriteMemoryBuffer(LogOutput* memory, Logger::LogLevel level,
+                       const std::string& message) noexcept;
+// Writes one error line holding `fault` to `logger`'s memory writers only.
+void WriteFaultToMemoryBuffer(Logger* logger, const PrintFormatter& fault) noexcept;
+
+}  // namespace Pelmora::Service
+
+// PELMORA_LOG(logger, level, format, args...): `logger` is evaluated once; the format and
+// the arguments only when the level is wanted.
+#define PELMORA_LOG(logger, level, ...)                                           \
+   do {                                                                           \
+      ::Pelmora::Service::Logger* pelmoraLogger_ = (logger);                      \
+      if (pelmoraLogger_->IsLevelWanted(level)) {                                 \
+         ::Pelmora::Service::LogInternal(pelmoraLogger_, (level), __VA_ARGS__);   \
+      }                                                                           \
+   } while (0)
+
+#define PELMORA_LOG_QUIET(logger, ...) \
+   PELMORA_LOG(logger, ::Pelmora::Service::Logger::LOG_QUIET, __VA_ARGS__)
+#define PELMORA_LOG_PANIC(logger, ...) \
+   PELMORA_LOG(logger, ::Pelmora::Service::Logger::LOG_PANIC, __VA_ARGS__)
+#define PELMORA_LOG_ERROR(logger, ...) \
+   PELMORA_LOG(logger, ::Pelmora::Service::Logger::LOG_ERROR, __VA_ARGS__)
+#define PELMORA_LOG_WARNING(logger, ...) \
+   PELMORA_LOG(logger, ::Pelmora::Service::Logger::LOG_WARNING, __VA_ARGS__)
+#define PELMORA_LOG_INFO(logger, ...) \
+   PELMORA_LOG(logger, ::Pelmora::Service::Logger::LOG_INFO, __VA_ARGS__)
+#define PELMORA_LOG_VERBOSE(logger, ...) \
+   PELMORA_LOG(logger, ::Pelmora::Service::Logger::LOG_VERBOSE, __VA_ARGS__)
+#define PELMORA_LOG_TRIVIA(logger, ...) \
+   PELMORA_LOG(logger, ::Pelmora::Service::Logger::LOG_TRIVIA, __VA_ARGS__)

@@ -1,0 +1,68 @@
+#pragma once
+// The concrete log writers: a file with size-based rollover, the console, syslog over a
+// local datagram socket, and the in-memory ring (see CreateMemLogWriter). Each is a
+// LogWriter to add to a LogOutput; each is thread-safe. Every limit has a default below.
+
+#include <cstdint>
+#include <string>
+
+#include "pelmora/service/logger.h"
+
+namespace Pelmora::Service {
+
+// A log file that rolls over by size. The current file is `path`; when whole lines have
+// taken it to `maxFileSize` bytes or more, the next line first rolls it over: `path`.1
+// becomes `path`.2 and so on, the oldest (`path`.<maxFileNum - 1>) being replaced,
+// `path` becomes `path`.1 and a new `path` is opened (with maxFileNum 1 the file starts
+// again empty). So at most `maxFileNum` files exist, the newest lines are in `path`, and
+// a line is never split across files. Each rename is atomic, so a rolled file is always
+// complete under its name. Bytes are buffered and written out when the buffer fills,
+// after every line at level error or more severe, on Flush, and otherwise about
+// `flushIntervalMs` after they were written (checked every half interval by one
+// process-wide thread). Reopen (the manager's, after an outside rotation renamed the
+// file) writes the buffer to the old file and opens `path` anew.
+struct LogFileOptions {
+   std::string path;
+   std::string level = "info";
+   long long maxFileSize = 10485760;  // bytes; 0 means never roll over
+   int maxFileNum = 10;               // files kept, the current one included; at least 1
+   int fileMode = 0644;               // of new files, before the umask
+   int bufferSize = 65536;            // bytes held before a write; 0 writes every line
+   int flushIntervalMs = 200;         // the longest a written line waits in the buffer
+};
+// Opens (creates) the file: SystemException when that fails.
+void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
+                         Ref<LogWriter>& out);
+
+// Writes each line to standard error (or standard output) at once.
+void CreateConsoleLogWriter(const std::string& name, const std::string& level, bool toStdout,
+                            Ref<LogWriter>& out);
+
+// Sends each line as one datagram in the local syslog format
+// "<priority>Mmm dd hh:mm:ss ident[pid]: line" to a local datagram socket. The socket
+// need not exist: a line that cannot be sent is dropped and counted, never waited for,
+// and the writer connects again on the next line (at most once per
+// `reconnectIntervalMs`). Priorities: quiet -> notice, panic -> crit, error -> err,
+// warning -> warning, info -> info, verbose and trivia -> debug; with the facility.
+struct LogSyslogOptions {
+   std::string socketPath = "/dev/log";
+   std::string ident;               // empty: the program's name
+   std::string level = "info";
+   int facility = 3 << 3;           // daemon
+   int maxMessageSize = 8192;       // longer lines are cut to this many bytes
+   int reconnectIntervalMs = 1000;
+};
+class SyslogLogWriter : public virtual LogWriter {
+public:
+   // Lines dropped since the writer was made (no socket, or the receiver was full).
+   virtual uint64_t GetLostCount() const = 0;
+   // Lines cut to maxMessageSize.
+   virtual uint64_t GetTruncatedCount() const = 0;
+};
+void CreateSyslogLogWriter(const std::string& name, const LogSyslogOptions& options,
+                           Ref<SyslogLogWriter>& out);
+
+// The priority (facility excluded) that syslog lines of a level get.
+int GetSyslogSeverity(Logger::LogLevel level);
+
+}  // namespace Pelmora::Service

@@ -1,0 +1,488 @@
+// The level table, loggers, their manager, outputs and the plain writers.
+
+#include <cstdio>
+#include <cstring>
+#include <utility>
+
+#include "pelmora/exception/exceptions.h"
+#include "pelmora/exception/panic.h"
+#include "pelmora/io/writers.h"
+#include "src/service/logImpl.h"
+
+namespace Pelmora::Service {
+
+namespace {
+
+struct LevelEntry {
+   const char* name;
+   Logger::CombinedLevel bit;
+   Logger::CombinedLevel cumulative;
+};
+
+constexpr LevelEntry kLevels[] = {
+    {"none", 0, 0},       {"quiet", 1, 1},    {"panic", 2, 3},     {"error", 4, 7},
+    {"warning", 8, 15},   {"info", 16, 31},   {"verbose", 32, 63}, {"trivia", 64, 127},
+};
+
+constexpr Logger::CombinedLevel kLowHalf = 0xFFFF;
+// The end marker the ring keeps at its write position.
+constexpr size_t kRingMarkerSize = 13;
+
+}  // namespace
+
+bool FindLevelMask(const std::string& name, Logger::CombinedLevel& mask) {
+   for (const LevelEntry& entry : kLevels) {
+      if (name == entry.name) {
+         mask = entry.cumulative;
+         return true;
+      }
+   }
+   return false;
+}
+
+const char* GetLevelName(Logger::CombinedLevel mask16) {
+   mask16 &= kLowHalf;
+   if (mask16 == 0) return "none";
+   int bit = 31 - __builtin_clz(mask16);
+   // Bits above trivia are not levels; they read as the most verbose one.
+   return bit >= 7 ? "trivia" : kLevels[bit + 1].name;
+}
+
+const char* GetCombinedLevelName(Logger::CombinedLevel level) {
+   return GetLevelName(level > kLowHalf ? level >> Logger::kMemoryShift : level);
+}
+
+// ---- writers
+
+LogWriterImpl::LogWriterImpl(Writer* target, Logger::CombinedLevel mask, bool memory)
+   : _target(target), _mask(mask), _memory(memory) {}
+
+void LogWriterImpl::Write(Logger::CombinedLevel level, const char* data, int length) {
+   if ((level & GetMask()) == 0 || length <= 0) return;
+   std::lock_guard<std::mutex> lock(_mutex);
+   WriteLocked(level, data, length);
+}
+
+void LogWriterImpl::Flush() {
+   std::lock_guard<std::mutex> lock(_mutex);
+   FlushLocked();
+}
+
+void LogWriterImpl::Close() {
+   std::lock_guard<std::mutex> lock(_mutex);
+   CloseLocked();
+}
+
+bool LogWriterImpl::SetLevelByName(const std::string& name) {
+   Logger::CombinedLevel mask;
+   if (!FindLevelMask(name, mask)) return false;
+   SetMask(_memory ? mask << Logger::kMemoryShift : mask);
+   return true;
+}
+
+void LogWriterImpl::WriteLocked(Logger::CombinedLevel, const char* data, int length) {
+   if (_target) _target->Write(data, length);
+}
+
+void LogWriterImpl::FlushLocked() {
+   if (_target) _target->Flush();
+}
+
+void LogWriterImpl::CloseLocked() {
+   if (_target) _target->Close();
+}
+
+namespace {
+
+Ref<Writer> MakeRing(int sizeBytes) {
+   Ref<RingStringWriter> ring;
+   CreateRingStringWriter(sizeBytes, ring);
+   return ring;
+}
+
+}  // namespace
+
+MemLogWriterImpl::MemLogWriterImpl(int sizeBytes, Logger::CombinedLevel mask)
+   : LogWriterImpl(MakeRing(sizeBytes).Get(), mask, true) {}
+
+void MemLogWriterImpl::WriteLocked(Logger::CombinedLevel level, const char* data, int length) {
+   // A piece larger than the ring: only its end can stay.
+   int ring = dynamic_cast<RingBufferWriter*>(GetTarget())->GetRingSize();
+   if (length > ring) {
+      data += length - ring;
+      length = ring;
+   }
+   LogWriterImpl::WriteLocked(level, data, length);
+}
+
+std::string MemLogWriterImpl::GetText() {
+   std::lock_guard<std::mutex> lock(_mutex);
+   auto* ring = dynamic_cast<RingStringWriter*>(GetTarget());
+   std::string text = ring->GetText();
+   // A full ring has overwritten the start of its oldest line: leave that line out.
+   if (text.size() + kRingMarkerSize >= static_cast<size_t>(ring->GetRingSize())) {
+      size_t end = text.find('\n');
+      text.erase(0, end == std::string::npos ? text.size() : end + 1);
+   }
+   return text;
+}
+
+void CreateLogWriter(const std::string&, Writer* target, const std::string& level,
+                     Ref<LogWriter>& out) {
+   Logger::CombinedLevel mask;
+   if (!FindLevelMask(level, mask)) throw InvalidArgumentException("log level '" + level + "'");
+   out = new LogWriterImpl(target, mask, false);
+}
+
+void CreateMemLogWriter(const std::string&, int sizeK, const std::string& level,
+                        Ref<LogWriter>& out) {
+   Logger::CombinedLevel mask;
+   if (!FindLevelMask(level, mask)) throw InvalidArgumentException("log level '" + level + "'");
+   if (sizeK <= 0) throw InvalidArgumentException("memory log size " + std::to_string(sizeK));
+   out = new MemLogWriterImpl(sizeK * 1024, mask << Logger::kMemoryShift);
+}
+
+// ---- the output lock
+
+LogOutputLock::LogOutputLock() {
+   // Readers first: a reader may re-enter while a writer waits.
+   pthread_rwlockattr_t attr;
+   pthread_rwlockattr_init(&attr);
+   pthread_rwlockattr_setkind_np(&attr, PTHREAD_RWLOCK_PREFER_READER_NP);
+   pthread_rwlock_init(&_lock, &attr);
+   pthread_rwlockattr_destroy(&attr);
+}
+
+LogOutputLock::~LogOutputLock() { pthread_rwlock_destroy(&_lock); }
+
+const void* LogOutputLock::Self() {
+   // The address of a thread-local object names the thread without a system call.
+   static thread_local char marker;
+   return &marker;
+}
+
+bool LogOutputLock::IsWriteLockedByMe() const {
+   return _owner.load(std::memory_order_relaxed) == Self();
+}
+
+void LogOutputLock::ReadLock() {
+   if (IsWriteLockedByMe()) {
+      ++_depth;
+      return;
+   }
+   pthread_rwlock_rdlock(&_lock);
+}
+
+void LogOutputLock::ReadUnlock() {
+   if (IsWriteLockedByMe()) {
+      PELMORA_VERIFY(_depth > 1);
+      --_depth;
+      return;
+   }
+   pthread_rwlock_unlock(&_lock);
+}
+
+void LogOutputLock::WriteLock() {
+   const void* self = Self();
+   if (_owner.load(std::memory_order_relaxed) == self) {
+      ++_depth;
+      return;
+   }
+   pthread_rwlock_wrlock(&_lock);
+   _owner.store(self, std::memory_order_relaxed);
+   _depth = 1;
+}
+
+void LogOutputLock::WriteUnlock() {
+   PELMORA_VERIFY(IsWriteLockedByMe());
+   if (--_depth > 0) return;
+   _owner.store(nullptr, std::memory_order_relaxed);
+   pthread_rwlock_unlock(&_lock);
+}
+
+// ---- outputs
+
+void LogOutputImpl::AddWriter(const std::string& name, LogWriter* writer) {
+   if (!writer) throw InvalidArgumentException("null log writer");
+   _lock.WriteLock();
+   bool added = _writers.emplace(name, writer).second;
+   _lock.WriteUnlock();
+   if (!added) throw AlreadyExistsException(name);
+}
+
+void LogOutputImpl::RemoveWriter(const std::string& name, Ref<LogWriter>& out) {
+   _lock.WriteLock();
+   auto it = _writers.find(name);
+   if (it == _writers.end()) {
+      out.Reset();
+   } else {
+      out = std::move(it->second);
+      _writers.erase(it);
+   }
+   _lock.WriteUnlock();
+}
+
+void LogOutputImpl::GetWriter(const std::string& name, Ref<LogWriter>& out) {
+   _lock.ReadLock();
+   auto it = _writers.find(name);
+   out = it == _writers.end() ? nullptr : it->second.Get();
+   _lock.ReadUnlock();
+}
+
+void LogOutputImpl::Write(Logger::CombinedLevel level, const char* data, int length) {
+   for (auto& [name, writer] : _writers) {
+      try {
+         writer->Write(level, data, length);
+      } catch (...) {
+         // One failing writer must not keep the line from the others.
+      }
+   }
+}
+
+void LogOutputImpl::WriteMessage(Logger::CombinedLevel level, const char* data, int length) {
+   _lock.WriteLock();
+   try {
+      Write(level, data, length);
+   } catch (...) {
+      _lock.WriteUnlock();
+      throw;
+   }
+   _lock.WriteUnlock();
+}
+
+RefVector<LogWriter> LogOutputImpl::Snapshot() {
+   RefVector<LogWriter> writers;
+   _lock.ReadLock();
+   for (auto& [name, writer] : _writers) writers.push_back(writer);
+   _lock.ReadUnlock();
+   return writers;
+}
+
+void LogOutputImpl::Flush() {
+   for (Ref<LogWriter>& writer : Snapshot()) writer->Flush();
+}
+
+void LogOutputImpl::Reopen() {
+   for (Ref<LogWriter>& writer : Snapshot()) writer->Reopen();
+}
+
+void LogOutputImpl::Close() {
+   RefMap<std::string, LogWriter> writers;
+   _lock.WriteLock();
+   writers.swap(_writers);
+   _lock.WriteUnlock();
+   for (auto& [name, writer] : writers) writer->Close();
+}
+
+// ---- loggers
+
+LoggerImpl::LoggerImpl(const std::string& name, CombinedLevel mask, LoggerImpl* parent,
+                       LogManagerImpl* manager, LogOutput* output)
+   : _name(name), _parent(parent), _manager(manager), _output(output) {
+   PELMORA_VERIFY(manager != nullptr);
+   SetCombinedMask(mask);
+   manager->RegisterLogger(this);
+}
+
+LoggerImpl::~LoggerImpl() { _manager->UnregisterLogger(this); }
+
+LogManager* LoggerImpl::GetLogManager() const { return _manager.Get(); }
+
+void LoggerImpl::CreateLogger(const std::string& name, Ref<Logger>& out) {
+   CombinedLevel mask = GetCombinedMask();
+   if (_manager->HasOwnLevels(name)) {
+      mask = _manager->FindLogLevelForName(name) |
+             (_manager->FindMemLevelForName(name) << kMemoryShift);
+   }
+   CreateLogger(name, mask, out);
+}
+
+void LoggerImpl::CreateLogger(const std::string& name, CombinedLevel mask, Ref<Logger>& out) {
+   out = new LoggerImpl(name, mask, this, _manager.Get(), _output.Get());
+}
+
+void LoggerImpl::SetLogHalf(CombinedLevel mask16) {
+   // A lost race between two setters leaves one of their values, as either order would.
+   CombinedLevel old = GetCombinedMask();
+   SetCombinedMask((old & ~kLowHalf) | (mask16 & kLowHalf));
+}
+
+void LoggerImpl::SetMemHalf(CombinedLevel mask16) {
+   CombinedLevel old = GetCombinedMask();
+   SetCombinedMask((old & kLowHalf) | ((mask16 & kLowHalf) << kMemoryShift));
+}
+
+bool LoggerImpl::SetLevelByName(const std::string& name) {
+   CombinedLevel mask;
+   if (!FindLevelMask(name, mask)) return false;
+   SetLogHalf(mask);
+   return true;
+}
+
+bool LoggerImpl::SetMemLevelByName(const std::string& name) {
+   CombinedLevel mask;
+   if (!FindLevelMask(name, mask)) return false;
+   SetMemHalf(mask);
+   return true;
+}
+
+std::string LoggerImpl::GetLevelByName() const { return GetLevelName(GetCombinedMask()); }
+
+std::string LoggerImpl::GetMemLevelByName() const {
+   return GetLevelName(GetCombinedMask() >> kMemoryShift);
+}
+
+void LoggerImpl::Write(const char* text) { Write(text, static_cast<int>(strlen(text))); }
+
+void LoggerImpl::Write(const std::string& text) {
+   Write(text.data(), static_cast<int>(text.size()));
+}
+
+void LoggerImpl::WriteInt(const char* format, int value) {
+   char text[64];
+   int n = snprintf(text, sizeof(text), format, value);
+   if (n > 0) Write(text, n < static_cast<int>(sizeof(text)) ? n : static_cast<int>(sizeof(text)) - 1);
+}
+
+// ---- the manager
+
+class LogManagerImpl::Guard {
+public:
+   explicit Guard(LogManagerImpl* manager) : _manager(manager), _locked(!manager->IsLocked()) {
+      if (_locked) _manager->Lock();
+   }
+   ~Guard() {
+      if (_locked) _manager->Unlock();
+   }
+   Guard(const Guard&) = delete;
+   Guard& operator=(const Guard&) = delete;
+
+private:
+   LogManagerImpl* _manager;
+   bool _locked;
+};
+
+LogManagerImpl::LogManagerImpl()
+   : _defaultLog(Logger::LOG_INFO * 2 - 1), _defaultMem(Logger::LOG_VERBOSE * 2 - 1) {}
+
+void CreateLogManager(Ref<LogManager>& out) { out = new LogManagerImpl(); }
+
+void LogManagerImpl::RegisterLogger(LoggerImpl* logger) {
+   Guard guard(this);
+   _loggers.insert(logger);
+}
+
+void LogManagerImpl::UnregisterLogger(LoggerImpl* logger) {
+   Guard guard(this);
+   _loggers.erase(logger);
+}
+
+bool LogManagerImpl::HasOwnLevels(const std::string& subsystem) {
+   Guard guard(this);
+   return _logLevels.count(subsystem) != 0 || _memLevels.count(subsystem) != 0;
+}
+
+bool LogManagerImpl::SetLogLevel(const std::string& subsystem, const std::string& level) {
+   Logger::CombinedLevel mask;
+   if (!FindLevelMask(level, mask)) return false;
+   Guard guard(this);
+   _logLevels[subsystem] = mask;
+   for (LoggerImpl* logger : _loggers) {
+      if (logger->GetSubsystemName() == subsystem) logger->SetLogHalf(mask);
+   }
+   return true;
+}
+
+bool LogManagerImpl::SetMemLevel(const std::string& subsystem, const std::string& level) {
+   Logger::CombinedLevel mask;
+   if (!FindLevelMask(level, mask)) return false;
+   Guard guard(this);
+   _memLevels[subsystem] = mask;
+   for (LoggerImpl* logger : _loggers) {
+      if (logger->GetSubsystemName() == subsystem) logger->SetMemHalf(mask);
+   }
+   return true;
+}
+
+bool LogManagerImpl::SetLevel(const std::string& subsystem, const std::string& logLevel,
+                              const std::string& memLevel) {
+   Logger::CombinedLevel a, b;
+   if (!FindLevelMask(logLevel, a) || !FindLevelMask(memLevel, b)) return false;
+   SetLogLevel(subsystem, logLevel);
+   SetMemLevel(subsystem, memLevel);
+   return true;
+}
+
+bool LogManagerImpl::SetDefaultLevels(const std::string& logLevel, const std::string& memLevel) {
+   Logger::CombinedLevel log, mem;
+   if (!FindLevelMask(logLevel, log) || !FindLevelMask(memLevel, mem)) return false;
+   Guard guard(this);
+   _defaultLog = log;
+   _defaultMem = mem;
+   return true;
+}
+
+void LogManagerImpl::GetLoggers(std::map<std::string, std::string>& out) {
+   Guard guard(this);
+   for (LoggerImpl* logger : _loggers) out[logger->GetSubsystemName()] = logger->GetLevelByName();
+}
+
+void LogManagerImpl::GetMemLoggers(std::map<std::string, std::string>& out) {
+   Guard guard(this);
+   for (LoggerImpl* logger : _loggers) {
+      out[logger->GetSubsystemName()] = logger->GetMemLevelByName();
+   }
+}
+
+Logger::CombinedLevel LogManagerImpl::FindLogLevelForName(const std::string& subsystem) {
+   Guard guard(this);
+   auto it = _logLevels.find(subsystem);
+   return it == _logLevels.end() ? _defaultLog : it->second;
+}
+
+Logger::CombinedLevel LogManagerImpl::FindMemLevelForName(const std::string& subsystem) {
+   Guard guard(this);
+   auto it = _memLevels.find(subsystem);
+   return it == _memLevels.end() ? _defaultMem : it->second;
+}
+
+void LogManagerImpl::GetOrCreateLogOutput(const std::string& name, Ref<LogOutput>& out) {
+   Guard guard(this);
+   Ref<LogOutput>& slot = _outputs[name];
+   if (!slot) slot = new LogOutputImpl(name);
+   out = slot;
+}
+
+void LogManagerImpl::FindLogOutput(const std::string& name, Ref<LogOutput>& out) {
+   Guard guard(this);
+   auto it = _outputs.find(name);
+   out = it == _outputs.end() ? nullptr : it->second.Get();
+}
+
+void LogManagerImpl::RemoveLogOutput(const std::string& name, Ref<LogOutput>& out) {
+   Guard guard(this);
+   auto it = _outputs.find(name);
+   if (it == _outputs.end()) {
+      out.Reset();
+      return;
+   }
+   out = std::move(it->second);
+   _outputs.erase(it);
+}
+
+RefVector<LogOutput> LogManagerImpl::Outputs() {
+   Guard guard(this);
+   RefVector<LogOutput> outputs;
+   for (auto& [name, output] : _outputs) outputs.push_back(output);
+   return outputs;
+}
+
+void LogManagerImpl::Reopen() {
+   for (Ref<LogOutput>& output : Outputs()) output->Reopen();
+}
+
+void LogManagerImpl::Flush() {
+   for (Ref<LogOutput>& output : Outputs()) output->Flush();
+}
+
+}  // namespace Pelmora::Service

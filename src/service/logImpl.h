@@ -1,0 +1,190 @@
+#pragma once
+// The logging implementation classes shared by the logging units.
+
+#include <pthread.h>
+
+#include <atomic>
+#include <map>
+#include <mutex>
+#include <set>
+#include <string>
+
+#include "pelmora/object/containers.h"
+#include "pelmora/service/logger.h"
+
+namespace Pelmora::Service {
+
+class LogManagerImpl;
+
+// Bits of the output half that make a file writer write its buffer out at a line's end.
+constexpr Logger::CombinedLevel kSevereLevels = Logger::LOG_QUIET | Logger::LOG_PANIC |
+                                                Logger::LOG_ERROR;
+
+// The level name of a combined level: its low half, or its high half when the value
+// exceeds 65535, by the highest set bit.
+const char* GetCombinedLevelName(Logger::CombinedLevel level);
+
+// A writer over a target Writer, filtered by a mask; its mutex serialises the target
+// against flushing and reading from other threads.
+class LogWriterImpl : public virtual LogWriter, public ObjectImpl {
+public:
+   // `memory`: the writer serves the memory half of combined levels.
+   LogWriterImpl(Writer* target, Logger::CombinedLevel mask, bool memory);
+
+   void Write(Logger::CombinedLevel level, const char* data, int length) override;
+   void Flush() override;
+   void Close() override;
+   void Reopen() override {}
+   Logger::CombinedLevel GetMask() const override { return _mask.load(std::memory_order_relaxed); }
+   void SetMask(Logger::CombinedLevel mask) override { _mask.store(mask, std::memory_order_relaxed); }
+   bool SetLevelByName(const std::string& name) override;
+   Writer* GetTarget() const override { return _target.Get(); }
+   bool IsMemoryWriter() const { return _memory; }
+
+protected:
+   // With _mutex held.
+   virtual void WriteLocked(Logger::CombinedLevel level, const char* data, int length);
+   virtual void FlushLocked();
+   virtual void CloseLocked();
+
+   std::mutex _mutex;
+
+private:
+   Ref<Writer> _target;
+   std::atomic<Logger::CombinedLevel> _mask;
+   const bool _memory;
+};
+
+// The in-memory ring: the most recent bytes of the lines at its memory levels.
+class MemLogWriterImpl : public LogWriterImpl {
+public:
+   MemLogWriterImpl(int sizeBytes, Logger::CombinedLevel mask);
+   // The whole lines the ring holds, oldest first.
+   std::string GetText();
+
+protected:
+   void WriteLocked(Logger::CombinedLevel level, const char* data, int length) override;
+};
+
+// The per-thread recursive write lock over a system reader/writer lock (readers may
+// re-enter while no writer holds it). A thread that holds the read lock must not ask for
+// the write lock.
+class LogOutputLock {
+public:
+   LogOutputLock();
+   ~LogOutputLock();
+   void ReadLock();
+   void WriteLock();
+   void ReadUnlock();
+   void WriteUnlock();
+   bool IsWriteLockedByMe() const;
+
+private:
+   static const void* Self();
+   pthread_rwlock_t _lock;
+   std::atomic<const void*> _owner{nullptr};
+   int _depth = 0;  // of the owner's write (and nested read) holds
+};
+
+class LogOutputImpl : public virtual LogOutput, public ObjectImpl {
+public:
+   explicit LogOutputImpl(const std::string& name) : _name(name) {}
+
+   const std::string& GetName() const override { return _name; }
+   void AddWriter(const std::string& name, LogWriter* writer) override;
+   void RemoveWriter(const std::string& name, Ref<LogWriter>& out) override;
+   void GetWriter(const std::string& name, Ref<LogWriter>& out) override;
+   void Write(Logger::CombinedLevel level, const char* data, int length) override;
+   void WriteMessage(Logger::CombinedLevel level, const char* data, int length) override;
+   void Flush() override;
+   void Reopen() override;
+   void Close() override;
+   void RecursiveReadLock() override { _lock.ReadLock(); }
+   void RecursiveWriteLock() override { _lock.WriteLock(); }
+   void ReadUnlock() override { _lock.ReadUnlock(); }
+   void WriteUnlock() override { _lock.WriteUnlock(); }
+
+   // The writers at this moment, copied under the read lock.
+   RefVector<LogWriter> Snapshot();
+
+private:
+   const std::string _name;
+   LogOutputLock _lock;
+   RefMap<std::string, LogWriter> _writers;
+};
+
+class LoggerImpl : public virtual Logger, public ObjectImpl {
+public:
+   LoggerImpl(const std::string& name, CombinedLevel mask, LoggerImpl* parent,
+              LogManagerImpl* manager, LogOutput* output);
+   ~LoggerImpl() override;
+
+   void Write(const char* data, int length) override;
+   void Write(const char* text) override;
+   void Write(const std::string& text) override;
+   void WriteInt(const char* format, int value) override;
+   void Close() override {}
+   void Begin(LogLevel level) override;
+   void End() override;
+   Writer* GetLineWriter() override;
+   void CreateLogger(const std::string& name, Ref<Logger>& out) override;
+   void CreateLogger(const std::string& name, CombinedLevel mask, Ref<Logger>& out) override;
+   const std::string& GetSubsystemName() const override { return _name; }
+   LogOutput* GetLogOutput() const override { return _output.Get(); }
+   LogManager* GetLogManager() const override;
+   Logger* GetParent() const override { return _parent.Get(); }
+   bool SetLevelByName(const std::string& name) override;
+   bool SetMemLevelByName(const std::string& name) override;
+   std::string GetLevelByName() const override;
+   std::string GetMemLevelByName() const override;
+
+   // Begin with the combined level given as is (not masked by the logger's).
+   void BeginCombined(CombinedLevel level);
+   void SetLogHalf(CombinedLevel mask16);
+   void SetMemHalf(CombinedLevel mask16);
+
+private:
+   const std::string _name;
+   Ref<LoggerImpl> _parent;
+   Ref<LogManagerImpl> _manager;
+   Ref<LogOutput> _output;
+};
+
+class LogManagerImpl : public virtual LogManager, public System::LockableObjectImpl {
+public:
+   LogManagerImpl();
+
+   bool SetLogLevel(const std::string& subsystem, const std::string& level) override;
+   bool SetMemLevel(const std::string& subsystem, const std::string& level) override;
+   bool SetLevel(const std::string& subsystem, const std::string& logLevel,
+                 const std::string& memLevel) override;
+   bool SetDefaultLevels(const std::string& logLevel, const std::string& memLevel) override;
+   void GetLoggers(std::map<std::string, std::string>& out) override;
+   void GetMemLoggers(std::map<std::string, std::string>& out) override;
+   Logger::CombinedLevel FindLogLevelForName(const std::string& subsystem) override;
+   Logger::CombinedLevel FindMemLevelForName(const std::string& subsystem) override;
+   void GetOrCreateLogOutput(const std::string& name, Ref<LogOutput>& out) override;
+   void FindLogOutput(const std::string& name, Ref<LogOutput>& out) override;
+   void RemoveLogOutput(const std::string& name, Ref<LogOutput>& out) override;
+   void Reopen() override;
+   void Flush() override;
+
+   void RegisterLogger(LoggerImpl* logger);
+   void UnregisterLogger(LoggerImpl* logger);
+   // Whether the manager keeps a level for `subsystem`.
+   bool HasOwnLevels(const std::string& subsystem);
+
+private:
+   // Locks unless the calling thread holds the lock already (the panic path does).
+   class Guard;
+   RefVector<LogOutput> Outputs();
+
+   std::set<LoggerImpl*> _loggers;
+   std::map<std::string, Logger::CombinedLevel> _logLevels;  // 16-bit masks
+   std::map<std::string, Logger::CombinedLevel> _memLevels;
+   Logger::CombinedLevel _defaultLog;
+   Logger::CombinedLevel _defaultMem;
+   RefMap<std::string, LogOutput> _outputs;
+};
+
+}  // namespace Pelmora::Service

@@ -1,0 +1,355 @@
+// Assembling a line: the per-thread line writer with its 2048-byte chunk, the line
+// prefix, the per-thread state (nesting and log context) and LogInternal.
+
+#include <time.h>
+
+#include <cstdio>
+#include <cstring>
+#include <map>
+#include <memory>
+#include <mutex>
+#include <vector>
+
+#include "pelmora/exception/panic.h"
+#include "pelmora/formatter/messageFormatter.h"
+#include "pelmora/service/logMacros.h"
+#include "pelmora/system/thread.h"
+#include "src/service/logImpl.h"
+
+namespace Pelmora::Service {
+
+namespace {
+
+std::atomic<bool> g_fastPath{true};
+
+constexpr int kChunkSize = 2048;
+// Pieces above this go to the output directly instead of through the chunk.
+constexpr int kLargePiece = 1023;
+constexpr int kPrefixLimit = 65;
+
+// Builds one line for one output at a time, Begin to End. The chunk holds the line until
+// it fills; a line that fits reaches the output in one locked call, a longer one keeps
+// the output's write lock from its first flush to its end.
+// Text of at most kPrefixLimit - 1 bytes; what does not fit is cut.
+struct BoundedText {
+   void Append(const char* text) {
+      size_t length = strlen(text);
+      size_t room = static_cast<size_t>(kPrefixLimit - 1 - size);
+      if (length > room) length = room;
+      memcpy(data + size, text, length);
+      size += static_cast<int>(length);
+   }
+   char data[kPrefixLimit];
+   int size = 0;
+};
+
+class TlsBufferedLogWriter final : public virtual Writer, public ObjectImpl {
+public:
+   TlsBufferedLogWriter()
+      : _threadId(reinterpret_cast<const void*>(static_cast<uintptr_t>(System::GetThreadId()))) {
+      snprintf(_threadText, sizeof(_threadText), "%p", _threadId);
+   }
+
+   void Begin(Logger::CombinedLevel level, const std::string& subsystem, LogOutput* output,
+              const std::map<std::string, std::string>& context) {
+      if (output == nullptr) PanicVerify("__null != output", __FILE__, __LINE__);
+      if (_output) PanicVerify("__null == _output", __FILE__, __LINE__);
+      _output = output;
+      _level = level;
+      _locked = false;
+      _chunkPos = 0;
+      try {
+         WriteLogPrefix(subsystem, context);
+      } catch (...) {
+         // The line goes on without a complete prefix.
+      }
+   }
+
+   void Write(const char* data, int length) override {
+      if (length <= 0) return;
+      if (_chunkPos + length > kChunkSize) Flush();
+      if (length > kLargePiece) {
+         // Flushing first keeps the chunk's bytes ahead of the piece and takes the lock.
+         Flush();
+         _output->Write(_level, data, length);
+         return;
+      }
+      memcpy(_chunk + _chunkPos, data, static_cast<size_t>(length));
+      _chunkPos += length;
+   }
+
+   void Flush() override {
+      if (!_locked) {
+         _output->RecursiveWriteLock();
+         _locked = true;
+      }
+      int pos = _chunkPos;
+      _chunkPos = 0;
+      if (pos > 0) _output->Write(_level, _chunk, pos);
+      if (_chunkPos != 0) PanicVerify("_chunkPos == 0", __FILE__, __LINE__);
+   }
+
+   void Close() override {}
+
+   // Hands the rest of the line on and lets the output go, also when a writer throws.
+   void End() {
+      struct Release {
+         TlsBufferedLogWriter* self;
+         ~Release() {
+            if (self->_locked) {
+               self->_locked = false;
+               self->_output->WriteUnlock();
+            }
+            self->_chunkPos = 0;
+            self->_output.Reset();
+         }
+      } release{this};
+      if (g_fastPath.load(std::memory_order_relaxed) && !_locked) {
+         if (_chunkPos > 0) _output->WriteMessage(_level, _chunk, _chunkPos);
+      } else {
+         Flush();
+      }
+   }
+
+   bool IsActive() const { return static_cast<bool>(_output); }
+
+private:
+   void WriteLogPrefix(const std::string& subsystem,
+                       const std::map<std::string, std::string>& context) {
+      struct timespec now;
+      clock_gettime(CLOCK_REALTIME, &now);
+      if (now.tv_sec != _second) {
+         // localtime_r takes a process-wide lock: once a second per thread is enough.
+         struct tm local;
+         localtime_r(&now.tv_sec, &local);
+         _second = now.tv_sec;
+         if (local.tm_year != _dateYear || local.tm_mon != _dateMonth ||
+             local.tm_mday != _dateDay) {
+            snprintf(_dateText, sizeof(_dateText), "%04u-%02u-%02u",
+                     static_cast<unsigned>(local.tm_year + 1900) % 10000u,
+                     static_cast<unsigned>(local.tm_mon + 1) % 100u,
+                     static_cast<unsigned>(local.tm_mday) % 100u);
+            _dateYear = local.tm_year;
+            _dateMonth = local.tm_mon;
+            _dateDay = local.tm_mday;
+         }
+         if (local.tm_gmtoff != _bias || _biasText[0] == 0) {
+            long bias = local.tm_gmtoff;
+            char sign = bias < 0 ? '-' : '+';
+            if (bias < 0) bias = -bias;
+            snprintf(_biasText, sizeof(_biasText), "%c%02lu:%02lu", sign,
+                     static_cast<unsigned long>(bias / 3600) % 100ul,
+                     static_cast<unsigned long>(bias / 60) % 60ul);
+            _bias = local.tm_gmtoff;
+         }
+         snprintf(_secondText, sizeof(_secondText), "%02u:%02u:%02u.",
+                  static_cast<unsigned>(local.tm_hour) % 100u,
+                  static_cast<unsigned>(local.tm_min) % 100u,
+                  static_cast<unsigned>(local.tm_sec) % 100u);
+      }
+      // "%sT%s%s [%p %s '" with the date, time, bias, thread and level texts, bounded to
+      // kPrefixLimit bytes with its terminator as a bounded printf would; assembled from
+      // the cached texts because a printf here costs a third of a short line.
+      unsigned millis = static_cast<unsigned>(now.tv_nsec / 1000000) % 1000u;
+      char timeText[14];
+      size_t secondLength = strlen(_secondText);
+      memcpy(timeText, _secondText, secondLength);
+      timeText[secondLength] = static_cast<char>('0' + millis / 100);
+      timeText[secondLength + 1] = static_cast<char>('0' + millis / 10 % 10);
+      timeText[secondLength + 2] = static_cast<char>('0' + millis % 10);
+      timeText[secondLength + 3] = 0;
+      BoundedText head;
+      head.Append(_dateText);
+      head.Append("T");
+      head.Append(timeText);
+      head.Append(_biasText);
+      head.Append(" [");
+      head.Append(_threadText);
+      head.Append(" ");
+      head.Append(GetCombinedLevelName(_level));
+      head.Append(" '");
+      if (context.empty() &&
+          static_cast<int>(subsystem.size()) + head.size + 3 <= kChunkSize - _chunkPos) {
+         // The usual prefix: straight into the empty chunk.
+         char* out = _chunk + _chunkPos;
+         memcpy(out, head.data, static_cast<size_t>(head.size));
+         out += head.size;
+         memcpy(out, subsystem.data(), subsystem.size());
+         out += subsystem.size();
+         memcpy(out, "'] ", 3);
+         _chunkPos += head.size + static_cast<int>(subsystem.size()) + 3;
+         return;
+      }
+      Write(head.data, head.size);
+      Write(subsystem.data(), static_cast<int>(subsystem.size()));
+      Write("'", 1);
+      for (const auto& [key, value] : context) {
+         Write(" ", 1);
+         Write(key.data(), static_cast<int>(key.size()));
+         Write("=", 1);
+         Write(value.data(), static_cast<int>(value.size()));
+      }
+      Write("] ", 2);
+   }
+
+   const void* const _threadId;
+   char _chunk[kChunkSize];
+   int _chunkPos = 0;
+   Ref<LogOutput> _output;
+   bool _locked = false;
+   Logger::CombinedLevel _level = 0;
+   // Caches: the date text for its day, the bias text for its bias, the clock fields
+   // for the second they were made for.
+   char _dateText[12] = "";
+   int _dateYear = -1, _dateMonth = -1, _dateDay = -1;
+   char _biasText[8] = "";
+   long _bias = 0;
+   time_t _second = -1;
+   char _secondText[10] = "";  // "hh:mm:ss."
+   char _threadText[24];
+};
+
+// The calling thread's line writers, one per nesting depth, and its log context. Kept in
+// the thread's TLS slot (released with the thread) and cached in a thread-local pointer.
+class LoggerTlsState : public ObjectImpl {
+public:
+   ~LoggerTlsState() override;
+
+   static LoggerTlsState& Get();
+
+   TlsBufferedLogWriter* Push() {
+      if (_depth == _writers.size()) _writers.push_back(new TlsBufferedLogWriter());
+      return _writers[_depth++].Get();
+   }
+   TlsBufferedLogWriter* Top() { return _depth == 0 ? nullptr : _writers[_depth - 1].Get(); }
+   void Pop() { --_depth; }
+   size_t Depth() const { return _depth; }
+
+   std::map<std::string, std::string> context;
+
+private:
+   std::vector<Ref<TlsBufferedLogWriter>> _writers;
+   size_t _depth = 0;
+};
+
+// Initial-exec: one load instead of a call on every log call.
+[[gnu::tls_model("initial-exec")]] thread_local LoggerTlsState* t_state = nullptr;
+
+LoggerTlsState::~LoggerTlsState() {
+   if (t_state == this) t_state = nullptr;
+}
+
+LoggerTlsState& LoggerTlsState::Get() {
+   if (t_state) return *t_state;
+   static const int key = System::ReserveTlsKey();
+   System::Thread* thread = System::GetThisThread();
+   auto* state = dynamic_cast<LoggerTlsState*>(thread->GetTls(key));
+   if (!state) {
+      state = new LoggerTlsState();
+      thread->SetTls(key, state);
+   }
+   t_state = state;
+   return *state;
+}
+
+std::mutex g_callbackMutex;
+std::map<std::string, LogContextCallback> g_callbacks;
+
+}  // namespace
+
+bool IsUsingLogFastPath() { return g_fastPath.load(std::memory_order_relaxed); }
+void SetUsingLogFastPath(bool on) { g_fastPath.store(on, std::memory_order_relaxed); }
+
+void LoggerImpl::Begin(LogLevel level) {
+   BeginCombined(static_cast<CombinedLevel>(level) * 0x10001u & GetCombinedMask());
+}
+
+void LoggerImpl::BeginCombined(CombinedLevel level) {
+   LoggerTlsState& state = LoggerTlsState::Get();
+   size_t depth = state.Depth();
+   TlsBufferedLogWriter* writer = state.Push();
+   try {
+      writer->Begin(level, _name, _output.Get(), state.context);
+   } catch (...) {
+      state.Pop();
+      throw;
+   }
+   if (depth > 0) {
+      try {
+         MessageFormatter::Print(writer, "(Log recursion level %1) ", static_cast<int>(depth));
+      } catch (...) {
+         // Like the prefix: the line goes on without it.
+      }
+   }
+}
+
+void LoggerImpl::Write(const char* data, int length) {
+   TlsBufferedLogWriter* writer = LoggerTlsState::Get().Top();
+   if (writer) writer->Write(data, length);
+}
+
+Writer* LoggerImpl::GetLineWriter() { return LoggerTlsState::Get().Top(); }
+
+void LoggerImpl::End() {
+   LoggerTlsState& state = LoggerTlsState::Get();
+   TlsBufferedLogWriter* writer = state.Top();
+   if (!writer) return;
+   struct PopOnExit {
+      LoggerTlsState& state;
+      ~PopOnExit() { state.Pop(); }
+   } pop{state};
+   writer->Write("\n", 1);
+   writer->End();
+}
+
+void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
+                     const PrintFormatter* args, int count) noexcept {
+   try {
+      logger->Begin(level);
+   } catch (...) {
+      return;
+   }
+   try {
+      Writer* line = logger->GetLineWriter();
+      MessageFormatter::PrintArgs(line ? line : logger, format, args, count);
+   } catch (...) {
+      // A bad argument or format ends the line here; logging never throws.
+   }
+   try {
+      logger->End();
+   } catch (...) {
+   }
+}
+
+void SetLogContext(const std::string& key, const std::string& value) {
+   LoggerTlsState& state = LoggerTlsState::Get();
+   if (value.empty()) {
+      state.context.erase(key);
+   } else {
+      state.context[key] = value;
+   }
+   std::map<std::string, LogContextCallback> callbacks;
+   {
+      std::lock_guard<std::mutex> lock(g_callbackMutex);
+      callbacks = g_callbacks;
+   }
+   for (auto& [name, callback] : callbacks) callback(key, value);
+}
+
+std::string GetLogContext(const std::string& key) {
+   LoggerTlsState& state = LoggerTlsState::Get();
+   auto it = state.context.find(key);
+   return it == state.context.end() ? std::string() : it->second;
+}
+
+void AddLogContextUpdateCallback(const std::string& name, const LogContextCallback& callback) {
+   std::lock_guard<std::mutex> lock(g_callbackMutex);
+   g_callbacks[name] = callback;
+}
+
+void RemoveLogContextUpdateCallback(const std::string& name) {
+   std::lock_guard<std::mutex> lock(g_callbackMutex);
+   g_callbacks.erase(name);
+}
+
+}  // namespace Pelmora::Service

@@ -1,0 +1,175 @@
+// The syslog writer: one datagram per line in the local syslog format, sent without
+// waiting over a local datagram socket that may come and go.
+
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cstdio>
+#include <cstring>
+
+#include "pelmora/exception/exceptions.h"
+#include "pelmora/service/logWriters.h"
+#include "src/service/logImpl.h"
+
+extern char* program_invocation_short_name;
+
+namespace Pelmora::Service {
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+
+constexpr const char* kMonths[] = {"Jan", "Feb", "Mar", "Apr", "May", "Jun",
+                                   "Jul", "Aug", "Sep", "Oct", "Nov", "Dec"};
+
+// The highest level bit of the output half decides.
+Logger::LogLevel HighestLevel(Logger::CombinedLevel level) {
+   Logger::CombinedLevel low = level & 0xFFFF;
+   if (low == 0) low = level >> Logger::kMemoryShift;
+   if (low == 0) return Logger::LOG_NONE;
+   return static_cast<Logger::LogLevel>(1u << (31 - __builtin_clz(low)));
+}
+
+class SyslogLogWriterImpl : public LogWriterImpl, public virtual SyslogLogWriter {
+public:
+   SyslogLogWriterImpl(const LogSyslogOptions& options, Logger::CombinedLevel mask)
+      : LogWriterImpl(nullptr, mask, false), _options(options) {
+      if (_options.ident.empty()) _options.ident = program_invocation_short_name;
+      if (_options.maxMessageSize < 64) _options.maxMessageSize = 64;
+      Connect();
+   }
+
+   ~SyslogLogWriterImpl() override {
+      if (_fd >= 0) close(_fd);
+   }
+
+   uint64_t GetLostCount() const override { return _lost.load(std::memory_order_relaxed); }
+   uint64_t GetTruncatedCount() const override {
+      return _truncated.load(std::memory_order_relaxed);
+   }
+
+   void Reopen() override {
+      std::lock_guard<std::mutex> lock(_mutex);
+      Disconnect();
+      Connect();
+   }
+
+protected:
+   void WriteLocked(Logger::CombinedLevel level, const char* data, int length) override {
+      if (_line.empty()) _lineLevel = level;
+      _line.append(data, static_cast<size_t>(length));
+      if (_line.back() != '\n') return;
+      _line.pop_back();
+      Send();
+      _line.clear();
+   }
+
+   void FlushLocked() override {}
+   void CloseLocked() override { Disconnect(); }
+
+private:
+   void Send() {
+      char head[128];
+      time_t now = time(nullptr);
+      struct tm local;
+      localtime_r(&now, &local);
+      int priority = _options.facility | GetSyslogSeverity(HighestLevel(_lineLevel));
+      int n = snprintf(head, sizeof(head), "<%d>%s %2d %02d:%02d:%02d %s[%d]: ", priority,
+                       kMonths[local.tm_mon % 12], local.tm_mday, local.tm_hour, local.tm_min,
+                       local.tm_sec, _options.ident.c_str(), static_cast<int>(getpid()));
+      if (n < 0) return;
+      if (n >= static_cast<int>(sizeof(head))) n = sizeof(head) - 1;
+      _message.assign(head, static_cast<size_t>(n));
+      _message += _line;
+      if (_message.size() > static_cast<size_t>(_options.maxMessageSize)) {
+         _message.resize(static_cast<size_t>(_options.maxMessageSize));
+         _truncated.fetch_add(1, std::memory_order_relaxed);
+      }
+      if (_fd < 0 && !Connect()) {
+         _lost.fetch_add(1, std::memory_order_relaxed);
+         return;
+      }
+      if (SendOnce()) return;
+      int error = errno;
+      if (error != EAGAIN && error != EWOULDBLOCK && error != ENOBUFS) {
+         // The receiver went away (restarted, socket replaced): connect anew once.
+         Disconnect();
+         if (Connect(true) && SendOnce()) return;
+      }
+      _lost.fetch_add(1, std::memory_order_relaxed);
+   }
+
+   bool SendOnce() {
+      for (;;) {
+         ssize_t n = send(_fd, _message.data(), _message.size(), MSG_DONTWAIT | MSG_NOSIGNAL);
+         if (n >= 0) return true;
+         if (errno != EINTR) return false;
+      }
+   }
+
+   // Tries at most once per reconnect interval unless `now`.
+   bool Connect(bool now = false) {
+      Clock::time_point at = Clock::now();
+      if (!now && at < _nextAttempt) return false;
+      _nextAttempt = at + std::chrono::milliseconds(_options.reconnectIntervalMs);
+      int fd = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0);
+      if (fd < 0) return false;
+      struct sockaddr_un address;
+      memset(&address, 0, sizeof(address));
+      address.sun_family = AF_UNIX;
+      if (_options.socketPath.size() >= sizeof(address.sun_path)) {
+         close(fd);
+         return false;
+      }
+      memcpy(address.sun_path, _options.socketPath.data(), _options.socketPath.size());
+      if (connect(fd, reinterpret_cast<struct sockaddr*>(&address), sizeof(address)) != 0) {
+         close(fd);
+         return false;
+      }
+      _fd = fd;
+      return true;
+   }
+
+   void Disconnect() {
+      if (_fd >= 0) close(_fd);
+      _fd = -1;
+   }
+
+   LogSyslogOptions _options;
+   int _fd = -1;
+   Clock::time_point _nextAttempt;
+   std::string _line;
+   std::string _message;
+   Logger::CombinedLevel _lineLevel = 0;
+   std::atomic<uint64_t> _lost{0};
+   std::atomic<uint64_t> _truncated{0};
+};
+
+}  // namespace
+
+int GetSyslogSeverity(Logger::LogLevel level) {
+   switch (level) {
+      case Logger::LOG_QUIET: return 5;    // notice
+      case Logger::LOG_PANIC: return 2;    // crit
+      case Logger::LOG_ERROR: return 3;    // err
+      case Logger::LOG_WARNING: return 4;  // warning
+      case Logger::LOG_INFO: return 6;     // info
+      default: return 7;                   // debug: verbose, trivia
+   }
+}
+
+void CreateSyslogLogWriter(const std::string&, const LogSyslogOptions& options,
+                           Ref<SyslogLogWriter>& out) {
+   Logger::CombinedLevel mask;
+   if (!FindLevelMask(options.level, mask)) {
+      throw InvalidArgumentException("log level '" + options.level + "'");
+   }
+   out = new SyslogLogWriterImpl(options, mask);
+}
+
+}  // namespace Pelmora::Service
