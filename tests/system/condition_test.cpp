@@ -45,6 +45,10 @@ TEST_F(ConditionTest, TimedWaitOfZeroReturnsAtOnce) {
 }
 
 TEST_F(ConditionTest, SignalWakesOneWaiterAndBroadcastTheRest) {
+   // The test thread waits for progress on a condition of its own: waiting on the one
+   // under test would make it a waiter that may rightly take the signal meant for others.
+   Ref<Condition> progress;
+   GetSystemFactory()->CreateCondition(progress);
    int entered = 0;
    int woken = 0;
    std::vector<std::thread> waiters;
@@ -52,24 +56,25 @@ TEST_F(ConditionTest, SignalWakesOneWaiterAndBroadcastTheRest) {
       waiters.emplace_back([&] {
          Synchronized lock(mutex.Get());
          ++entered;
+         progress->Signal();
          condition->Wait(mutex.Get());
          EXPECT_TRUE(mutex->IsLocked());
          ++woken;
+         progress->Signal();
       });
    }
    // A waiter counted under the mutex is already inside Wait: the mutex is released only
    // after the waiter has registered, so no wake-up below can miss it.
-   for (;;) {
+   {
       Synchronized lock(mutex.Get());
-      if (entered == 3) break;
-      condition->TimedWait(mutex.Get(), 1000);
+      while (entered < 3) progress->TimedWait(mutex.Get(), 1000);
    }
    condition->Signal();
    {
       Synchronized lock(mutex.Get());
-      while (woken < 1) condition->TimedWait(mutex.Get(), 1000);
+      while (woken < 1) progress->TimedWait(mutex.Get(), 1000);
       // Give a wrongly woken second waiter the time to show.
-      condition->TimedWait(mutex.Get(), 3000);
+      progress->TimedWait(mutex.Get(), 3000);
       EXPECT_EQ(1, woken);
    }
    condition->Broadcast();
