@@ -377,9 +377,56 @@ void LogManagerImpl::UnregisterLogger(LoggerImpl* logger) {
    _loggers.erase(logger);
 }
 
+namespace {
+
+// The mask of the longest prefix in `prefixes` that `subsystem` begins with.
+const Logger::CombinedLevel* FindPrefix(
+      const std::map<std::string, Logger::CombinedLevel>& prefixes, const std::string& subsystem) {
+   const Logger::CombinedLevel* found = nullptr;
+   size_t longest = 0;
+   for (const auto& [prefix, mask] : prefixes) {
+      if (subsystem.compare(0, prefix.size(), prefix) == 0 && (!found || prefix.size() > longest)) {
+         found = &mask;
+         longest = prefix.size();
+      }
+   }
+   return found;
+}
+
+}  // namespace
+
 bool LogManagerImpl::HasOwnLevels(const std::string& subsystem) {
    Guard guard(this);
-   return _logLevels.count(subsystem) != 0 || _memLevels.count(subsystem) != 0;
+   return _logLevels.count(subsystem) != 0 || _memLevels.count(subsystem) != 0 ||
+          FindPrefix(_logPrefixes, subsystem) || FindPrefix(_memPrefixes, subsystem);
+}
+
+bool LogManagerImpl::SetLogLevelForPrefix(const std::string& prefix, const std::string& level) {
+   Logger::CombinedLevel mask;
+   if (!FindLevelMask(level, mask)) return false;
+   Guard guard(this);
+   _logPrefixes[prefix] = mask;
+   for (LoggerImpl* logger : _loggers) {
+      const std::string& name = logger->GetSubsystemName();
+      if (!_logLevels.count(name) && FindPrefix(_logPrefixes, name) == &_logPrefixes[prefix]) {
+         logger->SetLogHalf(mask);
+      }
+   }
+   return true;
+}
+
+bool LogManagerImpl::SetMemLevelForPrefix(const std::string& prefix, const std::string& level) {
+   Logger::CombinedLevel mask;
+   if (!FindLevelMask(level, mask)) return false;
+   Guard guard(this);
+   _memPrefixes[prefix] = mask;
+   for (LoggerImpl* logger : _loggers) {
+      const std::string& name = logger->GetSubsystemName();
+      if (!_memLevels.count(name) && FindPrefix(_memPrefixes, name) == &_memPrefixes[prefix]) {
+         logger->SetMemHalf(mask);
+      }
+   }
+   return true;
 }
 
 bool LogManagerImpl::SetLogLevel(const std::string& subsystem, const std::string& level) {
@@ -437,13 +484,17 @@ void LogManagerImpl::GetMemLoggers(std::map<std::string, std::string>& out) {
 Logger::CombinedLevel LogManagerImpl::FindLogLevelForName(const std::string& subsystem) {
    Guard guard(this);
    auto it = _logLevels.find(subsystem);
-   return it == _logLevels.end() ? _defaultLog : it->second;
+   if (it != _logLevels.end()) return it->second;
+   const Logger::CombinedLevel* prefix = FindPrefix(_logPrefixes, subsystem);
+   return prefix ? *prefix : _defaultLog;
 }
 
 Logger::CombinedLevel LogManagerImpl::FindMemLevelForName(const std::string& subsystem) {
    Guard guard(this);
    auto it = _memLevels.find(subsystem);
-   return it == _memLevels.end() ? _defaultMem : it->second;
+   if (it != _memLevels.end()) return it->second;
+   const Logger::CombinedLevel* prefix = FindPrefix(_memPrefixes, subsystem);
+   return prefix ? *prefix : _defaultMem;
 }
 
 void LogManagerImpl::GetOrCreateLogOutput(const std::string& name, Ref<LogOutput>& out) {

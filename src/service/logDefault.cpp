@@ -142,6 +142,29 @@ bool IsLoggingReportSinkActive() noexcept {
    return dynamic_cast<LoggingReportSink*>(&Internal::GetReportSink()) != nullptr;
 }
 
+bool IsReportWanted(Logger* logger, int level) noexcept {
+   try {
+      if (logger && IsLoggingReportSinkActive()) {
+         return logger->IsLevelWanted(static_cast<Logger::LogLevel>(level));
+      }
+      return Internal::GetReportSink().IsLevelEnabled(level);
+   } catch (...) {
+      return false;
+   }
+}
+
+void WriteReport(Logger* logger, int level, const std::string& text) noexcept {
+   try {
+      if (logger && IsLoggingReportSinkActive()) {
+         LogInternal(logger, static_cast<Logger::LogLevel>(level), "%1", text);
+         return;
+      }
+      Internal::GetReportSink().Log(level, text);
+   } catch (...) {
+      // A failing sink has nowhere to report to.
+   }
+}
+
 void CreateLogger(Writer* writer, const std::string& name, const std::string& level,
                   LogManager* manager, Ref<Logger>& out) {
    Ref<LogManager> owned = manager;

@@ -173,6 +173,11 @@ public:
    void UnregisterLogger(LoggerImpl* logger);
    // Whether the manager keeps a level for `subsystem`.
    bool HasOwnLevels(const std::string& subsystem);
+   void LoadLogLevels(Config* config) override;
+   // As SetLogLevel and SetMemLevel, for every subsystem whose name begins with `prefix`
+   // and has no level of its own; the longest matching prefix wins.
+   bool SetLogLevelForPrefix(const std::string& prefix, const std::string& level);
+   bool SetMemLevelForPrefix(const std::string& prefix, const std::string& level);
 
 private:
    // Locks unless the calling thread holds the lock already (the panic path does).
@@ -182,6 +187,8 @@ private:
    std::set<LoggerImpl*> _loggers;
    std::map<std::string, Logger::CombinedLevel> _logLevels;  // 16-bit masks
    std::map<std::string, Logger::CombinedLevel> _memLevels;
+   std::map<std::string, Logger::CombinedLevel> _logPrefixes;
+   std::map<std::string, Logger::CombinedLevel> _memPrefixes;
    Logger::CombinedLevel _defaultLog;
    Logger::CombinedLevel _defaultMem;
    RefMap<std::string, LogOutput> _outputs;

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "pelmora/exception/panic.h"
+#include "pelmora/service/config.h"
 #include "pelmora/xml/parser.h"
 #include "src/xml/nodeArena.h"
 #include "src/xml/nodeImpl.h"
@@ -17,24 +18,28 @@
 namespace Pelmora::Xml {
 namespace {
 
-// One limit as the configuration gives it. The application carries no configuration yet,
-// so each key answers its default; the configuration's 64-bit getter belongs here, and
-// only here, once it exists.
-long long ReadLimit(const char* key, long long def) {
+// One limit as the configuration gives it, as a 64-bit integer with a default.
+long long ReadLimit(Service::Config::View* view, const char* key, long long def) {
    PELMORA_VERIFY(def >= 0);
-   static_cast<void>(key);
    long long out = def;
+   view->Get(key, &out);
    PELMORA_VERIFY(out >= 0);
    return out;
 }
 
 // The limits of handlers created without explicit ones, read when each handler is made.
+// There is no application configuration to read yet: a fresh scratch configuration holds
+// nothing, so each key answers its default.
 DocLimits ReadDocLimits() {
+   Ref<Service::Config> config;
+   Service::CreateScratchConfig(config);
+   Ref<Service::Config::View> view;
+   config->GetMainView(view);
    const DocLimits defaults;
    DocLimits limits;
-   limits.maxChars = ReadLimit("pelmora/xml/doc/maxChars", defaults.maxChars);
-   limits.maxNodes = ReadLimit("pelmora/xml/doc/maxNodes", defaults.maxNodes);
-   limits.maxDepth = ReadLimit("pelmora/xml/doc/maxDepth", defaults.maxDepth);
+   limits.maxChars = ReadLimit(view.Get(), "pelmora/xml/doc/maxChars", defaults.maxChars);
+   limits.maxNodes = ReadLimit(view.Get(), "pelmora/xml/doc/maxNodes", defaults.maxNodes);
+   limits.maxDepth = ReadLimit(view.Get(), "pelmora/xml/doc/maxDepth", defaults.maxDepth);
    return limits;
 }
 

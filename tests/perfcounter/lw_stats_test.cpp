@@ -5,7 +5,7 @@
 #include "pelmora/io/writers.h"
 #include "pelmora/object/scoreboard.h"
 #include "pelmora/perfCounter.h"
-#include "tests/perfcounter/logCapture.h"
+#include "tests/support/logCapture.h"
 
 namespace Pelmora::PerfCounter {
 namespace {
@@ -17,7 +17,7 @@ TEST(ValidateStatsScopeTest, KeysFollowTheScopeGrammar) {
    for (const char* key : {"Pool/Thread='io'/Busy", "A", "A='x'", "A/B='1'/C", "Zed='a b'/Q"}) {
       EXPECT_TRUE(ValidateStatsScope(key)) << key;
    }
-   TestSupport::LogCapture log;
+   Pelmora::TestSupport::ScopedLogCapture log;
    for (const char* key : {"", "pool/x", "A//B", "A/b", "A=x", "A/", "A=", "A='x'='y'", "A/='x'"}) {
       EXPECT_FALSE(ValidateStatsScope(key)) << key;
    }
@@ -82,7 +82,7 @@ TEST(LwStatsBuilderTest, NamespacesMakeKeysAndAccumulatorsAccumulate) {
 }
 
 TEST(LwStatsBuilderTest, AnInvalidKeyIsLoggedOnceAndDropped) {
-   TestSupport::LogCapture log;
+   Pelmora::TestSupport::ScopedLogCapture log;
    Ref<LwStatsBuilder> builder;
    CreateLwStatsBuilder(builder);
    builder->Push("pool");

@@ -6,7 +6,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/perfCounter.h"
-#include "tests/perfcounter/logCapture.h"
+#include "tests/support/logCapture.h"
 
 namespace Pelmora::PerfCounter {
 namespace {
@@ -68,7 +68,7 @@ TEST_F(PublishedMapTest, AFailedPublicationIsLoggedAndTheMergeGoesOn) {
    CreatePublishedAccumulator(registry.Get(), squatter.Get(), published);
    published->Publish();
 
-   TestSupport::LogCapture log;
+   Pelmora::TestSupport::ScopedLogCapture log;
    Ref<LwStatsBuilder> builder;
    CreateLwStatsBuilder(builder);
    builder->Insert("Taken", 1, CounterFactory());
@@ -88,7 +88,7 @@ TEST_F(PublishedMapTest, AddChecksKeysAndRefusesKnownOnes) {
    meter->Sample(100);  // the map holds its own copy
    EXPECT_EQ("/Disk/Io/total = 4", Values()[4]);
    EXPECT_THROW(map->Add("Disk/Io", meter.Get()), AlreadyExistsException);
-   TestSupport::LogCapture log;
+   Pelmora::TestSupport::ScopedLogCapture log;
    EXPECT_THROW(map->Add("disk", meter.Get()), InvalidArgumentException);
    EXPECT_EQ(1u, log.Lines().size());
 }

@@ -3,7 +3,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/perfCounter.h"
-#include "tests/perfcounter/logCapture.h"
+#include "tests/support/logCapture.h"
 
 namespace Pelmora::PerfCounter {
 namespace {
@@ -77,7 +77,7 @@ TEST_F(RegistryTest, MalformedNamesAreRefusedWithTheName) {
 }
 
 TEST_F(RegistryTest, DuplicatesRefuseTheWholeBatchAndAreLogged) {
-   TestSupport::LogCapture log;
+   Pelmora::TestSupport::ScopedLogCapture log;
    EXPECT_THROW(RegisterGroup({"/x/y", "/a/b", "/a/b"}), AlreadyExistsException);
    EXPECT_EQ(0, registry->GetCounterCount());
    RegisterGroup({"/a/b"});
@@ -154,7 +154,7 @@ TEST_F(RegistryTest, ToStringShowsPublishersTreeAndQueries) {
 }
 
 TEST(RegistryDestructionTest, LeftoverQueriesAndCountersAreReported) {
-   TestSupport::LogCapture log;
+   Pelmora::TestSupport::ScopedLogCapture log;
    Ref<Query> query;
    {
       Ref<Registry> registry;

@@ -10,33 +10,14 @@
 #include "pelmora/io.h"
 #include "pelmora/xml.h"
 #include "src/core/report.h"
+#include "tests/support/logCapture.h"
 
 namespace Pelmora::Xml {
 namespace {
 
-// Collects what the XML layer logs.
-class CapturingSink : public Internal::ReportSink {
-public:
-   bool IsLevelEnabled(int) override { return true; }
-   void Log(int level, const std::string& text) override {
-      std::lock_guard<std::mutex> lock(_mutex);
-      _lines.push_back(std::to_string(level) + " " + text);
-   }
-   void LogMemoryBuffer(int, const std::string&, bool) override {}
-   void Flush() override {}
-
-   std::vector<std::string> Take() {
-      std::lock_guard<std::mutex> lock(_mutex);
-      return std::exchange(_lines, {});
-   }
-
-private:
-   std::mutex _mutex;
-   std::vector<std::string> _lines;
-};
-
-CapturingSink& Sink() {
-   static CapturingSink* sink = new CapturingSink();  // a sink must outlive every caller
+// Collects what the XML layer logs; it must outlive every caller.
+TestSupport::LogCapture& Sink() {
+   static TestSupport::LogCapture* sink = new TestSupport::LogCapture();
    return *sink;
 }
 

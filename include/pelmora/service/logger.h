@@ -18,6 +18,8 @@
 
 namespace Pelmora::Service {
 
+class Config;
+
 class LogManager;
 class LogOutput;
 class LogWriter;
@@ -150,6 +152,11 @@ public:
    virtual bool SetMemLevel(const std::string& subsystem, const std::string& level) = 0;
    virtual bool SetLevel(const std::string& subsystem, const std::string& logLevel,
                          const std::string& memLevel) = 0;
+   // Applies the entries under "level" of `config`: each child names a subsystem in
+   // "logName" and may give "logLevel" and "memoryLevel"; with "prefix" set to true the
+   // levels apply to every subsystem whose name begins with "logName". Entries without a
+   // name and unknown level names are logged as warnings and skipped.
+   virtual void LoadLogLevels(Config* config) = 0;
    // The levels of subsystems without their own.
    virtual bool SetDefaultLevels(const std::string& logLevel, const std::string& memLevel) = 0;
    // Subsystem -> level name of every living logger (the log or the memory half).
