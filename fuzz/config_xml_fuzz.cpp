@@ -7,28 +7,14 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/config.h"
-#include "src/core/report.h"
 #include "support/configRoundTrip.h"
+#include "support/silentSink.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
 
-namespace {
-
-// Refused entities log a line per input; the fuzzer needs none of them.
-class SilentSink : public Internal::ReportSink {
-public:
-   bool IsLevelEnabled(int) override { return false; }
-   void Log(int, const std::string&) override {}
-   void LogMemoryBuffer(int, const std::string&, bool) override {}
-   void Flush() override {}
-};
-
-}  // namespace
-
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-   static SilentSink sink;
-   Internal::SetReportSink(&sink);
+   PelmoraFuzz::InstallSilentSink();
    return 0;
 }
 

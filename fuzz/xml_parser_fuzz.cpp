@@ -13,21 +13,12 @@
 
 #include "pelmora/io.h"
 #include "pelmora/xml.h"
-#include "src/core/report.h"
+#include "support/silentSink.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Xml;
 
 namespace {
-
-// Refused entities and limits log a line per input; the fuzzer needs none of them.
-class SilentSink : public Internal::ReportSink {
-public:
-   bool IsLevelEnabled(int) override { return false; }
-   void Log(int, const std::string&) override {}
-   void LogMemoryBuffer(int, const std::string&, bool) override {}
-   void Flush() override {}
-};
 
 // Hands out the input in pieces of a fuzzed size, to move expat's block boundaries around.
 class PieceReader : public Reader, public ObjectImpl {
@@ -69,8 +60,7 @@ Ref<XMLParser> NewParser(const DocLimits& limits) {
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
-   static SilentSink sink;
-   Internal::SetReportSink(&sink);
+   PelmoraFuzz::InstallSilentSink();
    return 0;
 }
 

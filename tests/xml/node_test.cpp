@@ -6,21 +6,13 @@
 #include "pelmora/exception.h"
 #include "pelmora/io.h"
 #include "pelmora/xml.h"
+#include "tests/xml/nodeBuilders.h"
 
 namespace Pelmora::Xml {
 namespace {
 
-Ref<ElementNode> Element(const std::string& name) {
-   Ref<ElementNode> element;
-   CreateElementNode(name, element);
-   return element;
-}
-
-Ref<TextNode> Text(const std::string& text) {
-   Ref<TextNode> node;
-   CreateTextNode(text, node);
-   return node;
-}
+using Testing::Element;
+using Testing::Text;
 
 // The children's tags (or "#" + type for other kinds), in order, walked both ways.
 std::string Children(Node* parent) {

@@ -6,27 +6,14 @@
 #include "pelmora/formatter.h"
 #include "pelmora/io.h"
 #include "pelmora/xml.h"
+#include "tests/xml/nodeBuilders.h"
 
 namespace Pelmora::Xml {
 namespace {
 
-Ref<ElementNode> Element(const std::string& name) {
-   Ref<ElementNode> element;
-   CreateElementNode(name, element);
-   return element;
-}
-
-Ref<TextNode> Text(const std::string& text) {
-   Ref<TextNode> node;
-   CreateTextNode(text, node);
-   return node;
-}
-
-Ref<CommentNode> Comment(const std::string& text) {
-   Ref<CommentNode> node;
-   CreateCommentNode(text, node);
-   return node;
-}
+using Testing::Element;
+using Testing::Text;
+using Testing::Comment;
 
 std::string Compact(const Node* node) {
    Ref<StringWriter> writer;
