@@ -7,6 +7,7 @@
 #include <charconv>
 #include <cstdio>
 #include <cstring>
+#include <mutex>
 #include <strings.h>
 
 #include "pelmora/exception/exceptions.h"
@@ -22,26 +23,12 @@ namespace {
 // A node with this many children gets a lookup index.
 constexpr size_t kIndexThreshold = 8;
 
-class ReadGuard {
-public:
-   explicit ReadGuard(std::shared_mutex* lock) : _lock(lock) { _lock->lock_shared(); }
-   ~ReadGuard() { _lock->unlock_shared(); }
-   ReadGuard(const ReadGuard&) = delete;
-   ReadGuard& operator=(const ReadGuard&) = delete;
-
-private:
-   std::shared_mutex* _lock;
+// The standard guards over a pointer to the configuration's lock.
+struct ReadGuard : std::shared_lock<std::shared_mutex> {
+   explicit ReadGuard(std::shared_mutex* lock) : std::shared_lock<std::shared_mutex>(*lock) {}
 };
-
-class WriteGuard {
-public:
-   explicit WriteGuard(std::shared_mutex* lock) : _lock(lock) { _lock->lock(); }
-   ~WriteGuard() { _lock->unlock(); }
-   WriteGuard(const WriteGuard&) = delete;
-   WriteGuard& operator=(const WriteGuard&) = delete;
-
-private:
-   std::shared_mutex* _lock;
+struct WriteGuard : std::unique_lock<std::shared_mutex> {
+   explicit WriteGuard(std::shared_mutex* lock) : std::unique_lock<std::shared_mutex>(*lock) {}
 };
 
 void ValidatePath(std::string_view path) {
