@@ -1,8 +1,11 @@
 // Views: paths, typed values, defaults, ids, and concurrent use.
 
 #include <atomic>
+#include <climits>
 #include <string>
 #include <thread>
+#include <type_traits>
+#include <utility>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -15,357 +18,252 @@ using namespace Pelmora::Service;
 
 namespace {
 
-struct Scratch {
-   Scratch() {
-      CreateScratchConfig(config);
-      config->GetMainView(view);
-   }
-   Ref<Config> config;
-   Ref<Config::View> view;
-};
+// The value at `path` read as a T; "<absent>" text or T{} when nothing answers.
+template <class T = std::string>
+T Get(Config::View* view, const std::string& path) {
+   T value{};
+   if constexpr (std::is_same_v<T, std::string>) value = "<absent>";
+   view->Get(path, &value);
+   return value;
+}
+
+// Writes `value` at "x" and reads it back as a T.
+template <class T, class V>
+T SetGet(Config::View* view, V value) {
+   view->Set("x", value);
+   return Get<T>(view, "x");
+}
 
 template <class T>
-std::string FailureText(Config::View* view, const std::string& path) {
-   T value{};
+std::string ErrorText(Config::View* view, const char* text) {
    try {
-      view->Get(path, &value);
+      SetGet<T>(view, text);
    } catch (const NumberFormatException& e) {
       return e.what();
    }
    return "no exception";
 }
 
+class ConfigViewTest : public testing::Test {
+protected:
+   ConfigViewTest() {
+      CreateScratchConfig(config);
+      config->GetMainView(main);
+      config->GetDefaultsMainView(defaults);
+      v = main.Get();
+   }
+   static Ref<Config::View> View(Config* config, const std::string& path) {
+      Ref<Config::View> out;
+      config->GetView(path, out);
+      return out;
+   }
+   Ref<Config> config;
+   Ref<Config::View> main, defaults;
+   Config::View* v;
+};
+
 }  // namespace
 
-TEST(ConfigPathTest, EmptySegmentsAndIdsAddressTheSameNode) {
-   Scratch s;
-   s.view->Set("a//b/", "1");
-   std::string value;
-   ASSERT_TRUE(s.view->Get("a/b", &value));
-   EXPECT_EQ(value, "1");
-   ASSERT_TRUE(s.view->Get("/a/b//", &value));
-
-   s.view->Set("level[x]/name", "with id");
-   s.view->Set("level/name", "without id");
-   ASSERT_TRUE(s.view->Get("level[x]/name", &value));
-   EXPECT_EQ(value, "with id");
-   ASSERT_TRUE(s.view->Get("level/name", &value));
-   EXPECT_EQ(value, "without id");
-   EXPECT_FALSE(s.view->Get("level[y]/name", &value));
-   // An empty id is an id: it does not match the node without one.
-   EXPECT_FALSE(s.view->Get("level[]/name", &value));
+TEST_F(ConfigViewTest, EmptySegmentsAreSkippedAndIdsMatchExactly) {
+   v->Set("a//b/", "1");
+   EXPECT_EQ(Get(v, "/a/b//"), "1");
+   v->Set("level[x]/name", "with id");
+   v->Set("level/name", "without id");
+   EXPECT_EQ(Get(v, "level[x]/name"), "with id");
+   EXPECT_EQ(Get(v, "level/name"), "without id");
+   EXPECT_EQ(Get(v, "level[y]/name"), "<absent>");
+   EXPECT_EQ(Get(v, "level[]/name"), "<absent>");  // an empty id is an id
 }
 
-TEST(ConfigPathTest, UnclosedBracketThrowsEvenWhereNothingExists) {
-   Scratch s;
+TEST_F(ConfigViewTest, UnclosedBracketThrowsEvenWhereNothingExists) {
    std::string value;
-   EXPECT_THROW(s.view->Get("log/level[x", &value), InvalidArgumentException);
-   EXPECT_THROW(s.view->Get("missing/level[x/y", &value), InvalidArgumentException);
-   EXPECT_THROW(s.view->Set("level[x/name", "v"), InvalidArgumentException);
-   EXPECT_THROW(s.view->Set("a[b]c", "v"), InvalidArgumentException);
+   std::vector<std::string> names;
    Ref<Config::View> sub;
-   EXPECT_THROW(s.config->GetView("level[x", sub), InvalidArgumentException);
-   // The failed Set left nothing behind.
-   EXPECT_FALSE(s.view->IsSet("level"));
-   EXPECT_FALSE(s.config->IsDirty());
+   EXPECT_THROW(v->Get("log/level[x", &value), InvalidArgumentException);
+   EXPECT_THROW(v->Get("missing/level[x/y", &value), InvalidArgumentException);
+   EXPECT_THROW(v->Set("level[x/name", "v"), InvalidArgumentException);
+   EXPECT_THROW(v->Set("a[b]c", "v"), InvalidArgumentException);
+   EXPECT_THROW(v->GetChildNames("level[x", names), InvalidArgumentException);
+   EXPECT_THROW(config->GetView("level[x", sub), InvalidArgumentException);
+   EXPECT_FALSE(v->IsSet("level"));  // the failed Set left nothing behind
+   EXPECT_FALSE(config->IsDirty());
 }
 
-TEST(ConfigViewTest, DefaultsAnswerOnlyWhenTheMainTreeIsSilent) {
-   Scratch s;
-   Ref<Config::View> defaults;
-   s.config->GetDefaultsMainView(defaults);
+TEST_F(ConfigViewTest, DefaultsAnswerOnlyWhenTheMainTreeIsSilent) {
    defaults->Set("log/level", "info");
    defaults->Set("log/maxFileNum", 10);
-
-   std::string level;
-   ASSERT_TRUE(s.view->Get("log/level", &level));
-   EXPECT_EQ(level, "info");
-   EXPECT_FALSE(s.view->IsSet("log/level"));  // defaults are not "set"
-
-   s.view->Set("log/level", "trivia");
-   ASSERT_TRUE(s.view->Get("log/level", &level));
-   EXPECT_EQ(level, "trivia");
-   int files = 0;
-   ASSERT_TRUE(s.view->Get("log/maxFileNum", &files));
-   EXPECT_EQ(files, 10);
-
-   s.view->Unset("log/level");
-   ASSERT_TRUE(s.view->Get("log/level", &level));
-   EXPECT_EQ(level, "info");
-
+   EXPECT_FALSE(config->IsDirty());  // defaults never make the configuration dirty
+   EXPECT_EQ(Get(v, "log/level"), "info");
+   EXPECT_FALSE(v->IsSet("log/level"));  // defaults are not "set"
+   v->Set("log/level", "trivia");
+   EXPECT_EQ(Get(v, "log/level"), "trivia");
+   EXPECT_EQ(Get<int>(v, "log/maxFileNum"), 10);
+   v->Unset("log/level");
+   EXPECT_EQ(Get(v, "log/level"), "info");
    // A sub-view sees the defaults at its own prefix.
-   Ref<Config::View> log;
-   s.config->GetView("log", log);
-   ASSERT_TRUE(log->Get("maxFileNum", &files));
-   EXPECT_EQ(files, 10);
-   // Filling the defaults never makes the configuration dirty.
-   EXPECT_TRUE(s.config->IsDirty());  // from the Set and Unset above
+   EXPECT_EQ(Get<int>(View(config.Get(), "log").Get(), "maxFileNum"), 10);
+
+   // SetConfigDefaults copies another view's subtree; the main tree still wins.
+   Ref<Config> source;
+   CreateScratchConfig(source);
+   Ref<Config::View> sourceView = View(source.Get(), "pelmora");
+   sourceView->Set("log/maxFileNum", 5);
+   sourceView->Set("http/port", 8080);
+   SetConfigDefaults(config.Get(), sourceView.Get());
+   EXPECT_EQ(Get<int>(v, "http/port"), 8080);
+   EXPECT_EQ(Get<int>(v, "log/maxFileNum"), 5);  // values of the copied view win
+   EXPECT_EQ(Get(v, "log/level"), "info");       // over what the defaults held
+   EXPECT_FALSE(v->IsSet("http/port"));
+   v->Set("http/port", 1);
+   EXPECT_EQ(Get<int>(v, "http/port"), 1);
+   sourceView->Set("log/maxFileNum", 9);  // a copy: later changes do not reach the defaults
+   EXPECT_EQ(Get<int>(v, "log/maxFileNum"), 5);
 }
 
-TEST(ConfigViewTest, SetConfigDefaultsCopiesAViewsSubtree) {
-   Scratch target;
-   Scratch source;
-   source.view->Set("pelmora/threadPool/maxThreads", 8);
-   source.view->Set("pelmora/http/port", 8080);
-   Ref<Config::View> pelmora;
-   source.config->GetView("pelmora", pelmora);
+TEST_F(ConfigViewTest, TypedValuesReadBackAsSetAndLenientFormsParse) {
+   EXPECT_EQ(SetGet<int>(v, INT_MIN), INT_MIN);
+   EXPECT_EQ(SetGet<unsigned>(v, UINT_MAX), UINT_MAX);
+   EXPECT_EQ(SetGet<long long>(v, LLONG_MIN), LLONG_MIN);
+   EXPECT_EQ(SetGet<double>(v, 0.1), 0.1);
+   EXPECT_EQ(Get(v, "x"), "0.1");
+   EXPECT_TRUE(SetGet<bool>(v, true));
+   EXPECT_EQ(Get(v, "x"), "true");
+   EXPECT_EQ(SetGet<std::string>(v, false), "false");
+   int untouched = 42;
+   EXPECT_FALSE(v->Get("absent", &untouched));
+   EXPECT_EQ(untouched, 42);
 
-   target.view->Set("threadPool/maxThreads", 2);
-   SetConfigDefaults(target.config.Get(), pelmora.Get());
-   int value = 0;
-   ASSERT_TRUE(target.view->Get("http/port", &value));
-   EXPECT_EQ(value, 8080);
-   ASSERT_TRUE(target.view->Get("threadPool/maxThreads", &value));
-   EXPECT_EQ(value, 2);  // the main tree still wins
-   EXPECT_FALSE(target.view->IsSet("http/port"));
-
-   // A copy: later changes of the source do not reach the defaults.
-   source.view->Set("pelmora/http/port", 9090);
-   ASSERT_TRUE(target.view->Get("http/port", &value));
-   EXPECT_EQ(value, 8080);
-}
-
-TEST(ConfigViewTest, TypedValuesReadBackAsSet) {
-   Scratch s;
-   s.view->Set("i", -2147483647 - 1);
-   s.view->Set("u", 4294967295u);
-   s.view->Set("ll", -9223372036854775807LL - 1);
-   s.view->Set("d", 0.1);
-   s.view->Set("b", true);
-   s.view->Set("s", std::string("text"));
-   int i = 0;
-   unsigned u = 0;
-   long long ll = 0;
-   double d = 0;
-   bool b = false;
-   std::string text;
-   ASSERT_TRUE(s.view->Get("i", &i));
-   ASSERT_TRUE(s.view->Get("u", &u));
-   ASSERT_TRUE(s.view->Get("ll", &ll));
-   ASSERT_TRUE(s.view->Get("d", &d));
-   ASSERT_TRUE(s.view->Get("b", &b));
-   EXPECT_EQ(i, -2147483647 - 1);
-   EXPECT_EQ(u, 4294967295u);
-   EXPECT_EQ(ll, -9223372036854775807LL - 1);
-   EXPECT_EQ(d, 0.1);
-   EXPECT_TRUE(b);
-   ASSERT_TRUE(s.view->Get("b", &text));
-   EXPECT_EQ(text, "true");
-   ASSERT_TRUE(s.view->Get("d", &text));
-   EXPECT_EQ(text, "0.1");
-   s.view->Set("b", false);
-   ASSERT_TRUE(s.view->Get("b", &text));
-   EXPECT_EQ(text, "false");
-
-   // Absent values leave the target alone.
-   i = 42;
-   EXPECT_FALSE(s.view->Get("absent", &i));
-   EXPECT_EQ(i, 42);
-}
-
-TEST(ConfigViewTest, LenientNumberAndBooleanForms) {
-   Scratch s;
-   s.view->Set("n", " +17");
-   s.view->Set("t", "TRUE");
-   s.view->Set("f", "False");
-   s.view->Set("e", "1e3");
-   int n = 0;
-   bool t = false, f = true;
-   double e = 0;
-   ASSERT_TRUE(s.view->Get("n", &n));
-   EXPECT_EQ(n, 17);
-   ASSERT_TRUE(s.view->Get("t", &t));
-   EXPECT_TRUE(t);
-   ASSERT_TRUE(s.view->Get("f", &f));
+   EXPECT_EQ(SetGet<int>(v, " +17"), 17);
+   EXPECT_TRUE(SetGet<bool>(v, "TRUE"));
+   bool f = true;
+   v->Set("f", "False");
+   EXPECT_TRUE(v->Get("f", &f));
    EXPECT_FALSE(f);
-   ASSERT_TRUE(s.view->Get("e", &e));
-   EXPECT_EQ(e, 1000.0);
+   EXPECT_EQ(SetGet<double>(v, "1e3"), 1000.0);
+   EXPECT_EQ(SetGet<long long>(v, "2147483648"), 2147483648LL);
 }
 
-TEST(ConfigViewTest, UnparsableValuesGiveTheExactTexts) {
-   Scratch s;
-   s.view->Set("junk", "12abc");
-   s.view->Set("big", "2147483648");
-   s.view->Set("negative", "-1");
-   s.view->Set("empty", "");
-   s.view->Set("yes", "yes");
-   s.view->Set("truex", "truex");
-   s.view->Set("plusminus", "+-3");
-   const std::string integer = "Config Value not an integer";
-   EXPECT_EQ(FailureText<int>(s.view.Get(), "junk"), integer);
-   EXPECT_EQ(FailureText<int>(s.view.Get(), "big"), integer);
-   EXPECT_EQ(FailureText<int>(s.view.Get(), "plusminus"), integer);
-   EXPECT_EQ(FailureText<long long>(s.view.Get(), "junk"), integer);
-   EXPECT_EQ(FailureText<unsigned>(s.view.Get(), "negative"), integer);
-   EXPECT_EQ(FailureText<int>(s.view.Get(), "empty"), integer);
-   EXPECT_EQ(FailureText<double>(s.view.Get(), "junk"), "Config value not a double");
-   EXPECT_EQ(FailureText<double>(s.view.Get(), "empty"), "Config value not a double");
-   EXPECT_EQ(FailureText<bool>(s.view.Get(), "yes"), "Config Value not a boolean");
-   EXPECT_EQ(FailureText<bool>(s.view.Get(), "truex"), "Config Value not a boolean");
-   long long big = 0;
-   ASSERT_TRUE(s.view->Get("big", &big));
-   EXPECT_EQ(big, 2147483648LL);
+TEST_F(ConfigViewTest, UnparsableValuesGiveTheExactTexts) {
+   const std::string integer = "Config Value not an integer", dbl = "Config value not a double";
+   const std::string boolean = "Config Value not a boolean";
+   const struct {
+      std::string (*parse)(Config::View*, const char*);
+      const char* text;
+      std::string error;
+   } cases[] = {{ErrorText<int>, "12abc", integer},       {ErrorText<int>, "2147483648", integer},
+                {ErrorText<int>, "+-3", integer},         {ErrorText<int>, "", integer},
+                {ErrorText<long long>, "12abc", integer}, {ErrorText<unsigned>, "-1", integer},
+                {ErrorText<double>, "12abc", dbl},        {ErrorText<double>, "", dbl},
+                {ErrorText<bool>, "yes", boolean},        {ErrorText<bool>, "truex", boolean}};
+   for (auto& c : cases) EXPECT_EQ(c.parse(v, c.text), c.error) << c.text;
 }
 
-TEST(ConfigViewTest, ValuesAndChildrenNeverShareANode) {
-   Scratch s;
-   s.view->Set("a/b", "1");
-   EXPECT_THROW(s.view->Set("a", "x"), InvalidArgumentException);
-   s.view->Set("v", "value");
-   EXPECT_THROW(s.view->Set("v/child", "x"), InvalidArgumentException);
-   // An empty value gives way to children.
-   s.view->Set("e", "");
-   s.view->Set("e/child", "x");
-   std::string value;
-   ASSERT_TRUE(s.view->Get("e/child", &value));
-   EXPECT_FALSE(s.view->Get("e", &value));
-   EXPECT_THROW(s.view->Set("", "root"), InvalidArgumentException);
+TEST_F(ConfigViewTest, ValuesAndChildrenNeverShareANodeAndUnsetPrunes) {
+   v->Set("a/b", "1");
+   EXPECT_THROW(v->Set("a", "x"), InvalidArgumentException);
+   v->Set("v", "value");
+   EXPECT_THROW(v->Set("v/child", "x"), InvalidArgumentException);
+   EXPECT_THROW(v->Set("", "root"), InvalidArgumentException);
+   v->Set("e", "");  // an empty value gives way to children
+   v->Set("e/child", "x");
+   EXPECT_EQ(Get(v, "e/child"), "x");
+   EXPECT_EQ(Get(v, "e"), "<absent>");
+
+   // Unset removes the subtree and the ancestors it leaves empty.
+   v->Set("a/x/c", "1");
+   v->Unset("a/x/c");
+   EXPECT_FALSE(v->IsSet("a/x"));
+   EXPECT_TRUE(v->IsSet("a/b"));
+   v->Unset("a/b");
+   EXPECT_FALSE(v->IsSet("a"));
+   v->Unset("never/there");  // no-op
+   v->Set("t/one", "1");
+   v->Set("t/two", "2");
+   v->Unset("t");
+   EXPECT_FALSE(v->IsSet("t/one") || v->IsSet("t/two"));
 }
 
-TEST(ConfigViewTest, UnsetRemovesTheSubtreeAndEmptiedAncestors) {
-   Scratch s;
-   s.view->Set("a/b/c", "1");
-   s.view->Set("a/x", "2");
-   s.view->Unset("a/b/c");
-   EXPECT_FALSE(s.view->IsSet("a/b"));
-   EXPECT_TRUE(s.view->IsSet("a/x"));
-   s.view->Unset("a/x");
-   EXPECT_FALSE(s.view->IsSet("a"));
-   s.view->Unset("never/there");  // no-op
-
-   s.view->Set("t/one", "1");
-   s.view->Set("t/two", "2");
-   s.view->Unset("t");
-   EXPECT_FALSE(s.view->IsSet("t/one"));
-   EXPECT_FALSE(s.view->IsSet("t/two"));
-}
-
-TEST(ConfigViewTest, SubViewsFollowTheirNodeThroughRemovalAndCreation) {
-   Scratch s;
-   Ref<Config::View> log;
-   s.config->GetView("log", log);  // the node does not exist yet
+TEST_F(ConfigViewTest, SubViewsFollowTheirNodeThroughRemovalAndCreation) {
+   Ref<Config::View> log = View(config.Get(), "log"), nested;  // the node does not exist yet
    log->Set("level", "info");
-   std::string value;
-   ASSERT_TRUE(s.view->Get("log/level", &value));
-   EXPECT_EQ(value, "info");
-
-   s.view->Unset("log");
-   EXPECT_FALSE(log->Get("level", &value));
-   s.view->Set("log/level", "error");  // a new node at the same place
-   ASSERT_TRUE(log->Get("level", &value));
-   EXPECT_EQ(value, "error");
-
-   Ref<Config::View> nested;
+   EXPECT_EQ(Get(v, "log/level"), "info");
+   v->Unset("log");
+   EXPECT_EQ(Get(log.Get(), "level"), "<absent>");
+   v->Set("log/level", "error");  // a new node at the same place
+   EXPECT_EQ(Get(log.Get(), "level"), "error");
    log->GetView("sub[7]", nested);
    nested->Set("x", 1);
-   ASSERT_TRUE(s.view->Get("log/sub[7]/x", &value));
-   EXPECT_EQ(value, "1");
+   EXPECT_EQ(Get(v, "log/sub[7]/x"), "1");
 }
 
-TEST(ConfigViewTest, ManyChildrenStayReachableThroughTheIndex) {
-   Scratch s;
-   for (int i = 0; i < 100; ++i) s.view->Set("list/item[" + std::to_string(i) + "]", i);
-   for (int i = 0; i < 100; i += 2) s.view->Unset("list/item[" + std::to_string(i) + "]");
-   for (int i = 0; i < 100; ++i) {
-      int value = -1;
-      bool found = s.view->Get("list/item[" + std::to_string(i) + "]", &value);
-      ASSERT_EQ(found, i % 2 == 1) << i;
-      if (found) {
-         EXPECT_EQ(value, i);
-      }
-   }
-   s.view->Set("list/item[0]", 1000);
-   int value = 0;
-   ASSERT_TRUE(s.view->Get("list/item[0]", &value));
-   EXPECT_EQ(value, 1000);
+TEST_F(ConfigViewTest, ManyChildrenStayReachableThroughTheIndex) {
+   auto item = [](int i) { return "list/item[" + std::to_string(i) + "]"; };
+   for (int i = 0; i < 100; ++i) v->Set(item(i), i);
+   for (int i = 0; i < 100; i += 2) v->Unset(item(i));
+   for (int i = 0; i < 100; ++i) EXPECT_EQ(Get(v, item(i)), i % 2 ? std::to_string(i) : "<absent>");
+   v->Set(item(0), 1000);
+   EXPECT_EQ(Get(v, item(0)), "1000");
 }
 
-TEST(ConfigViewTest, ChildNamesListTheMainTreeThenDefaultsOnly) {
-   Scratch s;
-   s.view->Set("level/entry[0001]/logName", "xml");
-   s.view->Set("level/entry[0000]/logName", "http");
-   s.view->Set("level/plain", "1");
-   Ref<Config::View> defaults;
-   s.config->GetDefaultsMainView(defaults);
+TEST_F(ConfigViewTest, ChildNamesListTheMainTreeThenDefaultsOnly) {
+   v->Set("level/entry[0001]/logName", "xml");
+   v->Set("level/entry[0000]/logName", "http");
+   v->Set("level/plain", "1");
    defaults->Set("level/entry[0000]/logName", "soap");
    defaults->Set("level/entry[0009]/logName", "journal");
-
    std::vector<std::string> names;
-   s.view->GetChildNames("/level//", names);
-   EXPECT_EQ((std::vector<std::string>{"entry[0001]", "entry[0000]", "plain", "entry[0009]"}),
-             names);
-   // The names are segments: each addresses its child again.
-   std::string value;
-   ASSERT_TRUE(s.view->Get("level/" + names[3] + "/logName", &value));
-   EXPECT_EQ("journal", value);
-
-   s.view->GetChildNames("level/entry[0001]", names);
-   EXPECT_EQ(std::vector<std::string>{"logName"}, names);
-   s.view->GetChildNames("absent", names);
+   v->GetChildNames("/level//", names);
+   EXPECT_EQ(names,
+             (std::vector<std::string>{"entry[0001]", "entry[0000]", "plain", "entry[0009]"}));
+   EXPECT_EQ(Get(v, "level/" + names[3] + "/logName"), "journal");  // each name is a segment
+   v->GetChildNames("level/entry[0001]", names);
+   EXPECT_EQ(names, std::vector<std::string>{"logName"});
+   v->GetChildNames("absent", names);
    EXPECT_TRUE(names.empty());
-   EXPECT_THROW(s.view->GetChildNames("level[x", names), InvalidArgumentException);
 }
 
-TEST(ConfigGenerateIdTest, FollowsTheLastChildWithTheTag) {
-   Scratch s;
+TEST_F(ConfigViewTest, GenerateIdFollowsTheLastChildWithTheTag) {
+   // Each case: children set in order under a fresh parent, then the id for "item".
+   const std::pair<std::vector<std::string>, std::string> cases[] = {
+       {{}, "0000"},
+       {{"other"}, "0000"},
+       {{"item[0000]", "item[0001]"}, "0002"},
+       // The last child counts, not the largest id; setting an existing one keeps the order.
+       {{"item[0000]", "item[0041]", "item[0007]", "item[0000]"}, "0008"},
+       {{"item[abc]"}, "abc0000"},     {{"item[12]"}, "120000"},
+       {{"item[x9999]"}, "x99990000"}, {{"item[ab0099]"}, "ab0100"}};
+   int parent = 0;
    std::string id;
-   s.view->GenerateId("missing/item", &id);
-   EXPECT_EQ(id, "0000");
-   s.view->Set("list/other", "1");
-   s.view->GenerateId("list/item", &id);
-   EXPECT_EQ(id, "0000");
-
-   s.view->Set("list/item[0000]", "a");
-   s.view->Set("list/item[0001]", "b");
-   s.view->GenerateId("list/item", &id);
-   EXPECT_EQ(id, "0002");
-   // The last child counts, not the largest id.
-   s.view->Set("list/item[0000]", "c");  // already there: order unchanged
-   s.view->Set("list/item[0041]", "d");
-   s.view->Set("list/item[0007]", "e");
-   s.view->GenerateId("list/item", &id);
-   EXPECT_EQ(id, "0008");
-
-   s.view->Set("abc/item[abc]", "x");
-   s.view->GenerateId("abc/item", &id);
-   EXPECT_EQ(id, "abc0000");
-   s.view->Set("short/item[12]", "x");
-   s.view->GenerateId("short/item", &id);
-   EXPECT_EQ(id, "120000");
-   s.view->Set("nine/item[x9999]", "x");
-   s.view->GenerateId("nine/item", &id);
-   EXPECT_EQ(id, "x99990000");
-   s.view->Set("mid/item[ab0099]", "x");
-   s.view->GenerateId("mid/item[ignored]", &id);
-   EXPECT_EQ(id, "ab0100");
-
-   s.view->Set("plain/item", "no id");
-   EXPECT_THROW(s.view->GenerateId("plain/item", &id), InvalidArgumentException);
+   for (auto& [children, expected] : cases) {
+      std::string prefix = "p" + std::to_string(parent++) + "/";
+      for (auto& child : children) v->Set(prefix + child, "x");
+      v->GenerateId(prefix + (parent % 2 ? "item" : "item[ignored]"), &id);
+      EXPECT_EQ(id, expected) << prefix;
+   }
+   v->Set("plain/item", "no id");
+   EXPECT_THROW(v->GenerateId("plain/item", &id), InvalidArgumentException);
 }
 
-TEST(ConfigViewTest, ConcurrentReadersAndWritersSeeWholeValues) {
-   Scratch s;
-   for (int i = 0; i < 50; ++i) s.view->Set("k/v" + std::to_string(i), "aaaa");
+TEST_F(ConfigViewTest, ConcurrentReadersAndWritersSeeWholeValues) {
+   auto key = [](int i) { return "v" + std::to_string(i); };
+   for (int i = 0; i < 50; ++i) v->Set("k/" + key(i), "aaaa");
    std::atomic<bool> stop{false};
    std::atomic<int> bad{0};
    std::vector<std::thread> readers;
    for (int t = 0; t < 3; ++t) {
       readers.emplace_back([&] {
-         Ref<Config::View> view;
-         s.config->GetView("k", view);
+         Ref<Config::View> view = View(config.Get(), "k");
          std::string value;
          while (!stop.load()) {
             for (int i = 0; i < 50; ++i) {
-               if (view->Get("v" + std::to_string(i), &value) && value != "aaaa" && value != "bbbbbbbb") {
-                  ++bad;
-               }
+               if (view->Get(key(i), &value) && value != "aaaa" && value != "bbbbbbbb") ++bad;
             }
          }
       });
    }
    for (int round = 0; round < 200; ++round) {
-      for (int i = 0; i < 50; ++i) s.view->Set("k/v" + std::to_string(i), round % 2 ? "aaaa" : "bbbbbbbb");
-      s.view->Unset("k/v" + std::to_string(round % 50));
+      for (int i = 0; i < 50; ++i) v->Set("k/" + key(i), round % 2 ? "aaaa" : "bbbbbbbb");
+      v->Unset("k/" + key(round % 50));
    }
    stop = true;
    for (auto& t : readers) t.join();

@@ -1,73 +1,62 @@
-#include <gtest/gtest.h>
-#include <gmock/gmock.h>
-
 #include <thread>
-#include <vector>
 
-#include "pelmora/exception/exceptions.h"
-#include "pelmora/perfCounter.h"
+#include "tests/perfcounter/fixture.h"
 #include "tests/support/logCapture.h"
 
-namespace Pelmora::PerfCounter {
+namespace Pelmora::PerfCounter::Testing {
 namespace {
 
 using testing::ElementsAre;
-using testing::HasSubstr;
 
-class PublishedMapTest : public testing::Test {
+class PublishedMapTest : public RegistryFixture {
 protected:
    void SetUp() override {
-      CreateCounterRegistry(registry);
+      RegistryFixture::SetUp();
       CreatePublishedAccumulatorMap(registry.Get(), map);
    }
-   void TearDown() override { map->Clear(); }
-
-   std::vector<std::string> Values() {
-      QueryResults results;
-      registry->CollectAll(results);
-      std::vector<std::string> texts;
-      for (const QueryResult& r : results) texts.push_back(r.ToString());
-      return texts;
+   void TearDown() override {
+      map->Clear();
+      RegistryFixture::TearDown();
    }
-
-   Ref<Registry> registry;
    Ref<PublishedAccumulatorMap> map;
 };
 
-TEST_F(PublishedMapTest, MergePublishesNewKeysAndAddsToKnownOnes) {
+TEST_F(PublishedMapTest, MergeAddFindAndRemove) {
    Ref<LwStatsBuilder> builder;
+   Ref<LwMeterAccumulator> meter = new LwMeterAccumulator("anything");
    CreateLwStatsBuilder(builder);
    builder->Push("Pool");
    builder->Insert("Jobs", 2, CounterFactory());
    builder->Insert("Wait", 7, MeterFactory());
    map->Merge(*builder);
-   map->Merge(*builder);
-   EXPECT_EQ(2, map->GetSize());
-   EXPECT_THAT(Values(), ElementsAre("/Pool/Jobs = 4", "/Pool/Wait/max = 7", "/Pool/Wait/mean = 7",
-                                     "/Pool/Wait/min = 7", "/Pool/Wait/numSamples = 2",
-                                     "/Pool/Wait/total = 14"));
-
+   map->Merge(*builder);  // known keys add up
+   EXPECT_THAT(All(), ElementsAre("/Pool/Jobs = 4", "/Pool/Wait/max = 7", "/Pool/Wait/mean = 7",
+                                  "/Pool/Wait/min = 7", "/Pool/Wait/numSamples = 2",
+                                  "/Pool/Wait/total = 14"));
    Ref<PublishedAccumulator> jobs;
    ASSERT_TRUE(map->Find("Pool/Jobs", jobs));
    EXPECT_EQ("/Pool/Jobs", jobs->GetName());
    jobs->Sample(10);
-   EXPECT_EQ("/Pool/Jobs = 14", Values()[0]);
+   EXPECT_EQ("/Pool/Jobs = 14", All()[0]);
    EXPECT_FALSE(map->Find("Pool/Nothing", jobs));
-
    EXPECT_TRUE(map->Remove("Pool/Wait"));
    EXPECT_FALSE(map->Remove("Pool/Wait"));
-   EXPECT_THAT(Values(), ElementsAre("/Pool/Jobs = 14"));
+   EXPECT_THAT(All(), ElementsAre("/Pool/Jobs = 14"));
+
+   meter->Sample(4);
+   map->Add("Disk/Io", meter.Get());
+   meter->Sample(100);  // the map holds its own copy
+   EXPECT_EQ("/Disk/Io/total = 4", All()[4]);
+   EXPECT_THROW(map->Add("Disk/Io", meter.Get()), AlreadyExistsException);
+   Pelmora::TestSupport::ScopedLogCapture log;
+   EXPECT_THROW(map->Add("disk", meter.Get()), InvalidArgumentException);
+   EXPECT_EQ(1u, log.Lines().size());
    map->Clear();
    EXPECT_EQ(0, registry->GetCounterCount());
 }
 
 TEST_F(PublishedMapTest, AFailedPublicationIsLoggedAndTheMergeGoesOn) {
-   // Someone else already owns the counter path the key would publish under.
-   Ref<LwCounter> squatter = new LwCounter("/Taken");
-   Ref<PublishedAccumulator> published;
-   CreatePublishedAccumulator(registry.Get(), squatter.Get(), published);
-   published->Publish();
-
+   Add({"/Taken"});  // someone else owns the path the key would publish under
    Pelmora::TestSupport::ScopedLogCapture log;
    Ref<LwStatsBuilder> builder;
    CreateLwStatsBuilder(builder);
@@ -75,22 +64,8 @@ TEST_F(PublishedMapTest, AFailedPublicationIsLoggedAndTheMergeGoesOn) {
    builder->Insert("Free", 1, CounterFactory());
    map->Merge(*builder);
    EXPECT_EQ(1, map->GetSize());
-   EXPECT_THAT(log.Lines(),
-               ElementsAre("8 ValidateNewCounters: Counter /Taken exists.",
-                           "4 While publishing ctr Taken: Already exists: /Taken"));
-   published->Unpublish();
-}
-
-TEST_F(PublishedMapTest, AddChecksKeysAndRefusesKnownOnes) {
-   Ref<LwMeterAccumulator> meter = new LwMeterAccumulator("anything");
-   meter->Sample(4);
-   map->Add("Disk/Io", meter.Get());
-   meter->Sample(100);  // the map holds its own copy
-   EXPECT_EQ("/Disk/Io/total = 4", Values()[4]);
-   EXPECT_THROW(map->Add("Disk/Io", meter.Get()), AlreadyExistsException);
-   Pelmora::TestSupport::ScopedLogCapture log;
-   EXPECT_THROW(map->Add("disk", meter.Get()), InvalidArgumentException);
-   EXPECT_EQ(1u, log.Lines().size());
+   EXPECT_THAT(log.Lines(), ElementsAre("8 ValidateNewCounters: Counter /Taken exists.",
+                                        "4 While publishing ctr Taken: Already exists: /Taken"));
 }
 
 TEST_F(PublishedMapTest, ThreadsMergeTheirOwnBuildersThroughScopes) {
@@ -115,27 +90,20 @@ TEST_F(PublishedMapTest, ThreadsMergeTheirOwnBuildersThroughScopes) {
       });
    }
    for (auto& thread : threads) thread.join();
-
-   Ref<PublishedAccumulator> done;
-   ASSERT_TRUE(map->Find("Work/Done", done));
-   NamedValues values;
-   done->GetValues(values);
-   EXPECT_EQ(kThreads * kRounds, values[0].second.Get());
+   EXPECT_THAT(Match("^/Work/Done"),
+               ElementsAre("/Work/Done = " + std::to_string(kThreads * kRounds)));
    MeterAccessor cost(registry.Get(), "/Work/Cost");
    EXPECT_EQ(5, cost.Refresh());
    const Meter expected(kRounds * (0 + 1 + 2 + 3), kThreads * kRounds, 0, 3, 1);
    EXPECT_TRUE(cost.GetMeter().Equals(&expected)) << cost.GetMeter().ToString();
-   std::vector<std::string> workers;
-   registry->EnumeratePath("/Worker='2'", workers);
-   EXPECT_THAT(workers, ElementsAre("Rounds"));
+   EXPECT_THAT(Match("^/Worker='2'/"),
+               ElementsAre("/Worker='2'/Rounds = " + std::to_string(kRounds)));
    EXPECT_EQ(2 + kThreads, map->GetSize());
 }
 
-TEST(PublishedMapDeathTest, MergingAnotherKindUnderAKnownKeyPanics) {
-   Ref<Registry> registry;
-   CreateCounterRegistry(registry);
-   Ref<PublishedAccumulatorMap> map;
-   CreatePublishedAccumulatorMap(registry.Get(), map);
+using PublishedMapDeathTest = PublishedMapTest;
+
+TEST_F(PublishedMapDeathTest, MergingAnotherKindUnderAKnownKeyPanics) {
    Ref<LwStatsBuilder> counts, meters;
    CreateLwStatsBuilder(counts);
    CreateLwStatsBuilder(meters);
@@ -144,25 +112,18 @@ TEST(PublishedMapDeathTest, MergingAnotherKindUnderAKnownKeyPanics) {
    map->Merge(*counts);
    EXPECT_DEATH(map->Merge(*meters),
                 "Assert Failed: \"\\(\\*itr\\)->GetType\\(\\) == itr2->first->GetType\\(\\)\"");
-   map->Clear();
 }
 
 TEST(PublishedMapProcessTest, TheProcessMapPublishesInTheProcessRegistry) {
-   PublishedAccumulatorMap* map = GetPublishedAccumulatorMap();
-   ASSERT_EQ(map, GetPublishedAccumulatorMap());
    {
       TlsScope scope;
       scope.GetBuilder().Insert("ProcessMapTest", 3, CounterFactory());
    }
-   std::vector<std::string> names = {"/ProcessMapTest"};
-   Ref<Query> query;
-   GetCounterRegistry()->CreateNamesQuery(names, query);
    QueryResults results;
-   query->Execute(results);
-   ASSERT_EQ(1u, results.size());
-   EXPECT_EQ(3, results[0].value.Get());
-   EXPECT_TRUE(map->Remove("ProcessMapTest"));
+   GetCounterRegistry()->CollectAll(results);
+   EXPECT_THAT(Texts(results), testing::Contains("/ProcessMapTest = 3"));
+   EXPECT_TRUE(GetPublishedAccumulatorMap()->Remove("ProcessMapTest"));
 }
 
 }  // namespace
-}  // namespace Pelmora::PerfCounter
+}  // namespace Pelmora::PerfCounter::Testing

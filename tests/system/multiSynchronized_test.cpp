@@ -10,60 +10,45 @@
 namespace Pelmora::System {
 namespace {
 
-// Records the order in which a guard takes and releases its locks.
-class RecordingLock : public RWLockableObjectImpl {
+// Records in `log` the order in which a guard takes and releases its locks.
+struct Recorder {
+   std::string* log;
+   char name;
+   void Note(char what) { *log += std::string{what, name}; }
+};
+
+class RecordingLock : public RWLockableObjectImpl, public Recorder {
 public:
-   RecordingLock(std::string* log, char name) : _log(log), _name(name) {}
+   RecordingLock(std::string* log, char name) : Recorder{log, name} {}
    void ReadLock() override { Note('r'); }
    void WriteLock() override { Note('w'); }
    void Unlock() override { Note('u'); }
-   char GetName() const { return _name; }
-
-private:
-   void Note(char what) {
-      *_log += what;
-      *_log += _name;
-   }
-   std::string* _log;
-   char _name;
 };
 
-class RecordingMutex : public LockableObjectImpl {
+class RecordingMutex : public LockableObjectImpl, public Recorder {
 public:
-   RecordingMutex(std::string* log, char name) : _log(log), _name(name) {}
+   RecordingMutex(std::string* log, char name) : Recorder{log, name} {}
    void Lock() override {
       LockableObjectImpl::Lock();
-      *_log += 'l';
-      *_log += _name;
+      Note('l');
    }
    void Unlock() override {
-      *_log += 'u';
-      *_log += _name;
+      Note('u');
       LockableObjectImpl::Unlock();
    }
-   char GetName() const { return _name; }
-
-private:
-   std::string* _log;
-   char _name;
 };
 
-// The names of `locks` in ascending address order of their `Base` subobjects.
+// The log of taking `locks` with `take` in ascending address order of their `Base`
+// subobjects and releasing them in reverse.
 template <class Base, class T>
-std::string NamesByAddress(const std::vector<Ref<T>>& locks) {
+std::string Expected(char take, const std::vector<Ref<T>>& locks) {
    std::vector<T*> sorted;
    for (const Ref<T>& lock : locks) sorted.push_back(lock.Get());
    std::sort(sorted.begin(), sorted.end(),
              [](T* x, T* y) { return static_cast<Base*>(x) < static_cast<Base*>(y); });
-   std::string names;
-   for (T* lock : sorted) names += lock->GetName();
-   return names;
-}
-
-std::string Expected(char take, const std::string& names) {
    std::string log;
-   for (char name : names) log += std::string{take, name};
-   for (auto it = names.rbegin(); it != names.rend(); ++it) log += std::string{'u', *it};
+   for (T* lock : sorted) log += std::string{take, lock->name};
+   for (auto it = sorted.rbegin(); it != sorted.rend(); ++it) log += std::string{'u', (*it)->name};
    return log;
 }
 
@@ -74,10 +59,8 @@ TEST(MultiSynchronizedTest, LocksByAscendingAddressUnlocksInReverseAndEmpties) {
    MultiSynchronized guard;
    for (int i : {2, 0, 3, 1}) guard.AddLockable(locks[i].Get());
    guard.Lock();
-   for (auto& lock : locks) EXPECT_TRUE(lock->IsLocked());
    guard.Unlock();
-   for (auto& lock : locks) EXPECT_FALSE(lock->IsLocked());
-   EXPECT_EQ(Expected('l', NamesByAddress<LockableObject>(locks)), log);
+   EXPECT_EQ((Expected<LockableObject>('l', locks)), log);
 
    // Emptied by Unlock: locking again takes nothing until refilled.
    log.clear();
@@ -99,17 +82,16 @@ TEST(MultiReadWriteSynchronizedTest, TakesReadOrWriteHoldsInAddressOrder) {
    std::string log;
    std::vector<Ref<RecordingLock>> locks;
    for (char name : {'a', 'b', 'c'}) locks.push_back(new RecordingLock(&log, name));
-   std::string names = NamesByAddress<RWLockableObject>(locks);
    MultiReadWriteSynchronized guard;
    for (int i : {1, 2, 0}) guard.AddLockable(locks[i].Get());
    guard.ReadLock();
    guard.Unlock();
-   EXPECT_EQ(Expected('r', names), log);
+   EXPECT_EQ((Expected<RWLockableObject>('r', locks)), log);
    log.clear();
    for (int i : {2, 0, 1}) guard.AddLockable(locks[i].Get());
    guard.WriteLock();
    guard.Unlock();
-   EXPECT_EQ(Expected('w', names), log);
+   EXPECT_EQ((Expected<RWLockableObject>('w', locks)), log);
 }
 
 // Filled in opposite orders, the guards still agree on one order: no deadlock however the
@@ -144,40 +126,21 @@ TEST(MultiSynchronizedTest, OppositeFillOrdersNeverDeadlock) {
    EXPECT_EQ(2000, counter);
 }
 
+// Adding or locking again while locked, and unlocking while unlocked, panic.
 TEST(MultiSynchronizedDeathTest, GuardMisusePanics) {
    Ref<LockableObjectImpl> mutex = new LockableObjectImpl();
    Ref<RWLockableObjectImpl> rwLock = new RWLockableObjectImpl();
    const std::string where = "\" @ src/system/multiSynchronized.cpp:[0-9]+\n";
-   EXPECT_DEATH(
-       {
-          MultiSynchronized guard;
-          guard.Lock();
-          guard.AddLockable(mutex.Get());
-       },
-       "Assert Failed: \"!_isLocked" + where);
-   EXPECT_DEATH(
-       {
-          MultiSynchronized guard;
-          guard.Lock();
-          guard.Lock();
-       },
-       "\"!_isLocked" + where);
-   EXPECT_DEATH(MultiSynchronized().Unlock(), "Assert Failed: \"_isLocked" + where);
-   EXPECT_DEATH(
-       {
-          MultiReadWriteSynchronized guard;
-          guard.ReadLock();
-          guard.AddLockable(rwLock.Get());
-       },
-       "\"!_isLocked" + where);
-   EXPECT_DEATH(
-       {
-          MultiReadWriteSynchronized guard;
-          guard.ReadLock();
-          guard.WriteLock();
-       },
-       "\"!_isLocked" + where);
-   EXPECT_DEATH(MultiReadWriteSynchronized().Unlock(), "\"_isLocked" + where);
+   const std::string locked = "Assert Failed: \"!_isLocked" + where;
+   const std::string unlocked = "Assert Failed: \"_isLocked" + where;
+   MultiSynchronized guard;
+   MultiReadWriteSynchronized rwGuard;
+   EXPECT_DEATH((guard.Lock(), guard.AddLockable(mutex.Get())), locked);
+   EXPECT_DEATH((guard.Lock(), guard.Lock()), locked);
+   EXPECT_DEATH(guard.Unlock(), unlocked);
+   EXPECT_DEATH((rwGuard.ReadLock(), rwGuard.AddLockable(rwLock.Get())), locked);
+   EXPECT_DEATH((rwGuard.ReadLock(), rwGuard.WriteLock()), locked);
+   EXPECT_DEATH(rwGuard.Unlock(), unlocked);
 }
 
 }  // namespace

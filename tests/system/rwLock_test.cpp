@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
@@ -21,47 +20,42 @@ void SleepMillis(int milliseconds) {
    std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds));
 }
 
+// Each thread sees only its own holds (counts are tested below); readers share.
 TEST(RWLockTest, HoldsAreTrackedPerThread) {
    Ref<RWLock> lock = NewRWLock();
-   EXPECT_TRUE(lock->IsUnlocked());
-   lock->ReadLock();
    lock->ReadLock();
    EXPECT_TRUE(lock->IsReadLocked());
    EXPECT_FALSE(lock->IsWriteLocked());
    std::thread([&] {
       EXPECT_TRUE(lock->IsUnlocked());
-      lock->ReadLock();  // readers share
+      lock->ReadLock();
       EXPECT_TRUE(lock->IsReadLocked());
       lock->Unlock();
-      EXPECT_TRUE(lock->IsUnlocked());
    }).join();
    lock->Unlock();
-   EXPECT_TRUE(lock->IsReadLocked());
-   lock->Unlock();
    EXPECT_TRUE(lock->IsUnlocked());
-
    lock->WriteLock();
    EXPECT_TRUE(lock->IsWriteLocked());
    EXPECT_FALSE(lock->IsReadLocked());
    std::thread([&] { EXPECT_TRUE(lock->IsUnlocked()); }).join();
    lock->Unlock();
-   EXPECT_TRUE(lock->IsUnlocked());
 }
 
+// Through a lockable object sharing the lock: after the downgrade other readers come in
+// again, writers still wait.
 TEST(RWLockTest, UpgradeAndDowngradeMoveBetweenReadAndWrite) {
-   Ref<RWLock> lock = NewRWLock();
+   Ref<RWLockableObjectImpl> object = new RWLockableObjectImpl();
+   Ref<RWLockableObjectImpl> lock = new RWLockableObjectImpl(object->GetRWLock());
    lock->ReadLock();
    EXPECT_TRUE(lock->UpgradeReadLock());
-   EXPECT_TRUE(lock->IsWriteLocked());
+   EXPECT_TRUE(object->IsWriteLocked());
    lock->DowngradeWriteLock();
-   EXPECT_TRUE(lock->IsReadLocked());
-   // After the downgrade other readers come in again, writers still wait.
+   EXPECT_TRUE(object->GetRWLock()->IsReadLocked());
    std::atomic<bool> written{false};
-   std::thread reader([&] {
+   std::thread([&] {
       lock->ReadLock();
       lock->Unlock();
-   });
-   reader.join();
+   }).join();
    std::thread writer([&] {
       lock->WriteLock();
       written = true;
@@ -72,16 +66,14 @@ TEST(RWLockTest, UpgradeAndDowngradeMoveBetweenReadAndWrite) {
    lock->Unlock();
    writer.join();
    EXPECT_TRUE(written);
-   EXPECT_TRUE(lock->IsUnlocked());
+   EXPECT_TRUE(object->IsUnlocked());
 }
 
 // Whichever of two readers asks second gets false at once and lets the first through by
 // giving up its read hold.
 TEST(RWLockTest, OfTwoConcurrentUpgradersOneGetsFalseAtOnce) {
    Ref<RWLock> lock = NewRWLock();
-   std::atomic<int> holding{0};
-   std::atomic<int> upgraded{0};
-   std::atomic<int> refused{0};
+   std::atomic<int> holding{0}, upgraded{0}, refused{0};
    auto reader = [&] {
       lock->ReadLock();
       ++holding;
@@ -110,18 +102,12 @@ class RWLockModeTest : public testing::TestWithParam<int> {};
 TEST_P(RWLockModeTest, AReaderRelocksWhileAWriterWaits) {
    const bool writerPriority = GetParam() != RWLockableObject::LOCK_MODE_DEFAULT;
    Ref<RWLock> lock = NewRWLock(GetParam());
-   std::mutex orderMutex;
-   std::string order;
+   std::atomic<char> first{0};
    auto record = [&](char who) {
-      std::lock_guard<std::mutex> guard(orderMutex);
-      order += who;
+      char none = 0;
+      first.compare_exchange_strong(none, who);
    };
-   auto recorded = [&] {
-      std::lock_guard<std::mutex> guard(orderMutex);
-      return order;
-   };
-   std::atomic<bool> writerStarting{false};
-   std::atomic<bool> readerStarting{false};
+   std::atomic<bool> writerStarting{false}, readerStarting{false};
    lock->ReadLock();
    std::thread writer([&] {
       writerStarting = true;
@@ -140,9 +126,9 @@ TEST_P(RWLockModeTest, AReaderRelocksWhileAWriterWaits) {
    if (writerPriority) {
       while (!readerStarting) std::this_thread::yield();
       SleepMillis(3);
-      EXPECT_EQ("", recorded());  // held back behind the writer
+      EXPECT_EQ(0, first.load());  // held back behind the writer
    } else {
-      while (recorded().empty()) std::this_thread::yield();
+      while (first == 0) std::this_thread::yield();
    }
    lock->ReadLock();
    EXPECT_TRUE(lock->IsReadLocked());
@@ -150,7 +136,7 @@ TEST_P(RWLockModeTest, AReaderRelocksWhileAWriterWaits) {
    lock->Unlock();
    writer.join();
    reader.join();
-   EXPECT_EQ(writerPriority ? "WR" : "RW", order);
+   EXPECT_EQ(writerPriority ? 'W' : 'R', first.load());
 }
 
 INSTANTIATE_TEST_SUITE_P(Modes, RWLockModeTest,
@@ -161,27 +147,25 @@ INSTANTIATE_TEST_SUITE_P(Modes, RWLockModeTest,
 TEST(RWLockTest, WritersExcludeEveryoneUnderLoad) {
    for (int mode : {0, 1}) {
       Ref<RWLock> lock = NewRWLock(mode);
-      std::atomic<int> readers{0};
-      std::atomic<int> writers{0};
+      std::atomic<int> readers{0}, writers{0};
       std::atomic<bool> broken{false};
       long value = 0;
+      auto write = [&] {
+         if (++writers != 1 || readers != 0) broken = true;
+         ++value;
+         --writers;
+      };
       auto work = [&](int id) {
          for (int i = 0; i < 2000; ++i) {
             if ((i + id) % 4 == 0) {
                lock->WriteLock();
-               if (++writers != 1 || readers != 0) broken = true;
-               ++value;
-               --writers;
-               lock->Unlock();
+               write();
             } else if ((i + id) % 4 == 1) {
                lock->ReadLock();
                if (lock->UpgradeReadLock()) {
-                  if (++writers != 1 || readers != 0) broken = true;
-                  ++value;
-                  --writers;
+                  write();
                   lock->DowngradeWriteLock();
                }
-               lock->Unlock();
             } else {
                lock->ReadLock();
                ++readers;
@@ -189,8 +173,8 @@ TEST(RWLockTest, WritersExcludeEveryoneUnderLoad) {
                lock->ReadLock();
                --readers;
                lock->Unlock();
-               lock->Unlock();
             }
+            lock->Unlock();
          }
       };
       std::vector<std::thread> threads;
@@ -202,8 +186,8 @@ TEST(RWLockTest, WritersExcludeEveryoneUnderLoad) {
    }
 }
 
-// Many holds at once by one thread, released in a scrambled order: each lock keeps its own
-// count however the per-thread bookkeeping grows and shrinks.
+// Many holds of one thread, some taken twice, released in a scrambled order: each lock keeps
+// its own count however the per-thread bookkeeping grows and shrinks.
 TEST(RWLockTest, ManyHoldsOfOneThreadStayApart) {
    constexpr int kLocks = 100;
    std::vector<Ref<RWLock>> locks;
@@ -227,61 +211,22 @@ TEST(RWLockTest, ManyHoldsOfOneThreadStayApart) {
    locks[5]->Unlock();
 }
 
-TEST(RWLockableObjectTest, ForwardsToItsLock) {
-   Ref<RWLockableObjectImpl> object = new RWLockableObjectImpl();
-   object->ReadLock();
-   EXPECT_TRUE(object->GetRWLock()->IsReadLocked());
-   EXPECT_TRUE(object->UpgradeReadLock());
-   EXPECT_TRUE(object->IsWriteLocked());
-   object->DowngradeWriteLock();
-   EXPECT_TRUE(object->IsReadLocked());
-   object->Unlock();
-   EXPECT_TRUE(object->IsUnlocked());
-   Ref<RWLockableObjectImpl> sharing = new RWLockableObjectImpl(object->GetRWLock());
-   sharing->WriteLock();
-   EXPECT_TRUE(object->IsWriteLocked());
-   sharing->Unlock();
-}
-
 TEST(RWLockDeathTest, MisusePanics) {
    Ref<RWLock> lock = NewRWLock();
-   const char* where = "\" @ src/system/rwLock.cpp:[0-9]+\n";
-   auto text = [&](const char* expression) {
-      return std::string("Assert Failed: \"") + expression + where;
+   auto text = [](const char* expression) {
+      return std::string("Assert Failed: \"") + expression +
+             "\" @ src/system/rwLock.cpp:[0-9]+\n";
    };
-   EXPECT_DEATH(
-       {
-          lock->WriteLock();
-          lock->WriteLock();
-       },
-       text("locks.find\\(this\\) == locks.end\\(\\)"));
-   EXPECT_DEATH(
-       {
-          lock->ReadLock();
-          lock->WriteLock();
-       },
-       text("locks.find\\(this\\) == locks.end\\(\\)"));
-   EXPECT_DEATH(
-       {
-          lock->WriteLock();
-          lock->ReadLock();
-       },
-       text("_status > 0"));
+   const std::string noHold = text("locks.find\\(this\\) == locks.end\\(\\)");
+   const std::string oneRead = text("it != locks.end\\(\\) && it->second == 1");
+   EXPECT_DEATH((lock->WriteLock(), lock->WriteLock()), noHold);
+   EXPECT_DEATH((lock->ReadLock(), lock->WriteLock()), noHold);
+   EXPECT_DEATH((lock->WriteLock(), lock->ReadLock()), text("_status > 0"));
    EXPECT_DEATH(lock->Unlock(), text("it != locks.end\\(\\)"));
-   EXPECT_DEATH(lock->UpgradeReadLock(), text("it != locks.end\\(\\) && it->second == 1"));
-   EXPECT_DEATH(
-       {
-          lock->ReadLock();
-          lock->ReadLock();
-          lock->UpgradeReadLock();
-       },
-       text("it != locks.end\\(\\) && it->second == 1"));
-   EXPECT_DEATH(
-       {
-          lock->ReadLock();
-          lock->DowngradeWriteLock();
-       },
-       text("it != locks.end\\(\\) && it->second == -1"));
+   EXPECT_DEATH(lock->UpgradeReadLock(), oneRead);
+   EXPECT_DEATH((lock->ReadLock(), lock->ReadLock(), lock->UpgradeReadLock()), oneRead);
+   EXPECT_DEATH((lock->ReadLock(), lock->DowngradeWriteLock()),
+                text("it != locks.end\\(\\) && it->second == -1"));
 }
 
 }  // namespace

@@ -32,33 +32,19 @@ private:
    int* _alive;
 };
 
-TEST(TlsKeyTableTest, KeysPackVersionAboveIndex) {
-   TlsKey key = TlsKeyTable::MakeKey(3, 5);
-   EXPECT_EQ((3u << 17) | 5u, key);
-   EXPECT_EQ(5u, TlsKeyTable::GetIndex(key));
-   EXPECT_EQ(3u, TlsKeyTable::GetVersion(key));
-   EXPECT_TRUE(TlsKeyTable::IsKey(key));
-   EXPECT_FALSE(TlsKeyTable::IsKey(TlsKeyTable::MakeKey(0, 5)));
-}
-
 TEST(TlsKeyTableTest, ReleasedIndexesAreReusedNewestFirstWithNewVersions) {
+   EXPECT_FALSE(TlsKeyTable::IsKey(TlsKeyTable::MakeKey(0, 5)));  // version 0 is no key
    TlsKeyTable table;
-   TlsKey a = table.Reserve();
-   TlsKey b = table.Reserve();
-   TlsKey c = table.Reserve();
-   EXPECT_EQ(0u, TlsKeyTable::GetIndex(a));
-   EXPECT_EQ(1u, TlsKeyTable::GetIndex(b));
-   EXPECT_EQ(2u, TlsKeyTable::GetIndex(c));
-   table.Release(a);
-   table.Release(c);
-   TlsKey d = table.Reserve();
-   TlsKey e = table.Reserve();
-   TlsKey f = table.Reserve();
-   EXPECT_EQ(2u, TlsKeyTable::GetIndex(d));
-   EXPECT_EQ(0u, TlsKeyTable::GetIndex(e));
-   EXPECT_EQ(3u, TlsKeyTable::GetIndex(f));
-   EXPECT_NE(c, d);
-   EXPECT_NE(a, e);
+   std::vector<TlsKey> keys;
+   for (int i = 0; i < 3; ++i) keys.push_back(table.Reserve());
+   table.Release(keys[0]);
+   table.Release(keys[2]);
+   for (int i = 0; i < 3; ++i) keys.push_back(table.Reserve());
+   std::vector<uint32_t> indexes;
+   for (TlsKey key : keys) indexes.push_back(TlsKeyTable::GetIndex(key));
+   EXPECT_EQ((std::vector<uint32_t>{0, 1, 2, 2, 0, 3}), indexes);
+   EXPECT_NE(keys[2], keys[3]);
+   EXPECT_NE(keys[0], keys[4]);
 }
 
 TEST(TlsKeyTableTest, TheVersionNeverWrapsToZero) {
@@ -76,31 +62,22 @@ TEST(TlsKeyTableTest, TheVersionNeverWrapsToZero) {
    EXPECT_EQ(2u, previous);
 }
 
-TEST(TlsKeyTableDeathTest, BadKeysPanic) {
+TEST(TlsKeyTableDeathTest, BadKeysAndAFullTablePanic) {
    TlsKeyTable table;
    TlsKey key = table.Reserve();
-   EXPECT_DEATH(
-       table.Release(key + 1),
-       "Assert Failed: \"key == \\(TlsKey\\)_keys\\[index\\]\" @ src/system/tls.cpp:[0-9]+");
-   EXPECT_DEATH(table.Release(TlsKeyTable::MakeKey(1, 7)),
-                "\"key == \\(TlsKey\\)_keys\\[index\\]\"");
-   EXPECT_DEATH(
-       {
-          table.Release(key);
-          table.Release(key);
-       },
-       "\"key == \\(TlsKey\\)_keys\\[index\\]\"");
+   const std::string badKey = "\"key == \\(TlsKey\\)_keys\\[index\\]\"";
+   EXPECT_DEATH(table.Release(key + 1),
+                "Assert Failed: " + badKey + " @ src/system/tls.cpp:[0-9]+");
+   EXPECT_DEATH(table.Release(TlsKeyTable::MakeKey(1, 7)), badKey);
+   EXPECT_DEATH((table.Release(key), table.Release(key)), badKey);
+   EXPECT_DEATH(ReleaseTlsKey(0), badKey);
    EXPECT_DEATH(TlsKeyTable::MakeKey(1, TlsKeyTable::INVALID_INDEX),
                 "\"index <= MAX_INDEX\" @ src/system/tls.cpp");
-   EXPECT_DEATH(ReleaseTlsKey(0), "\"key == \\(TlsKey\\)_keys\\[index\\]\"");
-}
-
-TEST(TlsKeyTableDeathTest, AFullTablePanics) {
    EXPECT_DEATH(
        {
-          TlsKeyTable table;
-          for (uint32_t i = 0; i < TlsKeyTable::MAX_INDEX; ++i) table.Reserve();
-          table.Reserve();
+          TlsKeyTable full;
+          for (uint32_t i = 0; i < TlsKeyTable::MAX_INDEX; ++i) full.Reserve();
+          full.Reserve();
        },
        "\"_keys.size\\(\\) < MAX_INDEX\" @ src/system/tls.cpp");
 }
@@ -117,7 +94,7 @@ TEST(TlsObjectsTest, SetGetAndClearReleaseTheObjects) {
       slots.Set(b, first.Get());
       EXPECT_EQ(first.Get(), slots.Get(b));
       EXPECT_EQ(nullptr, slots.Get(a));
-      slots.Set(b, new Counted(&alive));
+      slots.Set(b, new Counted(&alive));  // replacing releases `first`
       first.Reset();
       EXPECT_EQ(1, alive);
       slots.Set(b, nullptr);
@@ -129,50 +106,50 @@ TEST(TlsObjectsTest, SetGetAndClearReleaseTheObjects) {
       EXPECT_EQ(nullptr, slots.Get(a));
       slots.Set(a, new Counted(&alive));
    }
-   EXPECT_EQ(0, alive);
+   EXPECT_EQ(0, alive);  // and so does the destructor
 }
 
-TEST(TlsObjectsTest, AnObjectLeftUnderAReleasedKeyIsReportedAsLeakedAndReplaced) {
+// An object left under a released key whose index was reserved again.
+class StaleTlsTest : public testing::Test {
+protected:
+   StaleTlsTest() {
+      TlsKey old = table.Reserve();
+      slots.Set(old, stale.Get());
+      table.Release(old);
+      reused = table.Reserve();
+   }
+   ~StaleTlsTest() override { slots.Clear(); }
+
    int alive = 0;
    TlsKeyTable table;
    TlsObjects slots;
-   TlsKey old = table.Reserve();
-   Counted* stale = new Counted(&alive);
-   slots.Set(old, stale);
-   std::string staleText = stale->ToString();
-   table.Release(old);
-   TlsKey reused = table.Reserve();
-   ASSERT_EQ(TlsKeyTable::GetIndex(old), TlsKeyTable::GetIndex(reused));
+   Ref<Counted> stale = new Counted(&alive);
+   TlsKey reused;
+};
 
+TEST_F(StaleTlsTest, SettingReportsTheLeakAndReplacesIt) {
+   const std::string staleText = stale->ToString();
+   stale.Reset();
    CapturingSink sink;
    slots.Set(reused, new Counted(&alive));
    ASSERT_EQ(1u, sink.lines.size());
    EXPECT_EQ(Internal::kReportErrorLevel, sink.lines[0].first);
    EXPECT_EQ(
        "Found leaked TLS object at index 0. Expected version=2, found version=1, "
-       "found object=" +
-           staleText,
+       "found object=" + staleText,
        sink.lines[0].second);
    EXPECT_EQ(1, alive);
-   slots.Clear();
 }
 
-TEST(TlsObjectsDeathTest, ReadingAnObjectLeftUnderAReleasedKeyEndsTheProcess) {
-   int alive = 0;
-   TlsKeyTable table;
-   TlsObjects slots;
-   TlsKey old = table.Reserve();
-   Ref<Counted> stale = new Counted(&alive);
-   slots.Set(old, stale.Get());
-   table.Release(old);
-   TlsKey reused = table.Reserve();
+using StaleTlsDeathTest = StaleTlsTest;
+
+TEST_F(StaleTlsDeathTest, ReadingItOrUsingAnInvalidKeyEndsTheProcess) {
    EXPECT_DEATH(slots.Get(reused),
                 "Found unexpected TLS object at index 0. Expected version=2, found version=1, "
                 "found object=\\[[^]]*Counted[^]]*\\]\n\n\nPanic: Not Reached: @ "
                 "src/system/tls.cpp");
    EXPECT_DEATH(slots.Set(TlsKeyTable::MakeKey(0, 1), stale.Get()),
                 "\"TlsKeyTable::IsKey\\(key\\)\"");
-   slots.Clear();
 }
 
 TEST(TlsObjectsTest, AnObjectReleasedByClearMayStoreAnother) {
