@@ -9,6 +9,7 @@ packages=(
   libexpat1-dev zlib1g-dev libssl-dev
   libgtest-dev libgmock-dev libbenchmark-dev libfmt-dev libxml2-dev libpugixml-dev
   libspdlog-dev
+  libsqlite3-dev  # the authorisation store
   prometheus  # promtool checks the metrics export in the tests
   clang libclang-rt-14-dev clang-format
 )

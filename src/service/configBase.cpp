@@ -8,6 +8,7 @@
 #include <cstdio>
 #include <cstring>
 #include <mutex>
+#include <shared_mutex>
 #include <strings.h>
 
 #include "pelmora/exception/exceptions.h"
@@ -24,11 +25,11 @@ namespace {
 constexpr size_t kIndexThreshold = 8;
 
 // The standard guards over a pointer to the configuration's lock.
-struct ReadGuard : std::shared_lock<std::shared_mutex> {
-   explicit ReadGuard(std::shared_mutex* lock) : std::shared_lock<std::shared_mutex>(*lock) {}
+struct ReadGuard : std::shared_lock<ConfigLock> {
+   explicit ReadGuard(ConfigLock* lock) : std::shared_lock<ConfigLock>(*lock) {}
 };
-struct WriteGuard : std::unique_lock<std::shared_mutex> {
-   explicit WriteGuard(std::shared_mutex* lock) : std::unique_lock<std::shared_mutex>(*lock) {}
+struct WriteGuard : std::unique_lock<ConfigLock> {
+   explicit WriteGuard(ConfigLock* lock) : std::unique_lock<ConfigLock>(*lock) {}
 };
 
 void ValidatePath(std::string_view path) {

@@ -6,7 +6,6 @@
 // Load, Flush and Refresh are serialised by a second mutex so that the tree stays readable
 // while a file is read or written.
 
-#include <shared_mutex>
 #include <string>
 #include <string_view>
 #include <unordered_map>
@@ -17,6 +16,7 @@
 #include "pelmora/service/config.h"
 #include "pelmora/system/lockable.h"
 #include "src/service/configBackend.h"
+#include "src/service/configLock.h"
 
 namespace Pelmora::Service {
 
@@ -115,7 +115,7 @@ public:
    // Merges a copy of `source` into the defaults tree's root; values of `source` win.
    void MergeIntoDefaults(const Node* source);
 
-   std::shared_mutex* GetLock() { return &_lock; }
+   ConfigLock* GetLock() { return &_lock; }
    Node* GetRoot(bool defaults) const { return defaults ? _defaults.Get() : _main.Get(); }
    // Called with the write lock held when a view changed the main tree.
    void MarkDirty() { _dirty = true; ++_changes; }
@@ -128,7 +128,7 @@ private:
    void NewView(const std::string& path, bool defaults, Ref<View>& out);
 
    Ref<ConfigBackend> _backend;
-   std::shared_mutex _lock;
+   ConfigLock _lock;
    Ref<System::Mutex> _ioMutex;
    Ref<Node> _main;
    Ref<Node> _defaults;
