@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
 
 #include "pelmora/exception/exceptions.h"
@@ -48,10 +49,10 @@ private:
 // Writes a descriptor the backend owns.
 class FdWriter : public Writer, public ObjectImpl {
 public:
-   explicit FdWriter(int fd) : _fd(fd) {}
+   FdWriter(int fd, const ConfigFileOps& ops) : _fd(fd), _ops(ops) {}
    void Write(const char* data, int length) override {
       while (length > 0) {
-         ssize_t n = ::write(_fd, data, static_cast<size_t>(length));
+         ssize_t n = _ops.write(_fd, data, static_cast<size_t>(length));
          if (n < 0) {
             if (errno == EINTR) continue;
             ThrowErrno("Failed to write configuration");
@@ -64,6 +65,7 @@ public:
 
 private:
    int _fd;
+   ConfigFileOps _ops;
 };
 
 // Counts the bytes that pass and refuses more than the limit.
@@ -141,8 +143,10 @@ struct FileStamp {
 
 class FileConfigBackendImpl : public FileConfigBackend, public ObjectImpl {
 public:
-   FileConfigBackendImpl(const std::string& path, int sizeLimit, unsigned flags)
-       : _gzip((flags & kConfigFlagGzip) != 0),
+   FileConfigBackendImpl(const std::string& path, int sizeLimit, unsigned flags,
+                         const ConfigFileOps& ops)
+       : _ops(ops),
+         _gzip((flags & kConfigFlagGzip) != 0),
          _limit(sizeLimit < 0 ? kConfigDefaultSizeLimit : sizeLimit) {
       if (_gzip && path.find(_gzExt) != std::string::npos) {
          throw InvalidArgumentException("fileName (" + path + ") contains .gz extension");
@@ -196,7 +200,7 @@ public:
       _fd = fd;
       _writing = true;
       _committed = false;
-      Ref<Writer> sink = new FdWriter(fd);
+      Ref<Writer> sink = new FdWriter(fd, _ops);
       if (_gzip) {
          Ref<Writer> deflated;
          CreateGzippedFileWriter(sink.Get(), _path, deflated);
@@ -213,10 +217,10 @@ public:
       if (_fd < 0 || !_writing || _committed) throw InvalidStateException();
       _buffered->Flush();
       _sink->Close();  // the gzip trailer, when compressed
-      if (::fsync(_fd) != 0) ThrowErrno("Failed to sync " + _tmpPath);
+      if (_ops.fsync(_fd) != 0) ThrowErrno("Failed to sync " + _tmpPath);
       // The new file's directory entry must be durable before it replaces the old one.
       SyncDirectory();
-      if (::rename(_tmpPath.c_str(), _path.c_str()) != 0) {
+      if (_ops.rename(_tmpPath.c_str(), _path.c_str()) != 0) {
          int error = errno;
          throw SystemException(error, "Failed to replace " + _path + " with " + _tmpPath + ": " +
                                           System::GetErrorMessage(error));
@@ -251,7 +255,7 @@ private:
    void SyncDirectory() {
       int dir = ::open(_directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
       if (dir < 0) ThrowErrno("Failed to open directory " + _directory);
-      int rc = ::fsync(dir);
+      int rc = _ops.fsync(dir);
       int error = errno;
       ::close(dir);
       if (rc != 0 && error != EINVAL) {  // EINVAL: a file system without directory sync
@@ -260,6 +264,7 @@ private:
       }
    }
 
+   ConfigFileOps _ops;
    std::string _path;
    std::string _tmpPath;
    std::string _directory;
@@ -317,9 +322,19 @@ private:
 
 }  // namespace
 
+const ConfigFileOps& ConfigFileOps::Posix() {
+   static const ConfigFileOps ops{::write, ::fsync, ::rename};
+   return ops;
+}
+
 void CreateFileConfigBackend(const std::string& path, int sizeLimit, unsigned flags,
                              Ref<FileConfigBackend>& out) {
-   out = new FileConfigBackendImpl(path, sizeLimit, flags);
+   out = new FileConfigBackendImpl(path, sizeLimit, flags, ConfigFileOps::Posix());
+}
+
+void CreateFileConfigBackend(const std::string& path, int sizeLimit, unsigned flags,
+                             const ConfigFileOps& ops, Ref<FileConfigBackend>& out) {
+   out = new FileConfigBackendImpl(path, sizeLimit, flags, ops);
 }
 
 void CreateStringConfigBackend(std::string& text, Ref<ConfigBackend>& out) {

@@ -4,6 +4,7 @@
 // without Commit throws it away. Not thread-safe: the configuration serialises its I/O.
 
 #include <sys/stat.h>
+#include <sys/types.h>
 
 #include <string>
 
@@ -30,11 +31,22 @@ public:
    static constexpr const char* _gzExt = ".gz";
 };
 
+// The system calls a file backend writes through. Tests replace one to make a step fail;
+// everything else uses the defaults.
+struct ConfigFileOps {
+   ssize_t (*write)(int fd, const void* data, size_t length);
+   int (*fsync)(int fd);
+   int (*rename)(const char* from, const char* to);
+   static const ConfigFileOps& Posix();
+};
+
 // `sizeLimit` counts uncompressed bytes, negative meaning kConfigDefaultSizeLimit; `flags`
 // as kConfigFlagGzip. A compressed configuration's path must not contain ".gz"
 // (InvalidArgumentException): the extension is added here.
 void CreateFileConfigBackend(const std::string& path, int sizeLimit, unsigned flags,
                              Ref<FileConfigBackend>& out);
+void CreateFileConfigBackend(const std::string& path, int sizeLimit, unsigned flags,
+                             const ConfigFileOps& ops, Ref<FileConfigBackend>& out);
 // `text` must outlive the backend; Commit assigns to it.
 void CreateStringConfigBackend(std::string& text, Ref<ConfigBackend>& out);
 

@@ -13,12 +13,14 @@
 #include <random>
 #include <sstream>
 #include <string>
+#include <vector>
 
 #include <gtest/gtest.h>
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/config.h"
 #include "src/service/configBackend.h"
+#include "src/service/configBase.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
@@ -187,6 +189,89 @@ TEST_F(ConfigFileTest, SizeLimitHoldsForReadingAndWriting) {
    EXPECT_EQ(ReadFile(path), "a = \"1\"\n");
    EXPECT_FALSE(Exists(path + ".tmp"));
    EXPECT_TRUE(config->IsDirty());
+}
+
+TEST_F(ConfigFileTest, SizeLimitIsExact) {
+   // The file the writer accepts at exactly the limit must load again; one byte more fails.
+   std::string path = Path("exact.conf");
+   WriteFile(path, "");
+   Ref<Config> config;
+   CreateFlatFileConfig(path, config);
+   MainView(config.Get())->Set("key", "value");
+   config->Flush();
+   int size = static_cast<int>(ReadFile(path).size());
+   CreateFlatFileConfig(path, size, config);
+   EXPECT_EQ(Text(config.Get(), "key"), "value");
+   MainView(config.Get())->Set("key", "value1");
+   EXPECT_THROW(config->Flush(), FileIOException);
+   WriteFile(path, ReadFile(path) + " ");
+   EXPECT_THROW(CreateFlatFileConfig(path, size, config), FileIOException);
+   CreateFlatFileConfig(path, size + 1, config);
+   EXPECT_EQ(Text(config.Get(), "key"), "value");
+}
+
+// The steps of a flush as the file system sees them, with one step made to fail.
+struct RecordedOps {
+   static inline std::vector<std::string> steps;
+   static inline std::string failing;  // "fsync", "write" or "rename"
+   static std::string Name(int fd) {
+      char link[512];
+      ssize_t n = readlink(("/proc/self/fd/" + std::to_string(fd)).c_str(), link, sizeof(link));
+      std::string name = n > 0 ? std::string(link, n) : "?";
+      return name.substr(name.rfind('/') + 1);
+   }
+   static ssize_t Write(int fd, const void* data, size_t length) {
+      steps.push_back("write " + Name(fd));
+      if (failing == "write") return errno = ENOSPC, -1;
+      return ::write(fd, data, length);
+   }
+   static int Fsync(int fd) {
+      steps.push_back("fsync " + Name(fd));
+      if (failing == "fsync") return errno = EIO, -1;
+      return ::fsync(fd);
+   }
+   static int Rename(const char* from, const char* to) {
+      steps.push_back("rename");
+      if (failing == "rename") return errno = EACCES, -1;
+      return ::rename(from, to);
+   }
+};
+
+TEST_F(ConfigFileTest, FlushSyncsTheNewFileBeforeRenamingAndFailsWhole) {
+   const ConfigFileOps ops{RecordedOps::Write, RecordedOps::Fsync, RecordedOps::Rename};
+   std::string dir = _dir.substr(_dir.rfind('/') + 1);
+   std::string path = Path("durable.conf");
+   auto flushed = [&](const std::string& failing) {
+      WriteFile(path, "a = \"old\"\n");
+      Ref<FileConfigBackend> backend;
+      CreateFileConfigBackend(path, -1, 0, ops, backend);
+      Ref<ConfigBase> config;
+      CreateFlatConfig(backend.Get(), "/", config);
+      config->Load();
+      MainView(config.Get())->Set("a", "new");
+      RecordedOps::steps.clear();
+      RecordedOps::failing = failing;
+      std::string error = Thrown<SystemException>([&] { config->Flush(); });
+      RecordedOps::failing.clear();
+      if (!failing.empty()) {
+         EXPECT_TRUE(config->IsDirty());
+      }
+      return error;
+   };
+
+   EXPECT_EQ(flushed(""), "no exception");
+   EXPECT_EQ(RecordedOps::steps,
+             (std::vector<std::string>{"write durable.conf.tmp", "fsync durable.conf.tmp",
+                                       "fsync " + dir, "rename", "fsync " + dir}));
+   EXPECT_EQ(ReadFile(path), "a = \"new\"\n");
+
+   for (std::string failing : {"write", "fsync", "rename"}) {
+      std::string error = flushed(failing);
+      EXPECT_NE(error, "no exception") << failing;
+      EXPECT_EQ(ReadFile(path), "a = \"old\"\n") << failing;
+      EXPECT_FALSE(Exists(path + ".tmp")) << failing;
+   }
+   EXPECT_EQ(flushed("fsync").rfind("Failed to sync " + path + ".tmp", 0), 0u);
 }
 
 TEST_F(ConfigFileTest, BackendAllowsOneReaderOrWriterAtATime) {

@@ -132,6 +132,18 @@ TEST_F(PrometheusTest, PathsBecomeNamesAndQuotedComponentsLabels) {
    EXPECT_EQ("a\"b\\c", Parsed()["Edge_Last__x_"].samples.at(0).labels["Name"]);
 }
 
+TEST_F(PrometheusTest, ReservedLabelNamesStayInTheMetricName) {
+   // "__" names belong to the scraper and "quantile" to summaries: such components are refused
+   // as labels and kept in the name.
+   Add({"/Res/__name__='v'/quantile='q'/Val"}, 2);
+   std::string text = Export();
+   EXPECT_EQ(text.find('{'), std::string::npos) << text;
+   auto families = Parsed();
+   ASSERT_EQ(families.size(), 1u) << text;
+   EXPECT_EQ(families.begin()->first, "Res___name____v__quantile__q__Val");
+   EXPECT_TRUE(families.begin()->second.samples.at(0).labels.empty());
+}
+
 TEST_F(PrometheusTest, MetersBecomeSummariesWithAMeanGauge) {
    MeterAccumulator latency(registry.Get(), "/Http/Method='GET'/Latency"),
        idle(registry.Get(), "/Idle"), partial(registry.Get(), "/Partial");
