@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include "src/service/configLock.h"
+#include "tests/support/watchdog.h"
 
 using Pelmora::Service::ConfigLock;
 
@@ -33,7 +34,7 @@ TEST(ConfigLockTest, AWaitingWriterHoldsBackNewReaders) {
    EXPECT_TRUE(heldBack) << "a reader got in while a writer waited";
    EXPECT_FALSE(written.load());
    lock.unlock_shared();
-   writer.join();
+   Pelmora::Testing::Join(writer, "writer to finish");
    EXPECT_TRUE(written.load());
    EXPECT_TRUE(lock.try_lock_shared());
    lock.unlock_shared();

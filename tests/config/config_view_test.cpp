@@ -14,6 +14,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/config.h"
+#include "tests/support/watchdog.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
@@ -267,7 +268,10 @@ TEST_F(ConfigViewTest, ConcurrentReadersAndWritersSeeWholeValues) {
          }
       });
    }
-   while (readersRunning.load() < 3) std::this_thread::yield();
+   {
+      Pelmora::Testing::Watchdog watchdog("the readers to start");
+      while (readersRunning.load() < 3) std::this_thread::yield();
+   }
    std::chrono::steady_clock::duration slowest{};
    for (int round = 0; round < 100; ++round) {
       for (int i = 0; i <= 50; ++i) {
@@ -281,7 +285,7 @@ TEST_F(ConfigViewTest, ConcurrentReadersAndWritersSeeWholeValues) {
       }
    }
    stop = true;
-   for (auto& t : readers) t.join();
+   Pelmora::Testing::JoinAll(readers, "readers to finish");
    EXPECT_EQ(bad.load(), 0);
    EXPECT_LT(slowest, std::chrono::milliseconds(500));
 }

@@ -6,6 +6,7 @@
 
 #include "pelmora/exception.h"
 #include "pelmora/object.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora {
 
@@ -128,7 +129,7 @@ TEST(RefTest, CopiesAcrossThreadsKeepTheCountExact) {
          }
       });
    }
-   for (auto& thread : threads) thread.join();
+   Pelmora::Testing::JoinAll(threads, "threads to finish");
    EXPECT_EQ(1, shared->GetRefCount());
    shared.Reset();
    EXPECT_EQ(1, destroyed);

@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "src/core/scoreboardHash2D.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora {
 namespace {
@@ -74,7 +75,7 @@ TEST(ScoreboardHash2DTest, ConcurrentClaimsLoseNoCountOfAClaimedKey) {
          board->Increment(own[t]);
       });
    }
-   for (auto& thread : threads) thread.join();
+   Pelmora::Testing::JoinAll(threads, "threads to finish");
    std::string text;
    board->Serialize(text);
    EXPECT_NE(std::string::npos, text.find("N7Pelmora5ThingE - 5\n")) << text;

@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "pelmora/object.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora {
 namespace {
@@ -96,7 +97,7 @@ TEST(WeakRefTest, PromoteRacingTheLastDecRefNeverResurrects) {
       }
       go = true;
       session.Reset();
-      for (auto& thread : promoters) thread.join();
+      Pelmora::Testing::JoinAll(promoters, "promoters to finish");
       EXPECT_TRUE(weak.IsDetached());
       EXPECT_EQ(round + 1, destroyed.load());
    }

@@ -1,6 +1,7 @@
 #include <thread>
 
 #include "tests/perfcounter/fixture.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::PerfCounter::Testing {
 namespace {
@@ -102,7 +103,7 @@ TEST_F(MeterAccumulatorTest, ConcurrentSamplesAddUpExactly) {
       accessor.Refresh();
       ASSERT_LE(accessor.GetMeter().GetMin(), accessor.GetMeter().GetMax());
    }
-   for (auto& thread : threads) thread.join();
+   Pelmora::Testing::JoinAll(threads, "threads to finish");
    const Meter expected(0, kThreads * kSamples, -kSamples, kSamples, 0);
    EXPECT_TRUE(meter.GetMeter().Equals(&expected)) << meter.GetMeter().ToString();
 }

@@ -2,6 +2,7 @@
 
 #include "tests/perfcounter/fixture.h"
 #include "tests/support/logCapture.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::PerfCounter::Testing {
 namespace {
@@ -89,7 +90,7 @@ TEST_F(PublishedMapTest, ThreadsMergeTheirOwnBuildersThroughScopes) {
          EXPECT_EQ(0, GetTlsMapBuilder()->GetSize());
       });
    }
-   for (auto& thread : threads) thread.join();
+   Pelmora::Testing::JoinAll(threads, "threads to finish");
    EXPECT_THAT(Match("^/Work/Done"),
                ElementsAre("/Work/Done = " + std::to_string(kThreads * kRounds)));
    MeterAccessor cost(registry.Get(), "/Work/Cost");

@@ -1,6 +1,7 @@
 #include <thread>
 
 #include "tests/perfcounter/fixture.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::PerfCounter::Testing {
 namespace {
@@ -90,7 +91,7 @@ TEST_F(QueryTest, ManyThreadsExecuteWhileGroupsComeAndGo) {
       if (i % 2) item->Unregister();
    }
    stop = true;
-   for (auto& thread : readers) thread.join();
+   Pelmora::Testing::JoinAll(readers, "readers to finish");
    EXPECT_EQ(200u, Run(query.Get()).size());
 }
 
@@ -117,7 +118,7 @@ TEST_F(QueryTest, QueriesDroppedWhileGroupsArrive) {
       AddGroup(registry.Get(), {base + "/a", base + "/b"})->Unregister();
    }
    stop = true;
-   for (auto& thread : droppers) thread.join();
+   Pelmora::Testing::JoinAll(droppers, "droppers to finish");
    EXPECT_EQ(std::string::npos, registry->ToString().find("pattern="));  // none left behind
 }
 

@@ -13,6 +13,7 @@
 #include "pelmora/io/writers.h"
 #include "pelmora/object/ref.h"
 #include "pelmora/service.h"
+#include "tests/support/watchdog.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
@@ -163,14 +164,17 @@ TEST_P(LongLineTest, LongLineArrivesWholeWhileAnotherThreadLogs) {
          ++shortLines;
       }
    });
-   while (shortLines.load() == 0) std::this_thread::yield();
+   {
+      Pelmora::Testing::Watchdog watchdog("the other thread's first line");
+      while (shortLines.load() == 0) std::this_thread::yield();
+   }
    std::string chunk(300, 'x'), tail = chunk + std::string(300, 'y');
    for (int i = 0; i < 300; ++i) {  // ten pieces that fit the chunk: several flushes per line
       PELMORA_LOG_INFO(t.logger.Get(), "long %1%2%3%4%5%6%7%8%9", chunk, chunk, chunk, chunk,
                        chunk, chunk, chunk, chunk, tail);
    }
    stop = true;
-   other.join();
+   Pelmora::Testing::Join(other, "other to finish");
    SetUsingLogFastPath(saved);
 
    std::string body = "long " + std::string(2700, 'x') + std::string(300, 'y');
@@ -280,7 +284,7 @@ TEST(LogOutputTest, WriteLockIsRecursivePerThreadAndExcludesOtherThreads) {
    std::this_thread::sleep_for(std::chrono::milliseconds(5));
    EXPECT_FALSE(done.load());
    output->WriteUnlock();
-   other.join();
+   Pelmora::Testing::Join(other, "other to finish");
    EXPECT_EQ(t.Lines().size(), 2u);
 }
 

@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "pelmora/system.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
 namespace {
@@ -76,7 +77,7 @@ TEST_F(ConditionTest, SignalWakesOneWaiterAndBroadcastTheRest) {
       EXPECT_EQ(1, woken);
    }
    condition->Broadcast();
-   for (std::thread& t : waiters) t.join();
+   Pelmora::Testing::JoinAll(waiters, "waiters to finish");
    EXPECT_EQ(3, woken);
 }
 
@@ -97,8 +98,8 @@ TEST_F(ConditionTest, PingPongNeverLosesAWakeup) {
       }
    };
    std::thread a(play, 0), b(play, 1);
-   a.join();
-   b.join();
+   Pelmora::Testing::Join(a, "a to finish");
+   Pelmora::Testing::Join(b, "b to finish");
    EXPECT_EQ(0, turn);
    EXPECT_FALSE(timedOut);
 }

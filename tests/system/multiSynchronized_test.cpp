@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "pelmora/system.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
 namespace {
@@ -121,8 +122,8 @@ TEST(MultiSynchronizedTest, OppositeFillOrdersNeverDeadlock) {
       }
    };
    std::thread a(work, false), b(work, true);
-   a.join();
-   b.join();
+   Pelmora::Testing::Join(a, "a to finish");
+   Pelmora::Testing::Join(b, "b to finish");
    EXPECT_EQ(2000, counter);
 }
 

@@ -3,6 +3,7 @@
 #include <thread>
 
 #include "pelmora/system.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
 namespace {
@@ -35,8 +36,8 @@ TEST(MutexTest, ExcludesOtherThreads) {
       }
    };
    std::thread a(work), b(work);
-   a.join();
-   b.join();
+   Pelmora::Testing::Join(a, "a to finish");
+   Pelmora::Testing::Join(b, "b to finish");
    EXPECT_EQ(40000, counter);
 }
 
@@ -86,7 +87,7 @@ TEST(WaitableObjectTest, SharesItsMutexAndWaitsUnderItsOwnLock) {
       while (box->value == 0) box->Wait();
       EXPECT_TRUE(box->IsLocked());
    }
-   producer.join();
+   Pelmora::Testing::Join(producer, "producer to finish");
    EXPECT_EQ(42, box->value);
 }
 

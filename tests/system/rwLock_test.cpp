@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "pelmora/system.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
 namespace {
@@ -64,7 +65,7 @@ TEST(RWLockTest, UpgradeAndDowngradeMoveBetweenReadAndWrite) {
    SleepMillis(2);
    EXPECT_FALSE(written);
    lock->Unlock();
-   writer.join();
+   Pelmora::Testing::Join(writer, "writer to finish");
    EXPECT_TRUE(written);
    EXPECT_TRUE(object->IsUnlocked());
 }
@@ -88,8 +89,8 @@ TEST(RWLockTest, OfTwoConcurrentUpgradersOneGetsFalseAtOnce) {
       lock->Unlock();
    };
    std::thread a(reader), b(reader);
-   a.join();
-   b.join();
+   Pelmora::Testing::Join(a, "a to finish");
+   Pelmora::Testing::Join(b, "b to finish");
    EXPECT_EQ(1, upgraded);
    EXPECT_EQ(1, refused);
 }
@@ -134,8 +135,8 @@ TEST_P(RWLockModeTest, AReaderRelocksWhileAWriterWaits) {
    EXPECT_TRUE(lock->IsReadLocked());
    lock->Unlock();
    lock->Unlock();
-   writer.join();
-   reader.join();
+   Pelmora::Testing::Join(writer, "writer to finish");
+   Pelmora::Testing::Join(reader, "reader to finish");
    EXPECT_EQ(writerPriority ? 'W' : 'R', first.load());
 }
 
@@ -179,7 +180,7 @@ TEST(RWLockTest, WritersExcludeEveryoneUnderLoad) {
       };
       std::vector<std::thread> threads;
       for (int id = 0; id < 4; ++id) threads.emplace_back(work, id);
-      for (std::thread& t : threads) t.join();
+      Pelmora::Testing::JoinAll(threads, "threads to finish");
       EXPECT_FALSE(broken);
       EXPECT_GE(value, 2000);
       EXPECT_TRUE(lock->IsUnlocked());

@@ -8,6 +8,7 @@
 
 #include "pelmora/exception.h"
 #include "pelmora/system.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
 namespace {
@@ -91,7 +92,7 @@ TEST_F(ThreadControlTest, DoPollReturnsTheReadyPositionsInOrder) {
       control->SetPollableSignal(writeFd);
    });
    control->DoPoll(pollables, ready);
-   waker.join();
+   Pelmora::Testing::Join(waker, "waker to finish");
    EXPECT_EQ((std::vector<int>{0}), ready);
    close(otherRead);
    close(otherWrite);

@@ -6,6 +6,7 @@
 
 #include "pelmora/system.h"
 #include "src/system/threadState.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
 namespace {
@@ -61,7 +62,10 @@ TEST(ThreadStateTest, ConcurrentCopiesAreNeverTorn) {
          rounds.store(round, std::memory_order_relaxed);
       }
    });
-   while (rounds.load() == 0) std::this_thread::yield();
+   {
+      Pelmora::Testing::Watchdog watchdog("the owner's first round");
+      while (rounds.load() == 0) std::this_thread::yield();
+   }
    int accepted = 0;
    for (int copies = 0; copies < 200000 && (copies < 2000 || rounds.load() < 20000); ++copies) {
       Messages messages;
@@ -72,7 +76,7 @@ TEST(ThreadStateTest, ConcurrentCopiesAreNeverTorn) {
       ASSERT_TRUE(messages.size() < 2 || messages.front() == messages.back());
    }
    stop = true;
-   owner.join();
+   Pelmora::Testing::Join(owner, "owner to finish");
    EXPECT_GT(accepted, 0);
 }
 
@@ -101,7 +105,10 @@ TEST(ThreadStateRegistryTest, CopiesEveryLivingThreadByItsId) {
       posted = true;
       while (!release) std::this_thread::yield();
    });
-   while (!posted) std::this_thread::yield();
+   {
+      Pelmora::Testing::Watchdog watchdog("the worker to post its states");
+      while (!posted) std::this_thread::yield();
+   }
    unsigned mine = AddThreadState("main waiting");
    std::map<long long, Messages> states;
    states[GetThreadId()] = {"kept"};
@@ -115,7 +122,7 @@ TEST(ThreadStateRegistryTest, CopiesEveryLivingThreadByItsId) {
    EXPECT_STREQ("Failed to read thread state", THREAD_STATE_READFAILED_TOKEN);
 
    release = true;
-   worker.join();
+   Pelmora::Testing::Join(worker, "worker to finish");
    states.clear();
    CopyThreadStates(states, 3);
    EXPECT_EQ(0u, states.count(workerId));  // its board went with it

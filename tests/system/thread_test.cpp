@@ -10,6 +10,7 @@
 
 #include "pelmora/exception.h"
 #include "pelmora/system.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
 namespace {
@@ -140,7 +141,7 @@ TEST_F(ThreadTest, WaitOnADescriptorNeverWaitsBelowOneMillisecond) {
       EXPECT_EQ(1, write(fds[1], "x", 1));
    });
    EXPECT_TRUE(thread->TimedWait(fds[0], -1000));
-   writer.join();
+   Pelmora::Testing::Join(writer, "writer to finish");
    close(fds[0]);
    close(fds[1]);
 }
@@ -160,7 +161,7 @@ TEST_F(ThreadTest, SleepIsNotCutShortBySignals) {
    });
    std::this_thread::sleep_for(std::chrono::milliseconds(1));
    pthread_kill(sleeper.native_handle(), SIGUSR1);
-   sleeper.join();
+   Pelmora::Testing::Join(sleeper, "sleeper to finish");
    sigaction(SIGUSR1, &previous, nullptr);
    EXPECT_GE(slept, 5000);
 }

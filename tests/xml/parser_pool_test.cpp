@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "pelmora/xml.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::Xml {
 namespace {
@@ -34,7 +35,7 @@ TEST(ParserPoolTest, TheProcessPoolServesManyThreadsAtOnce) {
          }
       });
    }
-   for (std::thread& thread : threads) thread.join();
+   Pelmora::Testing::JoinAll(threads, "threads to finish");
    EXPECT_EQ(0, failures.load());
    std::set<XMLParser*> all;
    for (const auto& parsers : seen) all.insert(parsers.begin(), parsers.end());
@@ -57,7 +58,7 @@ TEST(ParserPoolTest, ALeaseReleasedOnAnyThreadHandsItsParserBackLastInFirstOut) 
    pool->GetParserLease(second);
    XMLParser* secondParser = second->GetParser();
    secondParser->Parse("<d><e/></d>", true, next);
-   other.join();
+   Pelmora::Testing::Join(other, "other to finish");
    second.Reset();
    pool->GetParserLease(again);
    EXPECT_EQ(secondParser, again->GetParser());
