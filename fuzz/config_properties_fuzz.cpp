@@ -2,7 +2,7 @@
 // cannot hold may be refused on writing.
 
 #include "pelmora/service/config.h"
-#include "src/service/configBase.h"
+#include "src/config/configBase.h"
 #include "support/configRoundTrip.h"
 
 using namespace Pelmora;

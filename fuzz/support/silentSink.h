@@ -4,7 +4,7 @@
 
 #include <string>
 
-#include "src/core/report.h"
+#include "src/internal/report.h"
 
 namespace PelmoraFuzz {
 

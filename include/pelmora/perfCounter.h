@@ -4,7 +4,7 @@
 
 #include "pelmora/perfCounter/counter.h"
 #include "pelmora/perfCounter/lwStats.h"
-#include "pelmora/perfCounter/lwStatsProvider.h"
+#include "pelmora/object/lwStatsProvider.h"
 #include "pelmora/perfCounter/meter.h"
 #include "pelmora/perfCounter/prometheus.h"
 #include "pelmora/perfCounter/publishedMap.h"

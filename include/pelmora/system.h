@@ -1,7 +1,7 @@
 #pragma once
 // System services: the system factory, backtraces, locks, conditions, threads and TLS.
 
-#include "pelmora/system/backtrace.h"
+#include "pelmora/exception/backtrace.h"
 #include "pelmora/system/condition.h"
 #include "pelmora/system/lockable.h"
 #include "pelmora/system/multiSynchronized.h"

@@ -9,13 +9,15 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/formatter/messageFormatter.h"
-#include "pelmora/system/systemFactory.h"
-#include "src/core/report.h"
+#include "pelmora/exception/backtrace.h"
+#include "src/internal/report.h"
 
 namespace Pelmora {
 
 Throwable::Throwable(const std::string& message) : _message(message) {
-   System::GetSystemFactory()->CreateBacktrace(1, _backtrace);
+   System::CaptureBacktrace(1, _backtrace);
+   // Keeps this frame on the stack (no tail call), so the frames to skip stay right.
+   asm volatile("" ::: "memory");
 }
 
 Throwable::~Throwable() = default;

@@ -250,6 +250,14 @@ void PrintFormatter::FormatException(Writer* writer, const FormatValue& value, c
    writer->Write(")", 1);
 }
 
+void PrintFormatter::FormatXmlNode(Writer* writer, const FormatValue& value, const char*) {
+   if (!value.printable) {
+      writer->Write("(null)", 6);
+      return;
+   }
+   value.printable->PrintTo(writer);
+}
+
 void PrintFormatter::FormatThrowable(Writer* writer, const FormatValue& value, const char* option) {
    const Throwable* throwable = value.throwable;
    FormatValue asException{.exception = throwable};

@@ -13,8 +13,8 @@
 #include "pelmora/exception/panic.h"
 #include "pelmora/exception/throwable.h"
 #include "pelmora/formatter/messageFormatter.h"
-#include "pelmora/system/systemFactory.h"
-#include "src/core/report.h"
+#include "pelmora/exception/backtrace.h"
+#include "src/internal/report.h"
 
 namespace Pelmora {
 
@@ -114,7 +114,7 @@ void PanicNotImplemented(const char* file, int line) {
 void PanicExit(const char* message) {
    // Captured here, raw, so that the child only has to resolve it.
    Ref<System::Backtrace> backtrace;
-   if (!t_panicking) System::GetSystemFactory()->CreateBacktrace(1, backtrace);
+   if (!t_panicking) System::CaptureBacktrace(1, backtrace);
    Report(message, backtrace.Get());
 }
 

@@ -9,8 +9,8 @@
 #include "pelmora/exception/panic.h"
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/object/scoreboard.h"
-#include "pelmora/system/systemFactory.h"
-#include "src/system/nativeMutex.h"
+#include "pelmora/exception/backtrace.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora {
 
@@ -27,7 +27,7 @@ public:
       if (!name || _classNames.count(name) == 0) return;
       Ref<System::Backtrace> backtrace;
       // Start at the code that took the reference: skip this, FirstIncRef and IncRef.
-      System::GetSystemFactory()->CreateBacktrace(3, backtrace);
+      System::CaptureBacktrace(3, backtrace);
       std::string text = backtrace->GetText();
       System::NativeSynchronized lock(_mutex);
       Record& record = _records.try_emplace(text, Record{name, 0}).first->second;

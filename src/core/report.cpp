@@ -1,6 +1,6 @@
 // The standard-error report sink used until logging installs its own.
 
-#include "src/core/report.h"
+#include "src/internal/report.h"
 
 #include <unistd.h>
 

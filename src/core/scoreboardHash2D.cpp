@@ -5,9 +5,20 @@
 #include <cstdlib>
 
 #include "pelmora/formatter/messageFormatter.h"
-#include "pelmora/perfCounter/lwStats.h"
+#include "src/internal/hooks.h"
 
 namespace Pelmora {
+
+namespace Internal {
+
+namespace {
+std::atomic<ScoreboardStatsWriter> g_statsWriter{nullptr};
+}
+
+void SetScoreboardStatsWriter(ScoreboardStatsWriter writer) { g_statsWriter.store(writer); }
+ScoreboardStatsWriter GetScoreboardStatsWriter() { return g_statsWriter.load(); }
+
+}  // namespace Internal
 
 int ScoreboardHash2D::RowOf(const void* key) {
    uint32_t k = static_cast<uint32_t>(reinterpret_cast<uintptr_t>(key));
@@ -52,18 +63,19 @@ void ScoreboardHash2D::Serialize(std::string& out) const {
 }
 
 void ScoreboardHash2D::GetStats(PerfCounter::LwStatsBuilder& builder) {
-   static const PerfCounter::CounterFactory factory;
-   builder.Push("Scoreboard");
+   // The counters layer writes the statistics; without it there is nothing to write to.
+   if (Internal::ScoreboardStatsWriter writer = Internal::GetScoreboardStatsWriter()) {
+      writer(*this, builder);
+   }
+}
+
+void ScoreboardHash2D::VisitClasses(ClassVisitor visitor, void* context) const {
    for (const Row& row : _rows) {
       for (const Cell& cell : row.cells) {
          const char* key = cell.key.load(std::memory_order_acquire);
-         if (!key) continue;
-         builder.Push("Class", key);
-         builder.Insert("Instances", cell.count.Read(), factory);
-         builder.Pop();
+         if (key) visitor(context, key, cell.count.Read());
       }
    }
-   builder.Pop();
 }
 
 int ScoreboardHash2D::GetSize() const {

@@ -22,6 +22,7 @@ public:
    void Add(const char* name, int delta);
    void Serialize(std::string& out) const override;
    int GetSize() const override;
+   void VisitClasses(ClassVisitor visitor, void* context) const override;
 
    static int RowOf(const void* key);
 

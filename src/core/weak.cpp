@@ -3,7 +3,7 @@
 #include "pelmora/object/weak.h"
 
 #include "pelmora/exception/panic.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora {
 

@@ -4,7 +4,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/exception/panic.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora::PerfCounter {
 

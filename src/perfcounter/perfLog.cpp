@@ -3,7 +3,7 @@
 
 #include "src/perfcounter/perfLog.h"
 
-#include "src/service/logDefault.h"
+#include "src/internal/subsystemLog.h"
 
 namespace Pelmora::PerfCounter::Internal {
 

@@ -11,7 +11,7 @@
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/system/thread.h"
 #include "src/perfcounter/perfLog.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora::PerfCounter {
 

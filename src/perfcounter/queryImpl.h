@@ -10,7 +10,7 @@
 
 #include "pelmora/perfCounter/registry.h"
 #include "src/perfcounter/registryImpl.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora::PerfCounter {
 

@@ -16,7 +16,7 @@
 #include <vector>
 
 #include "pelmora/perfCounter/registry.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora::PerfCounter {
 

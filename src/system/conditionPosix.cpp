@@ -14,7 +14,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/exception/panic.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 #include "src/system/systemImpl.h"
 
 namespace Pelmora::System {

@@ -5,7 +5,7 @@
 
 #include "pelmora/exception/panic.h"
 #include "pelmora/system/lockable.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora::System {
 

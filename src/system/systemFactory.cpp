@@ -2,7 +2,6 @@
 
 #include "pelmora/system/systemFactory.h"
 
-#include "src/system/backtracePosix.h"
 #include "src/system/systemImpl.h"
 
 namespace Pelmora::System {

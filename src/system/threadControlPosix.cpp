@@ -9,7 +9,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/formatter/messageFormatter.h"
-#include "src/core/report.h"
+#include "src/internal/report.h"
 #include "src/system/systemImpl.h"
 #include "src/system/threadPosix.h"
 

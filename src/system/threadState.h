@@ -10,7 +10,7 @@
 #include <map>
 
 #include "pelmora/system/threadState.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora::System {
 

@@ -5,7 +5,7 @@
 #include "pelmora/exception/panic.h"
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/system/thread.h"
-#include "src/core/report.h"
+#include "src/internal/report.h"
 
 namespace Pelmora::System {
 

@@ -10,7 +10,7 @@
 
 #include "pelmora/object/atomic.h"
 #include "pelmora/object/ref.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 
 namespace Pelmora::System {
 

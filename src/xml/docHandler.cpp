@@ -5,11 +5,11 @@
 #include <cstring>
 #include <initializer_list>
 #include <memory>
+#include <mutex>
 #include <utility>
 #include <vector>
 
 #include "pelmora/exception/panic.h"
-#include "pelmora/service/config.h"
 #include "pelmora/xml/parser.h"
 #include "src/xml/nodeArena.h"
 #include "src/xml/nodeImpl.h"
@@ -18,30 +18,10 @@
 namespace Pelmora::Xml {
 namespace {
 
-// One limit as the configuration gives it, as a 64-bit integer with a default.
-long long ReadLimit(Service::Config::View* view, const char* key, long long def) {
-   PELMORA_VERIFY(def >= 0);
-   long long out = def;
-   view->Get(key, &out);
-   PELMORA_VERIFY(out >= 0);
-   return out;
-}
-
-// The limits of handlers created without explicit ones, read when each handler is made.
-// There is no application configuration to read yet: a fresh scratch configuration holds
-// nothing, so each key answers its default.
-DocLimits ReadDocLimits() {
-   Ref<Service::Config> config;
-   Service::CreateScratchConfig(config);
-   Ref<Service::Config::View> view;
-   config->GetMainView(view);
-   const DocLimits defaults;
-   DocLimits limits;
-   limits.maxChars = ReadLimit(view.Get(), "pelmora/xml/doc/maxChars", defaults.maxChars);
-   limits.maxNodes = ReadLimit(view.Get(), "pelmora/xml/doc/maxNodes", defaults.maxNodes);
-   limits.maxDepth = ReadLimit(view.Get(), "pelmora/xml/doc/maxDepth", defaults.maxDepth);
-   return limits;
-}
+// The limits of handlers created without explicit ones; whoever owns the configuration
+// sets them (SetDefaultDocLimits), the defaults stand until then.
+std::mutex g_defaultLimitsMutex;
+DocLimits g_defaultLimits;
 
 // Limits given by the caller stand where configured values would.
 void VerifyLimits(const DocLimits& limits) {
@@ -190,8 +170,19 @@ private:
 
 }  // namespace
 
+void SetDefaultDocLimits(const DocLimits& limits) {
+   VerifyLimits(limits);
+   std::lock_guard<std::mutex> lock(g_defaultLimitsMutex);
+   g_defaultLimits = limits;
+}
+
+DocLimits GetDefaultDocLimits() {
+   std::lock_guard<std::mutex> lock(g_defaultLimitsMutex);
+   return g_defaultLimits;
+}
+
 void CreateXMLDocumentHandler(Ref<XMLHandler>& out) {
-   out = new XMLDocHandlerImpl(ReadDocLimits());
+   out = new XMLDocHandlerImpl(GetDefaultDocLimits());
 }
 
 void CreateXMLDocumentHandler(const DocLimits& limits, Ref<XMLHandler>& out) {

@@ -37,6 +37,7 @@ public:
    void RemoveChild(Node* node) override;
    void WriteNode(Writer* writer) const override { WriteNode(writer, -1); }
    void PrettyWriteNode(Writer* writer) const override { WriteNode(writer, 0); }
+   void PrintTo(Writer* writer) const override { WriteNode(writer, -1); }
    ElementNode* GetChildElementByTag(const std::string& tag) const override;
    ElementNode* GetSiblingElementByTag(const std::string& tag) const override;
    ElementNode* GetChildElementByQName(const QName& name) const override;

@@ -206,21 +206,3 @@ void DocumentImpl::WriteNode(Writer* writer, int indent) const {
 }
 
 }  // namespace Pelmora::Xml
-
-namespace Pelmora {
-
-PrintFormatter::PrintFormatter(const Xml::Node* value, const char* option)
-    : PrintFormatter(FormatValue{.xmlNode = value}, option, FormatXmlNode) {}
-
-PrintFormatter::PrintFormatter(const Xml::Node& value, const char* option)
-    : PrintFormatter(FormatValue{.xmlNode = &value}, option, FormatXmlNode) {}
-
-void PrintFormatter::FormatXmlNode(Writer* writer, const FormatValue& value, const char*) {
-   if (!value.xmlNode) {
-      writer->Write("(null)", 6);
-      return;
-   }
-   value.xmlNode->WriteNode(writer);
-}
-
-}  // namespace Pelmora

@@ -3,7 +3,7 @@
 // The level is tested before anything is formatted, and logging never throws to its
 // caller (it runs inside expat's callbacks).
 
-#include "src/service/logDefault.h"
+#include "src/internal/subsystemLog.h"
 
 namespace Pelmora::Xml {
 

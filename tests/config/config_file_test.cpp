@@ -19,8 +19,8 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/config.h"
-#include "src/service/configBackend.h"
-#include "src/service/configBase.h"
+#include "src/config/configBackend.h"
+#include "src/config/configBase.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;

@@ -6,7 +6,7 @@
 
 #include <gtest/gtest.h>
 
-#include "src/service/configLock.h"
+#include "src/config/configLock.h"
 #include "tests/support/watchdog.h"
 
 using Pelmora::Service::ConfigLock;

@@ -7,7 +7,7 @@
 #include <utility>
 #include <vector>
 
-#include "src/core/report.h"
+#include "src/internal/report.h"
 
 namespace Pelmora::TestSupport {
 

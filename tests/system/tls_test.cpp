@@ -4,7 +4,7 @@
 #include <vector>
 
 #include "pelmora/system.h"
-#include "src/core/report.h"
+#include "src/internal/report.h"
 #include "src/system/tls.h"
 
 namespace Pelmora::System {

@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "pelmora/exception.h"
-#include "src/core/report.h"
+#include "src/internal/report.h"
 #include "tests/support/logCapture.h"
 #include "tests/xml/nodeBuilders.h"
 

@@ -4,12 +4,13 @@
 // (the stack shared by every thread's outer end) trimmed from those backtraces.
 // Thread-safe.
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
-#include "pelmora/system/backtrace.h"
+#include "pelmora/exception/backtrace.h"
 
 namespace Pelmora::Service {
 
-class DebugConfig {
+class PELMORA_EXPORT DebugConfig {
 public:
    virtual int GetExceptionBacktrace() const = 0;
    virtual void SetExceptionBacktrace(int maxFrames) = 0;
@@ -21,6 +22,6 @@ protected:
 };
 
 // The process-wide debug configuration; alive until exit.
-DebugConfig& GetDebugConfig();
+PELMORA_EXPORT DebugConfig& GetDebugConfig();
 
 }  // namespace Pelmora::Service

@@ -5,55 +5,56 @@
 #include <string>
 #include <typeinfo>
 
+#include "pelmora/object/export.h"
 #include "pelmora/exception/throwable.h"
 
 namespace Pelmora {
 
-class AlreadyExistsException : public Exception {
+class PELMORA_EXPORT AlreadyExistsException : public Exception {
 public:
    AlreadyExistsException() : Exception("Already Exists") {}
    explicit AlreadyExistsException(const std::string& name) : Exception("Already exists: " + name) {}
    PELMORA_EXCEPTION_CLONE(AlreadyExistsException)
 };
 
-class AlreadyInitializedException : public Exception {
+class PELMORA_EXPORT AlreadyInitializedException : public Exception {
 public:
    AlreadyInitializedException() : Exception("Already initialized") {}
    PELMORA_EXCEPTION_CLONE(AlreadyInitializedException)
 };
 
-class AuthdException : public Exception {
+class PELMORA_EXPORT AuthdException : public Exception {
 public:
    explicit AuthdException(const std::string& message) : Exception(message) {}
    PELMORA_EXCEPTION_CLONE(AuthdException)
 };
 
-class Base64FormatException : public Exception {
+class PELMORA_EXPORT Base64FormatException : public Exception {
 public:
    Base64FormatException() : Exception("Invalid base64-encoded string") {}
    PELMORA_EXCEPTION_CLONE(Base64FormatException)
 };
 
-class CanceledException : public Exception {
+class PELMORA_EXPORT CanceledException : public Exception {
 public:
    CanceledException() : Exception("Operation was canceled") {}
    PELMORA_EXCEPTION_CLONE(CanceledException)
 };
 
-class DateTimeFormatException : public Exception {
+class PELMORA_EXPORT DateTimeFormatException : public Exception {
 public:
    DateTimeFormatException() : Exception("Error formatting DateTime") {}
    PELMORA_EXCEPTION_CLONE(DateTimeFormatException)
 };
 
-class FileFormatException : public Exception {
+class PELMORA_EXPORT FileFormatException : public Exception {
 public:
    explicit FileFormatException(const std::string& text) : Exception("File Format Exception: " + text) {}
    PELMORA_EXCEPTION_CLONE(FileFormatException)
 };
 
 // A failed file operation: the message names the operation, the path the file.
-class FileIOException : public Exception {
+class PELMORA_EXPORT FileIOException : public Exception {
 public:
    FileIOException(const std::string& message, const std::string& path,
                    const std::string& secondText = std::string())
@@ -97,33 +98,33 @@ PELMORA_GIVEN_EXCEPTION(TicketExpiredException)
 PELMORA_GIVEN_EXCEPTION(TimeoutException)
 #undef PELMORA_GIVEN_EXCEPTION
 
-class IOException : public Exception {
+class PELMORA_EXPORT IOException : public Exception {
 public:
    explicit IOException(const std::string& text) : Exception("IO error: " + text) {}
    PELMORA_EXCEPTION_CLONE(IOException)
 };
 
-class InProgressException : public Exception {
+class PELMORA_EXPORT InProgressException : public Exception {
 public:
    InProgressException() : Exception("Operation is already in progress") {}
    PELMORA_EXCEPTION_CLONE(InProgressException)
 };
 
-class InvalidArgumentException : public Exception {
+class PELMORA_EXPORT InvalidArgumentException : public Exception {
 public:
    InvalidArgumentException() : Exception("Invalid argument") {}
    explicit InvalidArgumentException(const std::string& text) : Exception("Invalid argument : " + text) {}
    PELMORA_EXCEPTION_CLONE(InvalidArgumentException)
 };
 
-class InvalidStateException : public Exception {
+class PELMORA_EXPORT InvalidStateException : public Exception {
 public:
    InvalidStateException() : Exception("Invalid state") {}
    explicit InvalidStateException(const std::string& message) : Exception(message) {}
    PELMORA_EXCEPTION_CLONE(InvalidStateException)
 };
 
-class NotInitializedException : public Exception {
+class PELMORA_EXPORT NotInitializedException : public Exception {
 public:
    explicit NotInitializedException(const std::string& message) : Exception(message) {}
    NotInitializedException(const std::string& first, const std::string& second)
@@ -131,26 +132,26 @@ public:
    PELMORA_EXCEPTION_CLONE(NotInitializedException)
 };
 
-class NotSupportedException : public Exception {
+class PELMORA_EXPORT NotSupportedException : public Exception {
 public:
    NotSupportedException() : Exception("Not Supported") {}
    PELMORA_EXCEPTION_CLONE(NotSupportedException)
 };
 
-class NumberFormatException : public Exception {
+class PELMORA_EXPORT NumberFormatException : public Exception {
 public:
    NumberFormatException() : Exception("Error formatting number") {}
    explicit NumberFormatException(const std::string& message) : Exception(message) {}
    PELMORA_EXCEPTION_CLONE(NumberFormatException)
 };
 
-class NumberRangeException : public NumberFormatException {
+class PELMORA_EXPORT NumberRangeException : public NumberFormatException {
 public:
    NumberRangeException() : NumberFormatException("Number range exception") {}
    PELMORA_EXCEPTION_CLONE(NumberRangeException)
 };
 
-class ResourceInUseException : public Exception {
+class PELMORA_EXPORT ResourceInUseException : public Exception {
 public:
    explicit ResourceInUseException(const std::string& name)
       : Exception("Resource is already in use: " + name) {}
@@ -158,12 +159,12 @@ public:
 };
 
 // Holds errno as read at construction.
-struct SystemErrorCode {
+struct PELMORA_EXPORT SystemErrorCode {
    SystemErrorCode();
    int error;
 };
 
-class SystemException : public Exception {
+class PELMORA_EXPORT SystemException : public Exception {
 public:
    // The message is the system's text for the error number.
    explicit SystemException(int error);
@@ -176,14 +177,14 @@ private:
    int _error;
 };
 
-class TypeMismatchException : public Exception {
+class PELMORA_EXPORT TypeMismatchException : public Exception {
 public:
    TypeMismatchException(const std::string& wanted, const std::string& actual)
       : Exception("Type Mismatch: expected: " + wanted + ", found: " + actual) {}
    PELMORA_EXCEPTION_CLONE(TypeMismatchException)
 };
 
-class WrongThreadException : public Exception {
+class PELMORA_EXPORT WrongThreadException : public Exception {
 public:
    WrongThreadException() : Exception("Wrong Thread") {}
    PELMORA_EXCEPTION_CLONE(WrongThreadException)
@@ -192,9 +193,9 @@ public:
 namespace System {
 
 // The system's text for an error number in UTF-8, or "Unknown error N (0xN)\n".
-std::string GetErrorMessage(int error);
+PELMORA_EXPORT std::string GetErrorMessage(int error);
 // Throws SystemException with ENOMEM: the reaction to an exhausted allocation.
-[[noreturn]] void ThrowSystemMemoryException();
+[[noreturn]] PELMORA_EXPORT void ThrowSystemMemoryException();
 
 }  // namespace System
 

@@ -6,28 +6,30 @@
 #include <cstdarg>
 #include <string>
 
+#include "pelmora/object/export.h"
+
 namespace Pelmora {
 
 class Throwable;
 
-extern const char assertPrefix[];  // "Assert Failed:"
+extern PELMORA_EXPORT const char assertPrefix[];  // "Assert Failed:"
 
-[[noreturn]] void PanicVerify(const char* expr, const char* file, int line);
-[[noreturn]] void PanicNotReached(const char* file, int line);
-[[noreturn]] void PanicNotImplemented(const char* file, int line);
-[[noreturn]] void PanicExit(const char* message);
-[[noreturn]] void PanicExit(const Throwable& exception);
-[[noreturn]] void Vpanic(const char* format, va_list args);
-[[noreturn]] void Panic(const char* format, ...) __attribute__((format(printf, 1, 2)));
-[[noreturn]] void GenerateCoreDumpTerminate();
+[[noreturn]] PELMORA_EXPORT void PanicVerify(const char* expr, const char* file, int line);
+[[noreturn]] PELMORA_EXPORT void PanicNotReached(const char* file, int line);
+[[noreturn]] PELMORA_EXPORT void PanicNotImplemented(const char* file, int line);
+[[noreturn]] PELMORA_EXPORT void PanicExit(const char* message);
+[[noreturn]] PELMORA_EXPORT void PanicExit(const Throwable& exception);
+[[noreturn]] PELMORA_EXPORT void Vpanic(const char* format, va_list args);
+[[noreturn]] PELMORA_EXPORT void Panic(const char* format, ...) __attribute__((format(printf, 1, 2)));
+[[noreturn]] PELMORA_EXPORT void GenerateCoreDumpTerminate();
 
 // The report's first line: prefix, ` "expr" ` (or a blank), "@ file:line".
-std::string FormatPanicMessage(const char* prefix, const char* expr, const char* file, int line);
+PELMORA_EXPORT std::string FormatPanicMessage(const char* prefix, const char* expr, const char* file, int line);
 
 // Whether a panic writes its report from a forked child (the default) or in-process.
 // Tests that read the report from the dying process turn forking off.
-void SetPanicMayFork(bool mayFork);
-bool PanicMayFork();
+PELMORA_EXPORT void SetPanicMayFork(bool mayFork);
+PELMORA_EXPORT bool PanicMayFork();
 
 }  // namespace Pelmora
 

@@ -8,12 +8,13 @@
 #include <exception>
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
-#include "pelmora/system/backtrace.h"
+#include "pelmora/exception/backtrace.h"
 
 namespace Pelmora {
 
-class Throwable : public std::exception {
+class PELMORA_EXPORT Throwable : public std::exception {
 public:
    explicit Throwable(const std::string& message);
    ~Throwable() override;
@@ -32,7 +33,7 @@ private:
    Ref<System::Backtrace> _backtrace;
 };
 
-class Exception : public Throwable {
+class PELMORA_EXPORT Exception : public Throwable {
 public:
    using Throwable::Throwable;
    virtual Exception* Clone() const { return new Exception(*this); }

@@ -7,9 +7,11 @@
 #include <cstdint>
 #include <string>
 
+#include "pelmora/object/export.h"
+
 namespace Pelmora {
 
-class DateTime {
+class PELMORA_EXPORT DateTime {
 public:
    constexpr DateTime() = default;
    constexpr explicit DateTime(int64_t microsecondsSinceEpoch) : _micros(microsecondsSinceEpoch) {}

@@ -7,11 +7,12 @@
 
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/formatter/printFormatter.h"
 
 namespace Pelmora {
 
-class MessageFormatter {
+class PELMORA_EXPORT MessageFormatter {
 public:
    template <class... Args>
    static void Print(Writer* writer, const char* format, const Args&... args) {

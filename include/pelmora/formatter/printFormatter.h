@@ -9,18 +9,18 @@
 #include <exception>
 #include <string>
 #include <string_view>
+#include <type_traits>
 
+#include "pelmora/object/export.h"
 #include "pelmora/formatter/dateTime.h"
+#include "pelmora/formatter/printable.h"
 #include "pelmora/io/readerWriter.h"
 
 namespace Pelmora {
 
 class Throwable;
-namespace Xml {
-class Node;
-}
 
-class PrintFormatter {
+class PELMORA_EXPORT PrintFormatter {
 public:
    union FormatValue {
       bool boolean;
@@ -36,7 +36,7 @@ public:
       const std::string* stlString;
       const std::string_view* stringView;
       const Object* object;
-      const Xml::Node* xmlNode;
+      const Printable* printable;
       const std::exception* exception;
       const Throwable* throwable;
       const DateTime* dateTime;
@@ -62,10 +62,18 @@ public:
    PrintFormatter(const Object& value, const char* option = nullptr);
    PrintFormatter(const std::exception& value, const char* option = nullptr);
    PrintFormatter(const Throwable& value, const char* option = nullptr);
-   // An XML node writes its compact serialisation.
-   PrintFormatter(const Xml::Node* value, const char* option = nullptr);
-   PrintFormatter(const Xml::Node& value, const char* option = nullptr);
-   // Picks the node form for references to XML nodes, the object form for the rest.
+   // A printable value (an XML node) writes itself; these forms win over the object form
+   // for types that are both.
+   template <class T>
+      requires std::is_base_of_v<Printable, T>
+   PrintFormatter(const T* value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.printable = value}, option, FormatXmlNode) {}
+   template <class T>
+      requires std::is_base_of_v<Printable, T>
+   PrintFormatter(const T& value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.printable = &value}, option, FormatXmlNode) {}
+   // Picks the printable form for references to printable objects, the object form for
+   // the rest.
    template <class T>
    PrintFormatter(const Ref<T>& value, const char* option = nullptr)
       : PrintFormatter(static_cast<const T*>(value.Get()), option) {}
@@ -102,7 +110,7 @@ private:
 };
 
 // Formats a date-time (or a 64-bit UTC time in microseconds) as its short text.
-class DatePrintFormatter : public PrintFormatter {
+class PELMORA_EXPORT DatePrintFormatter : public PrintFormatter {
 public:
    DatePrintFormatter(const DateTime& value, const char* option = nullptr);
    DatePrintFormatter(int64_t microsecondsSinceEpoch, const char* option = nullptr);
@@ -114,7 +122,7 @@ public:
 };
 
 // Formats a date-time as its full text.
-class DateTimePrintFormatter : public PrintFormatter {
+class PELMORA_EXPORT DateTimePrintFormatter : public PrintFormatter {
 public:
    DateTimePrintFormatter(const DateTime& value, const char* option = nullptr);
 

@@ -6,15 +6,16 @@
 
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/io/readerWriter.h"
 
 namespace Pelmora {
 
 // Inflates what `source` delivers (one gzip member or several in a row); holds a reference
 // to `source` and closes it on Close.
-void CreateGzippedFileReader(Reader* source, const std::string& name, Ref<Reader>& out);
+PELMORA_EXPORT void CreateGzippedFileReader(Reader* source, const std::string& name, Ref<Reader>& out);
 // Deflates into `target`, holding a reference to it. Close writes the gzip trailer, then
 // flushes and closes `target`; a writer dropped without Close leaves the stream unfinished.
-void CreateGzippedFileWriter(Writer* target, const std::string& name, Ref<Writer>& out);
+PELMORA_EXPORT void CreateGzippedFileWriter(Writer* target, const std::string& name, Ref<Writer>& out);
 
 }  // namespace Pelmora

@@ -3,12 +3,13 @@
 
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/io/readerWriter.h"
 
 namespace Pelmora {
 
 // Collects everything written in a growing string.
-class StringWriter : public virtual Writer {
+class PELMORA_EXPORT StringWriter : public virtual Writer {
 public:
    virtual void Reset() = 0;
    virtual int GetLength() const = 0;
@@ -21,7 +22,7 @@ class BufferedWriter : public virtual Writer {};
 
 // Collects writes in 1024-byte blocks, then reads them back. The first Read switches it
 // to read mode for good: a later Write throws InvalidStateException.
-class WriteReadBuffer : public virtual Writer, public virtual Reader {
+class PELMORA_EXPORT WriteReadBuffer : public virtual Writer, public virtual Reader {
 public:
    virtual long long GetSize() const = 0;
    virtual void Rewind() = 0;
@@ -31,7 +32,7 @@ public:
 // Keeps the most recent bytes written in a fixed ring. After every write the 13-byte
 // marker "**********" + three zero bytes stands at the write position, so a reader of the
 // raw memory (a core dump, the in-memory log) finds where the newest data ends.
-class RingBufferWriter : public virtual Writer {
+class PELMORA_EXPORT RingBufferWriter : public virtual Writer {
 public:
    virtual void Reset() = 0;
    virtual const char* GetCurrentWritePointer() const = 0;
@@ -40,20 +41,20 @@ public:
 };
 
 // The ring used for text: it can also hand back what it holds, oldest first.
-class RingStringWriter : public virtual RingBufferWriter {
+class PELMORA_EXPORT RingStringWriter : public virtual RingBufferWriter {
 public:
    // The bytes the ring holds in the order written, without the marker.
    virtual std::string GetText() const = 0;
 };
 
-void CreateStringWriter(Ref<StringWriter>& out);
+PELMORA_EXPORT void CreateStringWriter(Ref<StringWriter>& out);
 // Holds a reference to `target`.
-void CreateBufferedWriter(int bufferSize, Writer* target, Ref<BufferedWriter>& out);
-void CreateWriteReadBuffer(Ref<WriteReadBuffer>& out);
-void CreateRingBufferWriter(int size, Ref<RingBufferWriter>& out);
-void CreateRingStringWriter(int size, Ref<RingBufferWriter>& out);
-void CreateRingStringWriter(int size, Ref<RingStringWriter>& out);
+PELMORA_EXPORT void CreateBufferedWriter(int bufferSize, Writer* target, Ref<BufferedWriter>& out);
+PELMORA_EXPORT void CreateWriteReadBuffer(Ref<WriteReadBuffer>& out);
+PELMORA_EXPORT void CreateRingBufferWriter(int size, Ref<RingBufferWriter>& out);
+PELMORA_EXPORT void CreateRingStringWriter(int size, Ref<RingBufferWriter>& out);
+PELMORA_EXPORT void CreateRingStringWriter(int size, Ref<RingStringWriter>& out);
 // Writes every piece to both targets; both must be given (InvalidArgumentException).
-void CreateDoubleWriter(Writer* first, Writer* second, Ref<Writer>& out);
+PELMORA_EXPORT void CreateDoubleWriter(Writer* first, Writer* second, Ref<Writer>& out);
 
 }  // namespace Pelmora

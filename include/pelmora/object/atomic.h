@@ -5,11 +5,13 @@
 
 #include <atomic>
 
+#include "pelmora/object/export.h"
+
 namespace Pelmora {
 
 // Zero by default. When set, every atomic update of a count is followed by a full
 // memory fence; the ordering of the atomic operations alone is already sufficient.
-extern std::atomic<unsigned char> AtomicUseFence;
+extern PELMORA_EXPORT std::atomic<unsigned char> AtomicUseFence;
 
 inline void AtomicFenceIfRequested() {
    if (AtomicUseFence.load(std::memory_order_relaxed) != 0) {

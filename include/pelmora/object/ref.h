@@ -12,11 +12,12 @@
 #include <type_traits>
 #include <utility>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/atomic.h"
 
 namespace Pelmora {
 
-class Object {
+class PELMORA_EXPORT Object {
 public:
    virtual void IncRef() const = 0;
    // Returns the count held before the decrement.
@@ -27,7 +28,7 @@ public:
    virtual ~Object() = default;
 };
 
-class ObjectImpl : public virtual Object {
+class PELMORA_EXPORT ObjectImpl : public virtual Object {
 public:
    ObjectImpl() = default;
    // Copying an object never copies its count: the copy starts unreferenced.
@@ -56,9 +57,9 @@ protected:
 };
 
 // The name the scoreboard and ToString use for a type: its mangled name, one leading '*' skipped.
-const char* TypeName(const std::type_info& type);
+PELMORA_EXPORT const char* TypeName(const std::type_info& type);
 
-[[noreturn]] void ThrowTypeMismatchException(const std::type_info& wanted,
+[[noreturn]] PELMORA_EXPORT void ThrowTypeMismatchException(const std::type_info& wanted,
                                              const std::type_info& actual);
 
 template <class T>

@@ -7,12 +7,13 @@
 #include <string>
 #include <unordered_set>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
-#include "pelmora/perfCounter/lwStatsProvider.h"
+#include "pelmora/object/lwStatsProvider.h"
 
 namespace Pelmora {
 
-class Scoreboard : public PerfCounter::LwStatsProvider {
+class PELMORA_EXPORT Scoreboard : public PerfCounter::LwStatsProvider {
 public:
    // Reports each counted class as Scoreboard/Class='<mangled name>'/Instances.
    void GetStats(PerfCounter::LwStatsBuilder& builder) override = 0;
@@ -23,12 +24,16 @@ public:
    // The number of classes counted.
    virtual int GetSize() const = 0;
    virtual ~Scoreboard() = default;
+   // Calls `visitor` with each counted class's name and count; lock-free, so a count may
+   // be a moment old.
+   using ClassVisitor = void (*)(void* context, const char* name, int count);
+   virtual void VisitClasses(ClassVisitor visitor, void* context) const = 0;
 };
 
 // The process-wide scoreboard; null until the first object is referenced. Lives until exit.
-Scoreboard* GetScoreboard();
+PELMORA_EXPORT Scoreboard* GetScoreboard();
 
-class RefTracker : public virtual Object {
+class PELMORA_EXPORT RefTracker : public virtual Object {
 public:
    // Appends, per tracked class, the backtraces of first references by descending count.
    virtual void GetScores(std::string& out) = 0;
@@ -38,8 +43,8 @@ public:
 
 // Creates the reference tracker for the named classes (mangled names) and installs it
 // process-wide. The installed tracker lives until exit.
-void CreateRefTracker(const std::unordered_set<std::string>& classNames, Ref<RefTracker>& out);
+PELMORA_EXPORT void CreateRefTracker(const std::unordered_set<std::string>& classNames, Ref<RefTracker>& out);
 // The installed tracker, or null.
-RefTracker* GetRefTracker();
+PELMORA_EXPORT RefTracker* GetRefTracker();
 
 }  // namespace Pelmora

@@ -7,11 +7,12 @@
 
 #include <memory>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
 
 namespace Pelmora {
 
-class WeakLink : public virtual Object {
+class PELMORA_EXPORT WeakLink : public virtual Object {
 public:
    // Fills `out` with a counted reference and returns true while the object lives;
    // otherwise leaves `out` empty and returns false.
@@ -19,7 +20,7 @@ public:
    virtual bool IsDetached() const = 0;
 };
 
-class WeakLinkable : public virtual Object {
+class PELMORA_EXPORT WeakLinkable : public virtual Object {
 public:
    virtual void AttachWeakRef(Ref<WeakLink>& out) const = 0;
    // True if `link` is this object's link; with no link, true only for null.
@@ -29,7 +30,7 @@ public:
 class WeakLinkImpl;
 
 // The link holder of a WeakLinkable object; one per object, created with it.
-class WeakLinkableImplPrivate {
+class PELMORA_EXPORT WeakLinkableImplPrivate {
 public:
    WeakLinkableImplPrivate() = default;
    WeakLinkableImplPrivate(const WeakLinkableImplPrivate&) = delete;

@@ -7,13 +7,14 @@
 #include <string>
 #include <vector>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/containers.h"
 #include "pelmora/object/ref.h"
 
 namespace Pelmora::PerfCounter {
 
 // One counter reading: a signed 64-bit number.
-class Value {
+class PELMORA_EXPORT Value {
 public:
    constexpr Value() = default;
    constexpr explicit Value(long long value) : _value(value) {}
@@ -26,7 +27,7 @@ private:
 };
 
 // The description of one counter: its path name and what kind of number it carries.
-class Metadata : public ObjectImpl {
+class PELMORA_EXPORT Metadata : public ObjectImpl {
 public:
    enum Type {
       // A count that only grows while the process runs.
@@ -56,13 +57,13 @@ private:
 };
 
 // Supplies the value of one registered counter.
-class Publisher : public virtual Object {
+class PELMORA_EXPORT Publisher : public virtual Object {
 public:
    virtual void GetValue(Metadata* metadata, Value& out) = 0;
 };
 
 // Supplies the values of a group registered together, in one call.
-class GroupPublisher : public virtual Object {
+class PELMORA_EXPORT GroupPublisher : public virtual Object {
 public:
    // `metadata` is the group exactly as registered; `values` receives one value per
    // entry, in the same order (it is cleared first).
@@ -70,7 +71,7 @@ public:
 };
 
 // Lets a single-counter Publisher stand where a group is expected: one GetValue per counter.
-class SingleGroupPublisher : public virtual GroupPublisher, public ObjectImpl {
+class PELMORA_EXPORT SingleGroupPublisher : public virtual GroupPublisher, public ObjectImpl {
 public:
    explicit SingleGroupPublisher(Publisher* publisher) : _publisher(publisher) {}
    void CollectValues(RefVector<Metadata>& metadata, std::vector<Value>& values) override;

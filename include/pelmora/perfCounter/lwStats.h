@@ -11,16 +11,17 @@
 #include <utility>
 #include <vector>
 
+#include "pelmora/object/export.h"
 #include "pelmora/io/readerWriter.h"
 #include "pelmora/perfCounter/counter.h"
-#include "pelmora/perfCounter/lwStatsProvider.h"
+#include "pelmora/object/lwStatsProvider.h"
 #include "pelmora/perfCounter/meter.h"
 
 namespace Pelmora::PerfCounter {
 
 using NamedValues = std::vector<std::pair<Ref<Metadata>, Value>>;
 
-class LwAccumulator : public ObjectImpl {
+class PELMORA_EXPORT LwAccumulator : public ObjectImpl {
 public:
    enum Type {
       TYPE_COUNTER = 1,
@@ -56,7 +57,7 @@ private:
 };
 
 // A plain count: Sample adds its value. Published as one counter under its name.
-class LwCounter : public LwAccumulator {
+class PELMORA_EXPORT LwCounter : public LwAccumulator {
 public:
    static constexpr Type kType = TYPE_COUNTER;
    explicit LwCounter(std::string name) : LwAccumulator(std::move(name)) {}
@@ -76,7 +77,7 @@ private:
 };
 
 // A meter sampled without a lock. Published as the five meter counters under its name.
-class LwMeterAccumulator : public LwAccumulator {
+class PELMORA_EXPORT LwMeterAccumulator : public LwAccumulator {
 public:
    static constexpr Type kType = TYPE_METER;
    explicit LwMeterAccumulator(std::string name) : LwAccumulator(std::move(name)) {}
@@ -99,7 +100,7 @@ protected:
 
 // A meter that also keeps the last `historySize` samples. When full, a new sample pushes
 // out the oldest; merged samples count as newer than the ones already held.
-class LwHistoryMeterAccumulator : public LwMeterAccumulator {
+class PELMORA_EXPORT LwHistoryMeterAccumulator : public LwMeterAccumulator {
 public:
    static constexpr Type kType = TYPE_HISTORY_METER;
    // InvalidArgumentException unless `historySize` is at least 1.
@@ -125,7 +126,7 @@ private:
 };
 
 // Makes accumulators of one kind; what a builder uses when a key is first seen.
-class FactoryBase {
+class PELMORA_EXPORT FactoryBase {
 public:
    virtual LwAccumulator::Type GetType() const = 0;
    virtual void Create(const std::string& name, Ref<LwAccumulator>& out) const = 0;
@@ -154,7 +155,7 @@ using HistoryMeterFactory = Factory<LwHistoryMeterAccumulator, int>;
 // Collects accumulators under a stack of namespaces. Push("Pool") then Push("Thread", "io")
 // then Insert("Busy", ...) fills the key "Pool/Thread='io'/Busy". A key is checked with
 // ValidateStatsScope when first seen; an invalid one is logged and its samples dropped.
-class LwStatsBuilder : public virtual Object {
+class PELMORA_EXPORT LwStatsBuilder : public virtual Object {
 public:
    virtual void Push(const std::string& name) = 0;
    // Enters the namespace name='value'.
@@ -180,11 +181,11 @@ public:
    virtual int GetSize() const = 0;
 };
 
-void CreateLwStatsBuilder(Ref<LwStatsBuilder>& out);
+PELMORA_EXPORT void CreateLwStatsBuilder(Ref<LwStatsBuilder>& out);
 
 // Whether `key` is a well-formed statistics key: non-empty, starting with A-Z, not ending
 // in "/" or "=", no "//", every "/" followed by A-Z, every "=" followed by "'" and at most
 // one "=" per segment. An invalid key is logged at error level and gives false.
-bool ValidateStatsScope(const std::string& key);
+PELMORA_EXPORT bool ValidateStatsScope(const std::string& key);
 
 }  // namespace Pelmora::PerfCounter

@@ -9,11 +9,12 @@
 #include <memory>
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/perfCounter/registry.h"
 
 namespace Pelmora::PerfCounter {
 
-class Meter {
+class PELMORA_EXPORT Meter {
 public:
    // The meter's counters, in field order.
    enum Counter {
@@ -59,7 +60,7 @@ private:
    long long _mean = 0;
 };
 
-class MeterAccumulator {
+class PELMORA_EXPORT MeterAccumulator {
 public:
    // `registry` may be null for a meter that is never published.
    MeterAccumulator(Registry* registry, const std::string& name);
@@ -94,7 +95,7 @@ private:
    const Ref<State> _state;
 };
 
-class MeterAccessor {
+class PELMORA_EXPORT MeterAccessor {
 public:
    // Selects the counters of the meter `name` in `registry`.
    MeterAccessor(Registry* registry, const std::string& name);

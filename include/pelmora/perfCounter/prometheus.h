@@ -17,11 +17,12 @@
 // Each family has a HELP line naming the counter path (label values shown as '*') and a
 // TYPE line; families come in name order.
 
+#include "pelmora/object/export.h"
 #include "pelmora/io/readerWriter.h"
 #include "pelmora/perfCounter/registry.h"
 
 namespace Pelmora::PerfCounter {
 
-void WritePrometheusText(Registry* registry, Writer* writer);
+PELMORA_EXPORT void WritePrometheusText(Registry* registry, Writer* writer);
 
 }  // namespace Pelmora::PerfCounter

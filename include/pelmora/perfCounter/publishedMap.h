@@ -8,12 +8,13 @@
 
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/perfCounter/lwStats.h"
 #include "pelmora/perfCounter/registry.h"
 
 namespace Pelmora::PerfCounter {
 
-class PublishedAccumulator : public virtual Object {
+class PELMORA_EXPORT PublishedAccumulator : public virtual Object {
 public:
    // The name of the accumulator: the counter path its counters are published under.
    virtual const std::string& GetName() const = 0;
@@ -31,10 +32,10 @@ public:
 };
 
 // Takes over `accumulator`, whose name is the counter path to publish under.
-void CreatePublishedAccumulator(Registry* registry, LwAccumulator* accumulator,
+PELMORA_EXPORT void CreatePublishedAccumulator(Registry* registry, LwAccumulator* accumulator,
                                 Ref<PublishedAccumulator>& out);
 
-class PublishedAccumulatorMap : public virtual Object {
+class PELMORA_EXPORT PublishedAccumulatorMap : public virtual Object {
 public:
    // Folds every accumulator of `builder` into the published one of the same key, creating
    // and publishing it on first sight. A failure is logged and the merge goes on. The
@@ -52,16 +53,16 @@ public:
 };
 
 // The process-wide map, publishing in GetCounterRegistry(). Lives until exit.
-PublishedAccumulatorMap* GetPublishedAccumulatorMap();
+PELMORA_EXPORT PublishedAccumulatorMap* GetPublishedAccumulatorMap();
 // A map publishing in `registry`, which must outlive it.
-void CreatePublishedAccumulatorMap(Registry* registry, Ref<PublishedAccumulatorMap>& out);
+PELMORA_EXPORT void CreatePublishedAccumulatorMap(Registry* registry, Ref<PublishedAccumulatorMap>& out);
 
 // The calling thread's builder, made on first use and released with the thread.
-LwStatsBuilder* GetTlsMapBuilder();
+PELMORA_EXPORT LwStatsBuilder* GetTlsMapBuilder();
 
 // Brackets a stretch of work that fills the thread's builder. When the outermost scope of
 // a thread ends, the builder is merged into `map` and emptied; nested scopes only count.
-class TlsScope {
+class PELMORA_EXPORT TlsScope {
 public:
    explicit TlsScope(PublishedAccumulatorMap* map = GetPublishedAccumulatorMap());
    ~TlsScope();

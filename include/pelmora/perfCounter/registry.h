@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/containers.h"
 #include "pelmora/perfCounter/counter.h"
 #include "pelmora/system/rwLock.h"
@@ -17,7 +18,7 @@
 namespace Pelmora::PerfCounter {
 
 // The handle of one registration.
-class RegistryItem : public virtual Object {
+class PELMORA_EXPORT RegistryItem : public virtual Object {
 public:
    // Removes the counters this item registered; later calls do nothing.
    virtual void Unregister() = 0;
@@ -25,7 +26,7 @@ public:
 };
 
 // One counter as a query found it.
-struct QueryResult {
+struct PELMORA_EXPORT QueryResult {
    Ref<Metadata> metadata;
    Value value;
    // "name = value".
@@ -43,7 +44,7 @@ enum QueryOption {
 
 // A compiled selection of counters that can be executed many times. Counters registered
 // later are added when they match, unregistered ones leave it. Thread-safe.
-class Query : public virtual Object {
+class PELMORA_EXPORT Query : public virtual Object {
 public:
    // InvalidArgumentException for an unknown option.
    virtual void SetQueryOption(QueryOption option, bool value) = 0;
@@ -57,7 +58,7 @@ public:
    virtual void Uninitialize() = 0;
 };
 
-class Registry : public virtual System::RWLockableObject {
+class PELMORA_EXPORT Registry : public virtual System::RWLockableObject {
 public:
    // Registers one counter. InvalidArgumentException for a bad name ("Invalid argument : "
    // and the name), AlreadyExistsException when the name is taken.
@@ -82,8 +83,8 @@ public:
 };
 
 // The process-wide registry. Lives until exit.
-Registry* GetCounterRegistry();
+PELMORA_EXPORT Registry* GetCounterRegistry();
 // A registry of its own, for a component that keeps its counters apart (and for tests).
-void CreateCounterRegistry(Ref<Registry>& out);
+PELMORA_EXPORT void CreateCounterRegistry(Ref<Registry>& out);
 
 }  // namespace Pelmora::PerfCounter

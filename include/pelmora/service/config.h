@@ -12,11 +12,12 @@
 #include <string>
 #include <vector>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
 
 namespace Pelmora::Service {
 
-class Config : public virtual Object {
+class PELMORA_EXPORT Config : public virtual Object {
 public:
    class View : public virtual Object {
    public:
@@ -94,27 +95,32 @@ constexpr int kConfigMaxDepth = 256;
 
 // The file factories read the file at once: a file that cannot be opened raises
 // SystemException ("Failed to open read file " + path), malformed text FileFormatException.
-void CreateXmlFileConfig(const std::string& path, int sizeLimit, unsigned flags, Ref<Config>& out);
+PELMORA_EXPORT void CreateXmlFileConfig(const std::string& path, int sizeLimit, unsigned flags, Ref<Config>& out);
 // `text` is read now and written by Flush; it must outlive the configuration. Empty (or
 // blank) text is an empty configuration.
-void CreateXmlStringConfig(std::string& text, Ref<Config>& out);
+PELMORA_EXPORT void CreateXmlStringConfig(std::string& text, Ref<Config>& out);
 // Flat files: one `key = "value"` line per value, keys joined with "/" unless `separator`
 // says otherwise; empty lines are skipped, any other line that is not a setting raises
 // FileFormatException.
-void CreateFlatFileConfig(const std::string& path, Ref<Config>& out);
-void CreateFlatFileConfig(const std::string& path, int sizeLimit, Ref<Config>& out);
-void CreateFlatFileConfig(const std::string& path, const std::string& separator, Ref<Config>& out);
-void CreateFlatStringConfig(std::string& text, Ref<Config>& out);
+PELMORA_EXPORT void CreateFlatFileConfig(const std::string& path, Ref<Config>& out);
+PELMORA_EXPORT void CreateFlatFileConfig(const std::string& path, int sizeLimit, Ref<Config>& out);
+PELMORA_EXPORT void CreateFlatFileConfig(const std::string& path, const std::string& separator, Ref<Config>& out);
+PELMORA_EXPORT void CreateFlatStringConfig(std::string& text, Ref<Config>& out);
 // Properties files: `key = value` lines, keys joined with "."; "#" lines are comments.
 // In values a backslash escapes: "\\" a backslash, "\n" a line feed, "\r" a carriage
 // return, "\t" a tab, "\ " a blank kept at either end; other backslashes stay as written.
-void CreatePropertiesFileConfig(const std::string& path, Ref<Config>& out);
-void CreatePropertiesFileConfig(const std::string& path, int sizeLimit, Ref<Config>& out);
+PELMORA_EXPORT void CreatePropertiesFileConfig(const std::string& path, Ref<Config>& out);
+PELMORA_EXPORT void CreatePropertiesFileConfig(const std::string& path, int sizeLimit, Ref<Config>& out);
 // Memory only: Load and Flush raise NotSupportedException.
-void CreateScratchConfig(Ref<Config>& out);
+PELMORA_EXPORT void CreateScratchConfig(Ref<Config>& out);
 
 // Copies the main subtree that `defaults` sees into the defaults tree of `config`, over
 // what is there (values of `defaults` win). `config` must come from the factories above.
-void SetConfigDefaults(Config* config, Config::View* defaults);
+PELMORA_EXPORT void SetConfigDefaults(Config* config, Config::View* defaults);
+
+// Sets the XML parser's default document limits (Xml::SetDefaultDocLimits) from the keys
+// "pelmora/xml/doc/maxChars", "pelmora/xml/doc/maxNodes" and "pelmora/xml/doc/maxDepth"
+// under `view`; a missing key keeps its default. A negative value is a panic.
+PELMORA_EXPORT void LoadXmlDocLimits(Config::View* view);
 
 }  // namespace Pelmora::Service

@@ -6,13 +6,14 @@
 
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/formatter/printFormatter.h"
 #include "pelmora/service/logger.h"
 
 namespace Pelmora::Service {
 
 // Writes one line always (the caller tested the level): Begin, the message, End.
-void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
+PELMORA_EXPORT void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
                      const PrintFormatter* args, int count) noexcept;
 
 inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format) noexcept {
@@ -83,12 +84,12 @@ inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* form
 // Writes the in-memory ring of `logger`'s manager (its "memory" output) out through
 // `logger`'s output at `level`, framed by lines naming `message`. Nothing without a
 // memory output.
-void LogMemoryBuffer(Logger* logger, Logger::LogLevel level, const std::string& message) noexcept;
+PELMORA_EXPORT void LogMemoryBuffer(Logger* logger, Logger::LogLevel level, const std::string& message) noexcept;
 // Writes the ring of the memory output `memory` out through the default logger's output.
-void WriteMemoryBuffer(LogOutput* memory, Logger::LogLevel level,
+PELMORA_EXPORT void WriteMemoryBuffer(LogOutput* memory, Logger::LogLevel level,
                        const std::string& message) noexcept;
 // Writes one error line holding `fault` to `logger`'s memory writers only.
-void WriteFaultToMemoryBuffer(Logger* logger, const PrintFormatter& fault) noexcept;
+PELMORA_EXPORT void WriteFaultToMemoryBuffer(Logger* logger, const PrintFormatter& fault) noexcept;
 
 }  // namespace Pelmora::Service
 

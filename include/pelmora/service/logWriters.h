@@ -6,6 +6,7 @@
 #include <cstdint>
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/service/logger.h"
 
 namespace Pelmora::Service {
@@ -21,7 +22,7 @@ namespace Pelmora::Service {
 // `flushIntervalMs` after they were written (checked every half interval by one
 // process-wide thread). Reopen (the manager's, after an outside rotation renamed the
 // file) writes the buffer to the old file and opens `path` anew.
-struct LogFileOptions {
+struct PELMORA_EXPORT LogFileOptions {
    std::string path;
    std::string level = "info";
    long long maxFileSize = 10485760;  // bytes; 0 means never roll over
@@ -31,11 +32,11 @@ struct LogFileOptions {
    int flushIntervalMs = 200;         // the longest a written line waits in the buffer
 };
 // Opens (creates) the file: SystemException when that fails.
-void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
+PELMORA_EXPORT void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
                          Ref<LogWriter>& out);
 
 // Writes each line to standard error (or standard output) at once.
-void CreateConsoleLogWriter(const std::string& name, const std::string& level, bool toStdout,
+PELMORA_EXPORT void CreateConsoleLogWriter(const std::string& name, const std::string& level, bool toStdout,
                             Ref<LogWriter>& out);
 
 // Sends each line as one datagram in the local syslog format
@@ -44,7 +45,7 @@ void CreateConsoleLogWriter(const std::string& name, const std::string& level, b
 // and the writer connects again on the next line (at most once per
 // `reconnectIntervalMs`). Priorities: quiet -> notice, panic -> crit, error -> err,
 // warning -> warning, info -> info, verbose and trivia -> debug; with the facility.
-struct LogSyslogOptions {
+struct PELMORA_EXPORT LogSyslogOptions {
    std::string socketPath = "/dev/log";
    std::string ident;               // empty: the program's name
    std::string level = "info";
@@ -52,17 +53,17 @@ struct LogSyslogOptions {
    int maxMessageSize = 8192;       // longer lines are cut to this many bytes
    int reconnectIntervalMs = 1000;
 };
-class SyslogLogWriter : public virtual LogWriter {
+class PELMORA_EXPORT SyslogLogWriter : public virtual LogWriter {
 public:
    // Lines dropped since the writer was made (no socket, or the receiver was full).
    virtual uint64_t GetLostCount() const = 0;
    // Lines cut to maxMessageSize.
    virtual uint64_t GetTruncatedCount() const = 0;
 };
-void CreateSyslogLogWriter(const std::string& name, const LogSyslogOptions& options,
+PELMORA_EXPORT void CreateSyslogLogWriter(const std::string& name, const LogSyslogOptions& options,
                            Ref<SyslogLogWriter>& out);
 
 // The priority (facility excluded) that syslog lines of a level get.
-int GetSyslogSeverity(Logger::LogLevel level);
+PELMORA_EXPORT int GetSyslogSeverity(Logger::LogLevel level);
 
 }  // namespace Pelmora::Service

@@ -13,6 +13,7 @@
 #include <map>
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/io/readerWriter.h"
 #include "pelmora/system/lockable.h"
 
@@ -24,7 +25,7 @@ class LogManager;
 class LogOutput;
 class LogWriter;
 
-class Logger : public virtual Writer {
+class PELMORA_EXPORT Logger : public virtual Writer {
 public:
    enum LogLevel {
       LOG_NONE = 0,
@@ -90,13 +91,13 @@ protected:
 };
 
 // The level table: the cumulative mask of `name` in `mask` (low half); false for an unknown name.
-bool FindLevelMask(const std::string& name, Logger::CombinedLevel& mask);
+PELMORA_EXPORT bool FindLevelMask(const std::string& name, Logger::CombinedLevel& mask);
 // The name of the highest level bit of a 16-bit mask: "none" when no bit is set.
-const char* GetLevelName(Logger::CombinedLevel mask16);
+PELMORA_EXPORT const char* GetLevelName(Logger::CombinedLevel mask16);
 
 // A writer of lines behind an output: it takes the pieces of lines whose combined level
 // meets its mask and hands them to its target. Thread-safe (its own lock).
-class LogWriter : public virtual Object {
+class PELMORA_EXPORT LogWriter : public virtual Object {
 public:
    // Called with the output's write lock held; pieces of one line arrive in order and
    // the last ends with a newline.
@@ -115,7 +116,7 @@ public:
 
 // A named set of writers. A line is written under the output's write lock, which is
 // recursive per thread; the read lock guards looking at the writers. Thread-safe.
-class LogOutput : public virtual Object {
+class PELMORA_EXPORT LogOutput : public virtual Object {
 public:
    virtual const std::string& GetName() const = 0;
    // Throws AlreadyExistsException for a taken name.
@@ -141,7 +142,7 @@ public:
 // The loggers of a process part, its named outputs and the levels per subsystem. The
 // output every new root logger uses is "default"; "memory" holds the in-memory ring.
 // Lock/Unlock guard the output table (a panic takes the memory output away under it).
-class LogManager : public virtual System::LockableObject {
+class PELMORA_EXPORT LogManager : public virtual System::LockableObject {
 public:
    static constexpr const char* kDefaultOutput = "default";
    static constexpr const char* kMemoryOutput = "memory";
@@ -155,7 +156,8 @@ public:
    // Applies the entries under "level" of `config`: each child names a subsystem in
    // "logName" and may give "logLevel" and "memoryLevel"; with "prefix" set to true the
    // levels apply to every subsystem whose name begins with "logName". Entries without a
-   // name and unknown level names are logged as warnings and skipped.
+   // name and unknown level names are logged as warnings and skipped. The configuration
+   // layer does the reading; a library built without it throws InvalidStateException.
    virtual void LoadLogLevels(Config* config) = 0;
    // The levels of subsystems without their own.
    virtual bool SetDefaultLevels(const std::string& logLevel, const std::string& memLevel) = 0;
@@ -176,37 +178,41 @@ public:
    // Reopens every file writer (after an outside log rotation renamed the files).
    virtual void Reopen() = 0;
    virtual void Flush() = 0;
+   // As SetLogLevel and SetMemLevel, for every subsystem whose name begins with `prefix`
+   // and has no level of its own; the longest matching prefix wins.
+   virtual bool SetLogLevelForPrefix(const std::string& prefix, const std::string& level) = 0;
+   virtual bool SetMemLevelForPrefix(const std::string& prefix, const std::string& level) = 0;
 };
 
-Logger* GetDefaultLogger();
-LogManager* GetDefaultLogManager();
-void CreateLogManager(Ref<LogManager>& out);
+PELMORA_EXPORT Logger* GetDefaultLogger();
+PELMORA_EXPORT LogManager* GetDefaultLogManager();
+PELMORA_EXPORT void CreateLogManager(Ref<LogManager>& out);
 // A root logger for subsystem `name` on `manager`'s default output (a new manager when
 // null), at the log level `level` ("info" with a warning when unknown; empty reads as
 // the manager's default). `writer`, when given, becomes the output's writer "main" at
 // every level.
-void CreateLogger(Writer* writer, const std::string& name, const std::string& level,
+PELMORA_EXPORT void CreateLogger(Writer* writer, const std::string& name, const std::string& level,
                   LogManager* manager, Ref<Logger>& out);
 // A writer over `target` for the output levels of `level` (InvalidArgumentException for
 // an unknown name).
-void CreateLogWriter(const std::string& name, Writer* target, const std::string& level,
+PELMORA_EXPORT void CreateLogWriter(const std::string& name, Writer* target, const std::string& level,
                      Ref<LogWriter>& out);
 // A writer into a ring of `sizeK` kilobytes for the memory levels of `level`.
-void CreateMemLogWriter(const std::string& name, int sizeK, const std::string& level,
+PELMORA_EXPORT void CreateMemLogWriter(const std::string& name, int sizeK, const std::string& level,
                         Ref<LogWriter>& out);
 
 // The process-wide fast-path switch: a line that fits the thread's buffer is handed to
 // its output in one locked call. On by default.
-bool IsUsingLogFastPath();
-void SetUsingLogFastPath(bool on);
+PELMORA_EXPORT bool IsUsingLogFastPath();
+PELMORA_EXPORT void SetUsingLogFastPath(bool on);
 
 // The calling thread's log context: its entries, in key order, stand in the prefix of
 // every line the thread writes. An empty value removes the key.
-void SetLogContext(const std::string& key, const std::string& value);
-std::string GetLogContext(const std::string& key);
+PELMORA_EXPORT void SetLogContext(const std::string& key, const std::string& value);
+PELMORA_EXPORT std::string GetLogContext(const std::string& key);
 using LogContextCallback = std::function<void(const std::string& key, const std::string& value)>;
 // Every SetLogContext calls every registered callback with the key and value.
-void AddLogContextUpdateCallback(const std::string& name, const LogContextCallback& callback);
-void RemoveLogContextUpdateCallback(const std::string& name);
+PELMORA_EXPORT void AddLogContextUpdateCallback(const std::string& name, const LogContextCallback& callback);
+PELMORA_EXPORT void RemoveLogContextUpdateCallback(const std::string& name);
 
 }  // namespace Pelmora::Service

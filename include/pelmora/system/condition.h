@@ -4,12 +4,13 @@
 // Time-outs run on the monotonic clock. WaitableObjectImpl is the base of objects that
 // callers lock and wait on: its own Mutex (or a shared one) bound to a Condition. Thread-safe.
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
 #include "pelmora/system/lockable.h"
 
 namespace Pelmora::System {
 
-class Condition : public virtual Object {
+class PELMORA_EXPORT Condition : public virtual Object {
 public:
    // Waits until signalled. The caller holds `mutex`; it is held again on return,
    // also when an exception leaves.
@@ -22,7 +23,7 @@ public:
    virtual void Broadcast() = 0;
 };
 
-class WaitableObject : public virtual Object {
+class PELMORA_EXPORT WaitableObject : public virtual Object {
 public:
    // The caller holds the object's lock around Wait and TimedWait.
    virtual void Wait() = 0;
@@ -31,7 +32,7 @@ public:
    virtual void Broadcast() = 0;
 };
 
-class WaitableObjectImpl : public virtual WaitableObject, public LockableObjectImpl {
+class PELMORA_EXPORT WaitableObjectImpl : public virtual WaitableObject, public LockableObjectImpl {
 public:
    // A new mutex and condition from the system factory.
    WaitableObjectImpl();

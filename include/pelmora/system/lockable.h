@@ -5,11 +5,12 @@
 // Mutex and forwards to it. Synchronized holds a lock for a scope. All thread-safe except
 // a Synchronized guard, which belongs to the scope that made it.
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
 
 namespace Pelmora::System {
 
-class LockableObject : public virtual Object {
+class PELMORA_EXPORT LockableObject : public virtual Object {
 public:
    virtual void Lock() = 0;
    virtual void Unlock() = 0;
@@ -19,7 +20,7 @@ public:
 
 class Mutex : public virtual LockableObject {};
 
-class LockableObjectImpl : public virtual LockableObject, public ObjectImpl {
+class PELMORA_EXPORT LockableObjectImpl : public virtual LockableObject, public ObjectImpl {
 public:
    // With a new mutex from the system factory.
    LockableObjectImpl();
@@ -37,7 +38,7 @@ private:
 };
 
 // Locks `lockable` until the end of the scope.
-class Synchronized {
+class PELMORA_EXPORT Synchronized {
 public:
    explicit Synchronized(LockableObject* lockable) : _lockable(lockable) { _lockable->Lock(); }
    ~Synchronized() { _lockable->Unlock(); }

@@ -7,12 +7,13 @@
 
 #include <vector>
 
+#include "pelmora/object/export.h"
 #include "pelmora/system/lockable.h"
 #include "pelmora/system/rwLock.h"
 
 namespace Pelmora::System {
 
-class MultiSynchronized {
+class PELMORA_EXPORT MultiSynchronized {
 public:
    MultiSynchronized() = default;
    ~MultiSynchronized();
@@ -28,7 +29,7 @@ private:
    bool _isLocked = false;
 };
 
-class MultiReadWriteSynchronized {
+class PELMORA_EXPORT MultiReadWriteSynchronized {
 public:
    MultiReadWriteSynchronized() = default;
    ~MultiReadWriteSynchronized();

@@ -5,11 +5,12 @@
 // lock and a writer downgrade to a read hold. RWLockableObjectImpl is the base of objects
 // that are themselves reader/writer lockable; it owns one RWLock. Thread-safe.
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
 
 namespace Pelmora::System {
 
-class RWLockableObject : public virtual Object {
+class PELMORA_EXPORT RWLockableObject : public virtual Object {
 public:
    enum LockMode {
       // Readers enter while no writer holds the lock; writers may starve.
@@ -39,7 +40,7 @@ public:
 
 class RWLock : public virtual RWLockableObject {};
 
-class RWLockableObjectImpl : public virtual RWLockableObject, public ObjectImpl {
+class PELMORA_EXPORT RWLockableObjectImpl : public virtual RWLockableObject, public ObjectImpl {
 public:
    // With a new lock of `mode` from the system factory.
    explicit RWLockableObjectImpl(int mode = LOCK_MODE_DEFAULT);

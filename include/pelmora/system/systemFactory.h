@@ -2,8 +2,9 @@
 // The system factory creates the operating-system backed objects of the library.
 // One process-wide instance, alive until exit; thread-safe.
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
-#include "pelmora/system/backtrace.h"
+#include "pelmora/exception/backtrace.h"
 #include "pelmora/system/condition.h"
 #include "pelmora/system/lockable.h"
 #include "pelmora/system/rwLock.h"
@@ -11,7 +12,7 @@
 
 namespace Pelmora::System {
 
-class SystemFactory {
+class PELMORA_EXPORT SystemFactory {
 public:
    // Captures the calling thread's stack, leaving out the `skipFrames` innermost frames
    // above the caller of CreateBacktrace.
@@ -26,6 +27,6 @@ protected:
    ~SystemFactory() = default;
 };
 
-SystemFactory* GetSystemFactory();
+PELMORA_EXPORT SystemFactory* GetSystemFactory();
 
 }  // namespace Pelmora::System

@@ -12,13 +12,14 @@
 #include <utility>
 #include <vector>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
 
 namespace Pelmora::System {
 
 using ThreadFunction = std::function<void()>;
 
-class Thread : public virtual Object {
+class PELMORA_EXPORT Thread : public virtual Object {
 public:
    // Sleeps the calling thread; a signal does not cut it short. Negative panics.
    virtual void Sleep(long long microseconds) = 0;
@@ -34,7 +35,7 @@ public:
    virtual void SetTls(int key, Object* object) = 0;
 };
 
-class ThreadControl : public virtual Object {
+class PELMORA_EXPORT ThreadControl : public virtual Object {
 public:
    enum POLL_EVENT {
       POLL_EVENT_READ = 1,
@@ -66,15 +67,15 @@ public:
 };
 
 // The calling thread's object, created on first use for a thread the library did not start.
-Thread* GetThisThread();
+PELMORA_EXPORT Thread* GetThisThread();
 // Whether the calling thread has its object yet.
-bool ThisThreadExists();
+PELMORA_EXPORT bool ThisThreadExists();
 // The calling thread's kernel thread id.
-long long GetThreadId();
+PELMORA_EXPORT long long GetThreadId();
 
 // A key for one TLS slot in every thread. Released keys are reused with a new version,
 // so an object left behind under an old key is never returned for the new one.
-int ReserveTlsKey();
-void ReleaseTlsKey(int key);
+PELMORA_EXPORT int ReserveTlsKey();
+PELMORA_EXPORT void ReleaseTlsKey(int key);
 
 }  // namespace Pelmora::System

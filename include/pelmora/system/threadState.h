@@ -9,15 +9,16 @@
 #include <map>
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/weak.h"
 
 namespace Pelmora::System {
 
 constexpr unsigned THREAD_STATE_MAXIMUM_MESSAGES = 16;
 // Stands for the messages of a thread whose board changed under every copy attempt.
-extern const char THREAD_STATE_READFAILED_TOKEN[];
+extern PELMORA_EXPORT const char THREAD_STATE_READFAILED_TOKEN[];
 
-class ThreadState : public virtual WeakLinkable {
+class PELMORA_EXPORT ThreadState : public virtual WeakLinkable {
 public:
    // Posts at most 255 characters of `text`. Returns the cell for Remove, or
    // THREAD_STATE_MAXIMUM_MESSAGES when every cell is taken (only counted then).
@@ -29,11 +30,11 @@ public:
 };
 
 // The calling thread's board, created and registered on first use.
-ThreadState* GetThreadState();
-unsigned AddThreadState(const char* text);
-void RemoveThreadState(unsigned index);
+PELMORA_EXPORT ThreadState* GetThreadState();
+PELMORA_EXPORT unsigned AddThreadState(const char* text);
+PELMORA_EXPORT void RemoveThreadState(unsigned index);
 // Appends every living thread's messages to result[thread id]; a board that could not be
 // read whole gives the single text THREAD_STATE_READFAILED_TOKEN.
-void CopyThreadStates(std::map<long long, std::list<std::string>>& result, int attempts);
+PELMORA_EXPORT void CopyThreadStates(std::map<long long, std::list<std::string>>& result, int attempts);
 
 }  // namespace Pelmora::System

@@ -10,6 +10,8 @@
 #include <string>
 #include <utility>
 
+#include "pelmora/object/export.h"
+#include "pelmora/formatter/printable.h"
 #include "pelmora/io/readerWriter.h"
 #include "pelmora/object/ref.h"
 
@@ -26,7 +28,7 @@ enum NodeType : int {
 };
 
 // A namespace URI and a local name.
-struct QName {
+struct PELMORA_EXPORT QName {
    QName() = default;
    QName(std::string namespaceUri, std::string localPart)
        : uri(std::move(namespaceUri)), localName(std::move(localPart)) {}
@@ -41,7 +43,8 @@ class ElementNode;
 // Insertion takes one reference to the new node, which must be free (no parent, no next
 // sibling); a null node, a `pos` that is not a child of this node, or a node still linked
 // elsewhere is a panic. Kinds of children a parent refuses raise InvalidArgumentException.
-class Node : public virtual Object {
+// As a message argument a node prints its compact form.
+class PELMORA_EXPORT Node : public virtual Object, public Printable {
 public:
    virtual Node* GetParent() const = 0;
    virtual Node* GetFirstChild() const = 0;
@@ -71,7 +74,7 @@ public:
 
 // An element: an optional prefix, a local name (tag), attributes and the position in the
 // source text (0 when built by code). Children: elements, text, CDATA and comments.
-class ElementNode : public virtual Node {
+class PELMORA_EXPORT ElementNode : public virtual Node {
 public:
    virtual const std::string& GetPrefix() const = 0;
    virtual void SetPrefix(const std::string& prefix) = 0;
@@ -101,7 +104,7 @@ public:
 
 // A document: at most one root element, plus comments and processing instructions, and
 // the XML declaration's version and encoding (empty unless set or parsed).
-class Document : public virtual Node {
+class PELMORA_EXPORT Document : public virtual Node {
 public:
    virtual ElementNode* GetRoot() const = 0;
    // Replaces the root in its place; null removes it.
@@ -113,7 +116,7 @@ public:
    virtual void SetEncoding(const std::string& encoding) = 0;
 };
 
-class TextNode : public virtual Node {
+class PELMORA_EXPORT TextNode : public virtual Node {
 public:
    virtual const std::string& GetText() const = 0;
    virtual void SetText(const std::string& text) = 0;
@@ -123,13 +126,13 @@ public:
 // A CDATA section; its content is its text-node children, written unescaped.
 class CDataNode : public virtual Node {};
 
-class CommentNode : public virtual Node {
+class PELMORA_EXPORT CommentNode : public virtual Node {
 public:
    virtual const std::string& GetComment() const = 0;
    virtual void SetComment(const std::string& comment) = 0;
 };
 
-class ProcessingInstructionNode : public virtual Node {
+class PELMORA_EXPORT ProcessingInstructionNode : public virtual Node {
 public:
    virtual const std::string& GetTarget() const = 0;
    virtual void SetTarget(const std::string& target) = 0;
@@ -137,52 +140,52 @@ public:
    virtual void SetData(const std::string& data) = 0;
 };
 
-void CreateDocument(Ref<Document>& out);
+PELMORA_EXPORT void CreateDocument(Ref<Document>& out);
 // By qualified name, split at the first ":" into prefix and tag. A name that starts with
 // ":" (not namespace-well-formed, but legal XML) has no prefix and is kept whole as the tag.
-void CreateElementNode(const std::string& qualifiedName, Ref<ElementNode>& out);
-void CreateElementNode(const std::string& qualifiedName, int line, int column,
+PELMORA_EXPORT void CreateElementNode(const std::string& qualifiedName, Ref<ElementNode>& out);
+PELMORA_EXPORT void CreateElementNode(const std::string& qualifiedName, int line, int column,
                        Ref<ElementNode>& out);
-void CreateElementNode(const std::string& prefix, const std::string& tag, Ref<ElementNode>& out);
-void CreateElementNode(const std::string& prefix, const std::string& tag, int line, int column,
+PELMORA_EXPORT void CreateElementNode(const std::string& prefix, const std::string& tag, Ref<ElementNode>& out);
+PELMORA_EXPORT void CreateElementNode(const std::string& prefix, const std::string& tag, int line, int column,
                        Ref<ElementNode>& out);
-void CreateTextNode(Ref<TextNode>& out);
-void CreateTextNode(const std::string& text, Ref<TextNode>& out);
-void CreateCDataNode(Ref<CDataNode>& out);
-void CreateCommentNode(Ref<CommentNode>& out);
-void CreateCommentNode(const std::string& comment, Ref<CommentNode>& out);
-void CreateProcessingInstructionNode(Ref<ProcessingInstructionNode>& out);
-void CreateProcessingInstructionNode(const std::string& target, const std::string& data,
+PELMORA_EXPORT void CreateTextNode(Ref<TextNode>& out);
+PELMORA_EXPORT void CreateTextNode(const std::string& text, Ref<TextNode>& out);
+PELMORA_EXPORT void CreateCDataNode(Ref<CDataNode>& out);
+PELMORA_EXPORT void CreateCommentNode(Ref<CommentNode>& out);
+PELMORA_EXPORT void CreateCommentNode(const std::string& comment, Ref<CommentNode>& out);
+PELMORA_EXPORT void CreateProcessingInstructionNode(Ref<ProcessingInstructionNode>& out);
+PELMORA_EXPORT void CreateProcessingInstructionNode(const std::string& target, const std::string& data,
                                      Ref<ProcessingInstructionNode>& out);
 
 // Whether attribute "xsi:nil", or failing that "xsi:null", is exactly "true" or "1". The
 // names are taken literally (the prefix is not resolved).
-bool IsNil(const ElementNode* element);
+PELMORA_EXPORT bool IsNil(const ElementNode* element);
 // From `node` itself along next-sibling links: the first element that is not nil.
-ElementNode* GetFirstSiblingElement(Node* node);
-ElementNode* GetNextSiblingElement(Node* node);
-ElementNode* GetFirstChildElement(Node* node);
+PELMORA_EXPORT ElementNode* GetFirstSiblingElement(Node* node);
+PELMORA_EXPORT ElementNode* GetNextSiblingElement(Node* node);
+PELMORA_EXPORT ElementNode* GetFirstChildElement(Node* node);
 // The namespace in scope for the element's own prefix (ResolvePrefix); false and an empty
 // `uri` when none is declared.
-bool GetNamespace(const ElementNode* element, std::string& uri);
+PELMORA_EXPORT bool GetNamespace(const ElementNode* element, std::string& uri);
 
 // Reads a value by a slash-separated path: the first step names the start element ("*"
 // for any), each later step the first child element with that tag ("*" for any), and a
 // step "@name" an attribute of the element reached, which ends the walk at once. Without
 // an attribute step the value is the text of the element's first child, which must be a
 // text node. False when a step finds nothing; `result` is then untouched.
-bool EvaluateSimplePath(const ElementNode* element, const std::string& path, std::string& result);
+PELMORA_EXPORT bool EvaluateSimplePath(const ElementNode* element, const std::string& path, std::string& result);
 // The same from the document's root; InvalidArgumentException when there is no root.
-bool EvaluateSimplePath(const Document* document, const std::string& path, std::string& result);
+PELMORA_EXPORT bool EvaluateSimplePath(const Document* document, const std::string& path, std::string& result);
 
 // Escapes the five markup characters as entities and writes other bytes below 32, except
 // tab, line feed and carriage return, as "%" and two lowercase hexadecimal digits.
-void WriteText(Writer* writer, const std::string& text);
+PELMORA_EXPORT void WriteText(Writer* writer, const std::string& text);
 
 // Whether `uri` may serve as a namespace URI: not null or empty; no blank, control byte
 // or any of < > " { } | \ ^ `; every "%" followed by two hexadecimal digits; and when a
 // ":" comes before any "/", "?" or "#", the scheme before it starts with a letter and holds
 // only letters, digits, "+", "-" and ".". Bytes of 128 and above pass (IRIs).
-bool ValidateAnyURI(const char* uri);
+PELMORA_EXPORT bool ValidateAnyURI(const char* uri);
 
 }  // namespace Pelmora::Xml

@@ -7,6 +7,7 @@
 
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/io/readerWriter.h"
 #include "pelmora/object/ref.h"
@@ -14,7 +15,7 @@
 namespace Pelmora::Xml {
 
 // Malformed input, a stopped parse or a refused entity: expat's text and the line.
-class XMLParseException : public Throwable {
+class PELMORA_EXPORT XMLParseException : public Throwable {
 public:
    XMLParseException(const std::string& message, int line) : Throwable(message), _line(line) {}
    int GetLineNumber() const { return _line; }
@@ -27,7 +28,7 @@ private:
 
 // Thrown by a handler to stop the parse once it has logged why; callers of Parse see an
 // XMLParseException.
-class ParsingAbortedException : public Exception {
+class PELMORA_EXPORT ParsingAbortedException : public Exception {
 public:
    ParsingAbortedException() : Exception(std::string()) {}
    PELMORA_EXCEPTION_CLONE(ParsingAbortedException)
@@ -35,7 +36,7 @@ public:
 
 // Receives a parse's events. Names arrive as written (prefix, ":", local name): expat does
 // no namespace processing. An exception thrown from an event stops the parse.
-class XMLHandler : public virtual Object {
+class PELMORA_EXPORT XMLHandler : public virtual Object {
 public:
    virtual void OnProcessingInstruction(const std::string& target, const std::string& data) = 0;
    // `attributes` as expat gives them: name, value, name, value, ..., then null.
@@ -58,7 +59,7 @@ public:
    virtual void CleanUpDocument() = 0;
 };
 
-class XMLParser : public virtual Object {
+class PELMORA_EXPORT XMLParser : public virtual Object {
 public:
    // The parser holds a reference to `handler`; null is a panic.
    virtual void SetXMLHandler(XMLHandler* handler) = 0;
@@ -76,7 +77,7 @@ public:
 // Reusable parsers for servers that parse on many threads. A lease holds one parser and a
 // reference to its pool; when the last reference to the lease goes, on whatever thread,
 // the parser returns to the pool. Idle parsers are kept until the pool dies. Thread-safe.
-class XMLParserPool : public virtual Object {
+class PELMORA_EXPORT XMLParserPool : public virtual Object {
 public:
    class ParserLease : public virtual Object {
    public:
@@ -90,9 +91,10 @@ public:
 
 // The limits the standard handler enforces on restricted documents; a count fails only
 // when strictly greater than its limit. A handler takes them when it is created. Handlers
-// made without explicit limits (the pool's included) read the configuration keys named
-// below; each missing key, or no configuration at all, gives the default shown.
-struct DocLimits {
+// made without explicit limits (the pool's included) take the process's default limits,
+// which the configuration keys named below set (Service::LoadXmlDocLimits); each missing
+// key gives the default shown.
+struct PELMORA_EXPORT DocLimits {
    // "pelmora/xml/doc/maxChars": bytes of names, attribute names and values, character
    // data, comments and processing instructions in one document.
    long long maxChars = 2147483648LL;
@@ -104,14 +106,17 @@ struct DocLimits {
 };
 
 // `handler` must not be null (panic).
-void CreateXMLParser(XMLHandler* handler, Ref<XMLParser>& out);
+PELMORA_EXPORT void CreateXMLParser(XMLHandler* handler, Ref<XMLParser>& out);
 // The standard handler, building a Document under the configured limits.
-void CreateXMLDocumentHandler(Ref<XMLHandler>& out);
+PELMORA_EXPORT void CreateXMLDocumentHandler(Ref<XMLHandler>& out);
 // Under explicit limits; a negative one is a panic.
-void CreateXMLDocumentHandler(const DocLimits& limits, Ref<XMLHandler>& out);
-void CreateXMLParserPool(Ref<XMLParserPool>& out);
+PELMORA_EXPORT void CreateXMLDocumentHandler(const DocLimits& limits, Ref<XMLHandler>& out);
+PELMORA_EXPORT void CreateXMLParserPool(Ref<XMLParserPool>& out);
+// The limits of handlers made without explicit ones from now on; a negative one is a panic.
+PELMORA_EXPORT void SetDefaultDocLimits(const DocLimits& limits);
+PELMORA_EXPORT DocLimits GetDefaultDocLimits();
 
 // The process-wide pool; alive until exit.
-XMLParserPool* GetXmlParserPool();
+PELMORA_EXPORT XMLParserPool* GetXmlParserPool();
 
 }  // namespace Pelmora::Xml

@@ -15,8 +15,8 @@
 #include "pelmora/object/ref.h"
 #include "pelmora/service/config.h"
 #include "pelmora/system/lockable.h"
-#include "src/service/configBackend.h"
-#include "src/service/configLock.h"
+#include "src/config/configBackend.h"
+#include "src/config/configLock.h"
 
 namespace Pelmora::Service {
 

@@ -9,8 +9,7 @@
 #include <cstdlib>
 #include <memory>
 
-#include "pelmora/system/backtrace.h"
-#include "src/system/backtracePosix.h"
+#include "pelmora/exception/backtrace.h"
 
 namespace Pelmora::System {
 

@@ -1,6 +1,6 @@
 // The configuration's logger: a child of the default logger, made on first use.
 
-#include "src/service/configLog.h"
+#include "src/config/configLog.h"
 
 namespace Pelmora::Service {
 

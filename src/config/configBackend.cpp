@@ -2,7 +2,7 @@
 // ".tmp" and renamed over the old one, with fsync of the file and of its directory, so a
 // crash or power loss leaves the old file or the new one, never a torn one.
 
-#include "src/service/configBackend.h"
+#include "src/config/configBackend.h"
 
 #include <fcntl.h>
 #include <unistd.h>
@@ -15,7 +15,7 @@
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/io.h"
 #include "pelmora/service/config.h"
-#include "src/service/configLog.h"
+#include "src/config/configLog.h"
 
 namespace Pelmora::Service {
 

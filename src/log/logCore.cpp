@@ -1,5 +1,6 @@
 // The level table, loggers, their manager, outputs and the plain writers.
 
+#include <atomic>
 #include <cstdio>
 #include <cstring>
 #include <utility>
@@ -7,7 +8,8 @@
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/exception/panic.h"
 #include "pelmora/io/writers.h"
-#include "src/service/logImpl.h"
+#include "src/internal/hooks.h"
+#include "src/log/logImpl.h"
 
 namespace Pelmora::Service {
 
@@ -401,6 +403,12 @@ bool LogManagerImpl::HasOwnLevels(const std::string& subsystem) {
           FindPrefix(_logPrefixes, subsystem) || FindPrefix(_memPrefixes, subsystem);
 }
 
+void LogManagerImpl::LoadLogLevels(Config* config) {
+   Internal::LogLevelsLoader loader = Internal::GetLogLevelsLoader();
+   if (!loader) throw InvalidStateException("No configuration reader for log levels");
+   loader(*this, *config);
+}
+
 bool LogManagerImpl::SetLogLevelForPrefix(const std::string& prefix, const std::string& level) {
    Logger::CombinedLevel mask;
    if (!FindLevelMask(level, mask)) return false;
@@ -537,3 +545,14 @@ void LogManagerImpl::Flush() {
 }
 
 }  // namespace Pelmora::Service
+
+namespace Pelmora::Internal {
+
+namespace {
+std::atomic<LogLevelsLoader> g_logLevelsLoader{nullptr};
+}
+
+void SetLogLevelsLoader(LogLevelsLoader loader) { g_logLevelsLoader.store(loader); }
+LogLevelsLoader GetLogLevelsLoader() { return g_logLevelsLoader.load(); }
+
+}  // namespace Pelmora::Internal

@@ -14,7 +14,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/logWriters.h"
-#include "src/service/logImpl.h"
+#include "src/log/logImpl.h"
 
 extern char* program_invocation_short_name;
 

@@ -1,9 +1,10 @@
-// Per-subsystem levels read from the configuration's "level" entries.
+// Per-subsystem log levels read from the configuration's "level" entries; installed as the
+// log manager's loader when the library is loaded.
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/config.h"
 #include "pelmora/service/logMacros.h"
-#include "src/service/logImpl.h"
+#include "src/internal/hooks.h"
 
 namespace Pelmora::Service {
 
@@ -16,11 +17,9 @@ void Warn(const char* format, const Args&... args) {
    PELMORA_LOG_WARNING(GetDefaultLogger(), format, args...);
 }
 
-}  // namespace
-
-void LogManagerImpl::LoadLogLevels(Config* config) {
+void LoadLogLevels(LogManager& manager, Config& config) {
    Ref<Config::View> view;
-   config->GetMainView(view);
+   config.GetMainView(view);
    std::vector<std::string> entries;
    view->GetChildNames("level", entries);
    for (const std::string& entry : entries) {
@@ -39,14 +38,18 @@ void LogManagerImpl::LoadLogLevels(Config* config) {
          continue;
       }
       if (settings->Get("logLevel", &logLevel)) {
-         bool ok = prefix ? SetLogLevelForPrefix(name, logLevel) : SetLogLevel(name, logLevel);
+         bool ok = prefix ? manager.SetLogLevelForPrefix(name, logLevel) : manager.SetLogLevel(name, logLevel);
          if (!ok) Warn("Unrecognized logLevel '%2' for '%1'", name, logLevel);
       }
       if (settings->Get("memoryLevel", &memLevel)) {
-         bool ok = prefix ? SetMemLevelForPrefix(name, memLevel) : SetMemLevel(name, memLevel);
+         bool ok = prefix ? manager.SetMemLevelForPrefix(name, memLevel) : manager.SetMemLevel(name, memLevel);
          if (!ok) Warn("Unrecognized memoryLevel '%2' for '%1'", name, memLevel);
       }
    }
 }
+
+[[maybe_unused]] const bool g_installed = (Internal::SetLogLevelsLoader(&LoadLogLevels), true);
+
+}  // namespace
 
 }  // namespace Pelmora::Service

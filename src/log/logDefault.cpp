@@ -1,13 +1,13 @@
 // The process's default manager and logger, the report sink that sends exception dumps
 // and panic reports through them, and writing the in-memory ring out.
 
-#include "src/service/logDefault.h"
+#include "src/internal/subsystemLog.h"
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/logMacros.h"
 #include "pelmora/service/logWriters.h"
-#include "src/core/report.h"
-#include "src/service/logImpl.h"
+#include "src/internal/report.h"
+#include "src/log/logImpl.h"
 
 namespace Pelmora::Service {
 

@@ -6,7 +6,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/formatter/messageFormatter.h"
-#include "src/service/configBase.h"
+#include "src/config/configBase.h"
 
 namespace Pelmora::Service {
 

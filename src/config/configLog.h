@@ -3,7 +3,7 @@
 // elsewhere. The level is tested before anything is formatted, and logging never throws
 // to its caller (it runs in destructors and clean-up paths).
 
-#include "src/service/logDefault.h"
+#include "src/internal/subsystemLog.h"
 
 namespace Pelmora::Service {
 

@@ -6,8 +6,8 @@
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/xml.h"
-#include "src/service/configBase.h"
-#include "src/service/configText.h"
+#include "src/config/configBase.h"
+#include "src/config/configText.h"
 
 namespace Pelmora::Service {
 

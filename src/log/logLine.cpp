@@ -14,7 +14,7 @@
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/service/logMacros.h"
 #include "pelmora/system/thread.h"
-#include "src/service/logImpl.h"
+#include "src/log/logImpl.h"
 
 namespace Pelmora::Service {
 

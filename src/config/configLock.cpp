@@ -1,6 +1,6 @@
 // glibc's reader/writer lock prefers readers by default; this one is told to prefer writers.
 
-#include "src/service/configLock.h"
+#include "src/config/configLock.h"
 
 namespace Pelmora::Service {
 

@@ -1,6 +1,6 @@
 // Character checks for the XML syntax.
 
-#include "src/service/configText.h"
+#include "src/config/configText.h"
 
 #include <cstdint>
 

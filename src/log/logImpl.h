@@ -176,8 +176,8 @@ public:
    void LoadLogLevels(Config* config) override;
    // As SetLogLevel and SetMemLevel, for every subsystem whose name begins with `prefix`
    // and has no level of its own; the longest matching prefix wins.
-   bool SetLogLevelForPrefix(const std::string& prefix, const std::string& level);
-   bool SetMemLevelForPrefix(const std::string& prefix, const std::string& level);
+   bool SetLogLevelForPrefix(const std::string& prefix, const std::string& level) override;
+   bool SetMemLevelForPrefix(const std::string& prefix, const std::string& level) override;
 
 private:
    // Locks unless the calling thread holds the lock already (the panic path does).

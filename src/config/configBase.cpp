@@ -1,7 +1,7 @@
 // The configuration tree, its views and its typed values; loading and flushing through a
 // backend. The syntaxes live in configXml.cpp and configFlat.cpp.
 
-#include "src/service/configBase.h"
+#include "src/config/configBase.h"
 
 #include <algorithm>
 #include <charconv>

@@ -5,11 +5,12 @@
 
 #include <string>
 
+#include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
 
 namespace Pelmora::System {
 
-class Backtrace : public virtual Object {
+class PELMORA_EXPORT Backtrace : public virtual Object {
 public:
    virtual int GetFrameCount() const = 0;
    virtual void* GetFrame(int index) const = 0;
@@ -17,5 +18,12 @@ public:
    // `firstFrame` and holding at most `maxFrames` lines (negative: all).
    virtual std::string GetText(int firstFrame = 0, int maxFrames = -1) const = 0;
 };
+
+// The most frames a backtrace keeps.
+constexpr int kMaxBacktraceFrames = 64;
+
+// Captures the calling thread's stack with the C library's unwinder, leaving out this
+// function and the `skipFrames` innermost frames of its caller.
+PELMORA_EXPORT void CaptureBacktrace(int skipFrames, Ref<Backtrace>& out);
 
 }  // namespace Pelmora::System

@@ -19,7 +19,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/logWriters.h"
-#include "src/service/logImpl.h"
+#include "src/log/logImpl.h"
 
 namespace Pelmora::Service {
 
