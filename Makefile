@@ -2,7 +2,7 @@
 PREFIX ?= /usr/local
 FUZZ_SECONDS ?= 60
 
-.PHONY: all deps build test run asan tsan bench fuzz install format clean
+.PHONY: all deps build test run asan tsan analyze bench fuzz install format clean
 
 all: build
 
@@ -28,6 +28,11 @@ tsan: deps
 	cmake --preset tsan
 	cmake --build --preset tsan
 	setarch $$(uname -m) -R ctest --preset tsan
+
+# Clang's thread-safety analysis over the library; any finding fails the build.
+analyze: deps
+	cmake --preset analyze
+	cmake --build --preset analyze
 
 bench: deps
 	cmake --preset bench

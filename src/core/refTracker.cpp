@@ -72,8 +72,8 @@ private:
 
    const std::unordered_set<std::string> _classNames;
    System::NativeMutex _mutex;
-   std::unordered_map<std::string, Record> _records;  // by backtrace text
-   std::unordered_map<const Object*, const std::string*> _objects;  // to a key of _records
+   std::unordered_map<std::string, Record> _records PELMORA_GUARDED_BY(_mutex);  // by backtrace text
+   std::unordered_map<const Object*, const std::string*> _objects PELMORA_GUARDED_BY(_mutex);  // to a key of _records
 };
 
 std::atomic<RefTracker*> g_tracker{nullptr};

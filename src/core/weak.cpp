@@ -47,7 +47,7 @@ public:
 
 private:
    mutable System::NativeMutex _mutex;
-   ObjectImpl* _object;
+   ObjectImpl* _object PELMORA_GUARDED_BY(_mutex);
 };
 
 WeakLinkableImplPrivate::~WeakLinkableImplPrivate() {

@@ -10,23 +10,24 @@
 #include <atomic>
 
 #include "pelmora/exception/panic.h"
+#include "pelmora/object/threadAnnotations.h"
 
 namespace Pelmora::System {
 
-class NativeMutex {
+class PELMORA_CAPABILITY("mutex") NativeMutex {
 public:
    NativeMutex() = default;
    NativeMutex(const NativeMutex&) = delete;
    NativeMutex& operator=(const NativeMutex&) = delete;
    ~NativeMutex() { pthread_mutex_destroy(&_mutex); }
 
-   void Lock() {
+   void Lock() PELMORA_ACQUIRE() {
       int error = pthread_mutex_lock(&_mutex);
       PELMORA_VERIFY(0 == error);
       PELMORA_VERIFY(0 == _owner);
       _owner.store(pthread_self(), std::memory_order_relaxed);
    }
-   void Unlock() {
+   void Unlock() PELMORA_RELEASE() {
       PELMORA_VERIFY(IsLocked());
       _owner.store(0, std::memory_order_relaxed);
       int error = pthread_mutex_unlock(&_mutex);
@@ -37,7 +38,7 @@ public:
    // Waits on `condition`, which releases the mutex meanwhile, until woken or (with a
    // deadline on the condition's clock) until then. The caller holds the mutex and holds
    // it again on return. Returns the system's result: 0, ETIMEDOUT or an error.
-   int WaitOn(pthread_cond_t* condition, const timespec* deadline = nullptr) {
+   int WaitOn(pthread_cond_t* condition, const timespec* deadline = nullptr) PELMORA_REQUIRES(this) {
       PELMORA_VERIFY(IsLocked());
       _owner.store(0, std::memory_order_relaxed);
       int result = deadline ? pthread_cond_timedwait(condition, &_mutex, deadline)
@@ -53,10 +54,12 @@ private:
    std::atomic<pthread_t> _owner{0};
 };
 
-class NativeSynchronized {
+class PELMORA_SCOPED_CAPABILITY NativeSynchronized {
 public:
-   explicit NativeSynchronized(NativeMutex& mutex) : _mutex(mutex) { _mutex.Lock(); }
-   ~NativeSynchronized() { _mutex.Unlock(); }
+   explicit NativeSynchronized(NativeMutex& mutex) PELMORA_ACQUIRE(mutex) : _mutex(mutex) {
+      _mutex.Lock();
+   }
+   ~NativeSynchronized() PELMORA_RELEASE() { _mutex.Unlock(); }
    NativeSynchronized(const NativeSynchronized&) = delete;
    NativeSynchronized& operator=(const NativeSynchronized&) = delete;
 

@@ -51,7 +51,10 @@ public:
       LogInternal(GetDefaultLogger(), static_cast<Logger::LogLevel>(level), "%1", text);
    }
 
-   void LogMemoryBuffer(int level, const std::string& message, bool detach) override {
+   // Locks the manager only when the panic did not come from under its lock, which the
+   // static analysis cannot follow.
+   void LogMemoryBuffer(int level, const std::string& message, bool detach) override
+      PELMORA_NO_THREAD_SAFETY_ANALYSIS {
       Logger* logger = GetDefaultLogger();
       auto logLevel = static_cast<Logger::LogLevel>(level);
       if (!detach) {

@@ -80,13 +80,14 @@ private:
    // mutex is released only while the internal one is held, so no Signal can slip in
    // between, and taken back only after the internal one is released, so the two are
    // never taken in the opposite order.
-   class WaitScope {
+   class PELMORA_SCOPED_CAPABILITY WaitScope {
    public:
-      WaitScope(ConditionPosix& condition, Mutex* mutex) : _condition(condition), _mutex(mutex) {
+      WaitScope(ConditionPosix& condition, Mutex* mutex) PELMORA_ACQUIRE(condition._mutex)
+          : _condition(condition), _mutex(mutex) {
          _condition.EnterWait();
          _mutex->Unlock();
       }
-      ~WaitScope() {
+      ~WaitScope() PELMORA_RELEASE() {
          _condition.LeaveWait();
          _mutex->Lock();
       }
@@ -98,18 +99,18 @@ private:
       Mutex* _mutex;
    };
 
-   void EnterWait() {
+   void EnterWait() PELMORA_ACQUIRE(_mutex) {
       _mutex.Lock();
       _waitingThreads.fetch_add(1, std::memory_order_release);
    }
-   void LeaveWait() {
+   void LeaveWait() PELMORA_RELEASE(_mutex) {
       PELMORA_VERIFY(_waitingThreads > 0);
       PELMORA_VERIFY(_expectedWakeups < _waitingThreads);
       _waitingThreads.fetch_sub(1, std::memory_order_relaxed);
       _mutex.Unlock();
    }
 
-   bool ConsumeWakeup() {
+   bool ConsumeWakeup() PELMORA_REQUIRES(_mutex) {
       if (_expectedWakeups <= 0) return false;
       --_expectedWakeups;
       return true;
@@ -145,7 +146,7 @@ private:
    pthread_cond_t _condition;
    // 0 <= _expectedWakeups <= _waitingThreads, both changed under _mutex only.
    std::atomic<int64_t> _waitingThreads{0};
-   int64_t _expectedWakeups = 0;
+   int64_t _expectedWakeups PELMORA_GUARDED_BY(_mutex) = 0;
 };
 
 }  // namespace

@@ -27,14 +27,15 @@ void MultiSynchronized::AddLockable(LockableObject* lockable) {
    _lockables.push_back(lockable);
 }
 
-void MultiSynchronized::Lock() {
+// A set of locks known only at run time is beyond the static analysis.
+void MultiSynchronized::Lock() PELMORA_NO_THREAD_SAFETY_ANALYSIS {
    PELMORA_VERIFY(!_isLocked);
    SortByAddress(_lockables);
    for (LockableObject* lockable : _lockables) lockable->Lock();
    _isLocked = true;
 }
 
-void MultiSynchronized::Unlock() {
+void MultiSynchronized::Unlock() PELMORA_NO_THREAD_SAFETY_ANALYSIS {
    PELMORA_VERIFY(_isLocked);
    for (auto it = _lockables.rbegin(); it != _lockables.rend(); ++it) (*it)->Unlock();
    _lockables.clear();
@@ -50,21 +51,21 @@ void MultiReadWriteSynchronized::AddLockable(RWLockableObject* lockable) {
    _lockables.push_back(lockable);
 }
 
-void MultiReadWriteSynchronized::ReadLock() {
+void MultiReadWriteSynchronized::ReadLock() PELMORA_NO_THREAD_SAFETY_ANALYSIS {
    PELMORA_VERIFY(!_isLocked);
    SortByAddress(_lockables);
    for (RWLockableObject* lockable : _lockables) lockable->ReadLock();
    _isLocked = true;
 }
 
-void MultiReadWriteSynchronized::WriteLock() {
+void MultiReadWriteSynchronized::WriteLock() PELMORA_NO_THREAD_SAFETY_ANALYSIS {
    PELMORA_VERIFY(!_isLocked);
    SortByAddress(_lockables);
    for (RWLockableObject* lockable : _lockables) lockable->WriteLock();
    _isLocked = true;
 }
 
-void MultiReadWriteSynchronized::Unlock() {
+void MultiReadWriteSynchronized::Unlock() PELMORA_NO_THREAD_SAFETY_ANALYSIS {
    PELMORA_VERIFY(_isLocked);
    for (auto it = _lockables.rbegin(); it != _lockables.rend(); ++it) (*it)->Unlock();
    _lockables.clear();

@@ -11,11 +11,11 @@ namespace Pelmora::System {
 
 class MutexImpl final : public virtual Mutex, public ObjectImpl {
 public:
-   void Lock() override {
+   void Lock() PELMORA_ACQUIRE() override {
       PELMORA_VERIFY(!_mutex.IsLocked());
       _mutex.Lock();
    }
-   void Unlock() override {
+   void Unlock() PELMORA_RELEASE() override {
       PELMORA_VERIFY(_mutex.IsLocked());
       _mutex.Unlock();
    }

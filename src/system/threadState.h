@@ -79,7 +79,7 @@ public:
 
 private:
    NativeMutex _mutex;
-   std::map<long long, WeakRef<ThreadState>> _states;
+   std::map<long long, WeakRef<ThreadState>> _states PELMORA_GUARDED_BY(_mutex);
 };
 
 }  // namespace Pelmora::System

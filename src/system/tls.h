@@ -37,9 +37,9 @@ public:
 private:
    NativeMutex _mutex;
    // Head of the free list; a free slot of _keys holds the next free index.
-   uint32_t _firstFreeIndex = INVALID_INDEX;
-   std::vector<uint32_t> _keys;
-   uint32_t _version = 0;
+   uint32_t _firstFreeIndex PELMORA_GUARDED_BY(_mutex) = INVALID_INDEX;
+   std::vector<uint32_t> _keys PELMORA_GUARDED_BY(_mutex);
+   uint32_t _version PELMORA_GUARDED_BY(_mutex) = 0;
 };
 
 class TlsObjects {

@@ -18,7 +18,7 @@ public:
 };
 
 // Buffers writes to a target writer; pieces larger than the buffer go straight through.
-class BufferedWriter : public virtual Writer {};
+class PELMORA_EXPORT BufferedWriter : public virtual Writer {};
 
 // Collects writes in 1024-byte blocks, then reads them back. The first Read switches it
 // to read mode for good: a later Write throws InvalidStateException.

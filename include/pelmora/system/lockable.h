@@ -7,18 +7,19 @@
 
 #include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
+#include "pelmora/object/threadAnnotations.h"
 
 namespace Pelmora::System {
 
-class PELMORA_EXPORT LockableObject : public virtual Object {
+class PELMORA_EXPORT PELMORA_CAPABILITY("mutex") LockableObject : public virtual Object {
 public:
-   virtual void Lock() = 0;
-   virtual void Unlock() = 0;
+   virtual void Lock() PELMORA_ACQUIRE() = 0;
+   virtual void Unlock() PELMORA_RELEASE() = 0;
    // Whether the calling thread holds the lock; another thread holding it gives false.
    virtual bool IsLocked() const = 0;
 };
 
-class Mutex : public virtual LockableObject {};
+class PELMORA_EXPORT Mutex : public virtual LockableObject {};
 
 class PELMORA_EXPORT LockableObjectImpl : public virtual LockableObject, public ObjectImpl {
 public:
@@ -27,8 +28,8 @@ public:
    // Shares `mutex` (an object locked together with another).
    explicit LockableObjectImpl(Mutex* mutex);
 
-   void Lock() override;
-   void Unlock() override;
+   void Lock() PELMORA_ACQUIRE() override;
+   void Unlock() PELMORA_RELEASE() override;
    bool IsLocked() const override;
 
    Mutex* GetMutex() const { return _mutex.Get(); }
@@ -38,10 +39,12 @@ private:
 };
 
 // Locks `lockable` until the end of the scope.
-class PELMORA_EXPORT Synchronized {
+class PELMORA_EXPORT PELMORA_SCOPED_CAPABILITY Synchronized {
 public:
-   explicit Synchronized(LockableObject* lockable) : _lockable(lockable) { _lockable->Lock(); }
-   ~Synchronized() { _lockable->Unlock(); }
+   explicit Synchronized(LockableObject* lockable) PELMORA_ACQUIRE(lockable) : _lockable(lockable) {
+      _lockable->Lock();
+   }
+   ~Synchronized() PELMORA_RELEASE() { _lockable->Unlock(); }
    Synchronized(const Synchronized&) = delete;
    Synchronized& operator=(const Synchronized&) = delete;
 

@@ -7,10 +7,11 @@
 
 #include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
+#include "pelmora/object/threadAnnotations.h"
 
 namespace Pelmora::System {
 
-class PELMORA_EXPORT RWLockableObject : public virtual Object {
+class PELMORA_EXPORT PELMORA_CAPABILITY("rwlock") RWLockableObject : public virtual Object {
 public:
    enum LockMode {
       // Readers enter while no writer holds the lock; writers may starve.
@@ -21,11 +22,11 @@ public:
       LOCK_MODE_WRITER_PRIORITY_LEGACY = 2,
    };
 
-   virtual void ReadLock() = 0;
+   virtual void ReadLock() PELMORA_ACQUIRE_SHARED() = 0;
    // The calling thread must hold no read or write lock on it.
-   virtual void WriteLock() = 0;
+   virtual void WriteLock() PELMORA_ACQUIRE() = 0;
    // Releases one read hold or the write lock of the calling thread.
-   virtual void Unlock() = 0;
+   virtual void Unlock() PELMORA_RELEASE_GENERIC() = 0;
    // With exactly one read hold: waits until the caller is the only reader and returns
    // with the write lock. False at once when another upgrade is pending; the read hold
    // is then kept (waiting would deadlock both).
@@ -38,7 +39,7 @@ public:
    virtual bool IsUnlocked() const = 0;
 };
 
-class RWLock : public virtual RWLockableObject {};
+class PELMORA_EXPORT RWLock : public virtual RWLockableObject {};
 
 class PELMORA_EXPORT RWLockableObjectImpl : public virtual RWLockableObject, public ObjectImpl {
 public:
@@ -47,9 +48,9 @@ public:
    // Shares `lock`.
    explicit RWLockableObjectImpl(RWLock* lock);
 
-   void ReadLock() override;
-   void WriteLock() override;
-   void Unlock() override;
+   void ReadLock() PELMORA_ACQUIRE_SHARED() override;
+   void WriteLock() PELMORA_ACQUIRE() override;
+   void Unlock() PELMORA_RELEASE_GENERIC() override;
    bool UpgradeReadLock() override;
    void DowngradeWriteLock() override;
    bool IsReadLocked() const override;

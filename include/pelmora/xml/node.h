@@ -124,7 +124,7 @@ public:
 };
 
 // A CDATA section; its content is its text-node children, written unescaped.
-class CDataNode : public virtual Node {};
+class PELMORA_EXPORT CDataNode : public virtual Node {};
 
 class PELMORA_EXPORT CommentNode : public virtual Node {
 public:
