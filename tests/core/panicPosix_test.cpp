@@ -25,8 +25,8 @@ TEST(PanicDeathTest, EachPanicWritesItsFirstLineAndBacktrace) {
 TEST(PanicDeathTest, VerifyNamesTheExpandedExpressionAndTheRepositoryPath) {
    int* link = nullptr;
    EXPECT_DEATH(PELMORA_VERIFY(NULL != link),
-                "Panic: Assert Failed: \"__null != link\" @ tests/core/panic_test.cpp:[0-9]+\n");
-   EXPECT_DEATH(PELMORA_NOT_REACHED(), "Panic: Not Reached: @ tests/core/panic_test.cpp:[0-9]+\n");
+                "Panic: Assert Failed: \"__null != link\" @ tests/core/panicPosix_test.cpp:[0-9]+\n");
+   EXPECT_DEATH(PELMORA_NOT_REACHED(), "Panic: Not Reached: @ tests/core/panicPosix_test.cpp:[0-9]+\n");
 }
 
 TEST(PanicTest, AForkedChildWritesTheReportAndTheProcessDumpsCore) {
