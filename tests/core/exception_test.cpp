@@ -4,6 +4,7 @@
 #include <cstring>
 #include <memory>
 #include <thread>
+#include <typeinfo>
 
 #include "pelmora/exception.h"
 
@@ -28,6 +29,41 @@ TEST(ExceptionTest, ConstructorsBuildTheirMessages) {
    EXPECT_STREQ("Write failed : /var/log/a", full.what());
    EXPECT_EQ("/var/log/a", full.GetPath());
    EXPECT_EQ("second", full.GetSecondText());
+}
+
+// `catch (const Exception&)` is the documented way to catch whatever the library throws;
+// Throw must also keep the dynamic type.
+TEST(ExceptionTest, EveryClassIsCaughtAsException) {
+   const std::string s = "x";
+   const std::unique_ptr<Exception> all[] = {
+       std::make_unique<AlreadyExistsException>(), std::make_unique<AlreadyInitializedException>(),
+       std::make_unique<AuthdException>(s), std::make_unique<Base64FormatException>(),
+       std::make_unique<CanceledException>(), std::make_unique<DateTimeFormatException>(),
+       std::make_unique<FileFormatException>(s), std::make_unique<FileIOException>(s, s),
+       std::make_unique<FileIOAlreadyExistsException>(s, s),
+       std::make_unique<FileIOLockFailedException>(s, s),
+       std::make_unique<FileIONoSpaceException>(s, s),
+       std::make_unique<FileIONotFoundException>(s, s),
+       std::make_unique<FileIOPermissionDeniedException>(s, s),
+       std::make_unique<FullException>(s), std::make_unique<InternalErrorException>(s),
+       std::make_unique<InvalidFormatStringException>(s), std::make_unique<NotFoundException>(s),
+       std::make_unique<NotInProgressException>(s), std::make_unique<TicketExpiredException>(s),
+       std::make_unique<TimeoutException>(s), std::make_unique<IOException>(s),
+       std::make_unique<InProgressException>(), std::make_unique<InvalidArgumentException>(),
+       std::make_unique<InvalidStateException>(), std::make_unique<NotInitializedException>(s),
+       std::make_unique<NotSupportedException>(), std::make_unique<NumberFormatException>(),
+       std::make_unique<NumberRangeException>(), std::make_unique<ResourceInUseException>(s),
+       std::make_unique<SystemException>(EIO), std::make_unique<TypeMismatchException>(s, s),
+       std::make_unique<WrongThreadException>()};
+   for (const auto& exception : all) {
+      bool caught = false;
+      try {
+         exception->Throw();
+      } catch (const Exception& e) {
+         caught = typeid(e) == typeid(*exception);
+      }
+      EXPECT_TRUE(caught) << typeid(*exception).name();
+   }
 }
 
 TEST(ExceptionTest, CloneAndThrowKeepTheDynamicTypeAcrossThreads) {

@@ -2,6 +2,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <memory>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -118,6 +119,21 @@ TEST_F(ParserTest, BadInputRaisesXMLParseExceptionAndTheParserServesOn) {
            AllOf(StartsWith("4 Unexpected exception parsing XML document: "),
                  HasSubstr("(Invalid argument : Elements cannot have document or PI children.)"))));
    EXPECT_EQ("<a>ok</a>", Reparse(parser.Get(), "<a>ok</a>"));
+}
+
+// Callers catch the library's failures as Exception; a parse error must be one of them.
+TEST_F(ParserTest, ParseFailuresAreCaughtAsException) {
+   Ref<XMLParser> parser = NewParser();
+   std::string caught;
+   try {
+      Parse(parser.Get(), "<a>", false);
+   } catch (const Exception& e) {
+      caught = e.GetMessage();
+      std::unique_ptr<Exception> kept(e.Clone());
+      EXPECT_THROW(kept->Throw(), XMLParseException);
+   }
+   EXPECT_EQ("no element found", caught);
+   EXPECT_THROW(ParsingAbortedException().Throw(), Exception);
 }
 
 TEST_F(ParserTest, RestrictedParsesRefuseEntityDeclarationsAndBillionLaughs) {

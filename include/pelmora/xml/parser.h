@@ -15,12 +15,11 @@
 namespace Pelmora::Xml {
 
 // Malformed input, a stopped parse or a refused entity: expat's text and the line.
-class PELMORA_EXPORT XMLParseException : public Throwable {
+class PELMORA_EXPORT XMLParseException : public Exception {
 public:
-   XMLParseException(const std::string& message, int line) : Throwable(message), _line(line) {}
+   XMLParseException(const std::string& message, int line) : Exception(message), _line(line) {}
    int GetLineNumber() const { return _line; }
-   virtual XMLParseException* Clone() const { return new XMLParseException(*this); }
-   [[noreturn]] virtual void Throw() const { throw XMLParseException(*this); }
+   PELMORA_EXCEPTION_CLONE(XMLParseException)
 
 private:
    int _line;
