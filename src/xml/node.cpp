@@ -2,7 +2,9 @@
 // and the factories.
 
 #include <algorithm>
+#include <array>
 #include <cstddef>
+#include <string_view>
 #include <vector>
 
 #include "pelmora/exception/exceptions.h"
@@ -10,6 +12,51 @@
 #include "src/xml/nodeImpl.h"
 
 namespace Pelmora::Xml {
+
+namespace {
+
+// Why `name` could not be written back as an XML name, or null when it can. ASCII follows
+// XML's rule; bytes of 128 and above pass, so UTF-8 names need no decoding.
+const char* NameProblem(std::string_view name) {
+   static constexpr auto kKind = [] {
+      std::array<unsigned char, 256> kind{};  // 0: refused, 1: inside a name, 2: anywhere
+      for (int c = 'a'; c <= 'z'; ++c) kind[c] = kind[c - 'a' + 'A'] = 2;
+      for (int c = 0x80; c < 0x100; ++c) kind[c] = 2;
+      kind['_'] = kind[':'] = 2;
+      for (int c = '0'; c <= '9'; ++c) kind[c] = 1;
+      kind['-'] = kind['.'] = 1;
+      return kind;
+   }();
+   if (name.empty()) return "is empty";
+   for (unsigned char c : name) {
+      if (kKind[c] != 0) continue;
+      if (c == ' ' || c == '\t' || c == '\n' || c == '\r') return "holds a blank";
+      if (c == '"' || c == '\'') return "holds a quote";
+      if (c == '=') return "holds \"=\"";
+      return "holds a character that names may not hold";
+   }
+   unsigned char first = static_cast<unsigned char>(name[0]);
+   if (kKind[first] != 2) return first >= '0' && first <= '9' ? "starts with a digit"
+                                                              : "starts with \"-\" or \".\"";
+   return nullptr;
+}
+
+void VerifyElementName(const std::string& prefix, const std::string& tag) {
+   if (prefix.empty()) {
+      VerifyName("element name", tag);
+   } else {
+      VerifyName("element name", prefix + ":" + tag);
+   }
+}
+
+}  // namespace
+
+void VerifyName(const char* what, std::string_view name) {
+   if (const char* problem = NameProblem(name)) {
+      throw InvalidArgumentException(std::string(what) + " \"" + std::string(name) + "\" " +
+                                     problem);
+   }
+}
 
 // ---- NodeImpl ----
 
@@ -210,6 +257,16 @@ ElementNodeImpl::ElementNodeImpl(const std::string& prefix, const std::string& t
                                  int column)
     : _prefix(prefix), _tag(tag), _line(line), _column(column) {}
 
+void ElementNodeImpl::SetPrefix(const std::string& prefix) {
+   VerifyElementName(prefix, _tag);
+   _prefix = prefix;
+}
+
+void ElementNodeImpl::SetTag(const std::string& tag) {
+   VerifyElementName(_prefix, tag);
+   _tag = tag;
+}
+
 std::string ElementNodeImpl::GetName() const {
    if (_prefix.empty()) return _tag;
    std::string name;
@@ -270,6 +327,8 @@ void ElementNodeImpl::DefineAttribute(const std::string& name, const std::string
    if (found != _attributes.end() && found->first == name) {
       found->second = value;
    } else {
+      // Checked once here: a name in the list was either checked or came from the parser.
+      VerifyName("attribute name", name);
       _attributes.emplace(found, name, value);
    }
 }
@@ -344,20 +403,22 @@ void CreateDocument(Ref<Document>& out) {
 }
 
 void CreateElementNode(const std::string& qualifiedName, Ref<ElementNode>& out) {
-   out = new ElementNodeImpl(qualifiedName, 0, 0);
+   CreateElementNode(qualifiedName, 0, 0, out);
 }
 
 void CreateElementNode(const std::string& qualifiedName, int line, int column,
                        Ref<ElementNode>& out) {
+   VerifyName("element name", qualifiedName);
    out = new ElementNodeImpl(qualifiedName, line, column);
 }
 
 void CreateElementNode(const std::string& prefix, const std::string& tag, Ref<ElementNode>& out) {
-   out = new ElementNodeImpl(prefix, tag, 0, 0);
+   CreateElementNode(prefix, tag, 0, 0, out);
 }
 
 void CreateElementNode(const std::string& prefix, const std::string& tag, int line, int column,
                        Ref<ElementNode>& out) {
+   VerifyElementName(prefix, tag);
    out = new ElementNodeImpl(prefix, tag, line, column);
 }
 

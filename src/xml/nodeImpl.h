@@ -6,6 +6,7 @@
 #include <cstddef>
 #include <map>
 #include <string>
+#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -14,6 +15,10 @@
 namespace Pelmora::Xml {
 
 class NodeArena;
+
+// Throws InvalidArgumentException, naming `what`, `name` and the fault, unless `name` can be
+// written as an XML name.
+void VerifyName(const char* what, std::string_view name);
 
 class NodeImpl : public virtual Node, public ObjectImpl {
 public:
@@ -117,15 +122,16 @@ public:
    using NodeImpl::WriteNode;
 
    // Splits the qualified name at the first ":"; no ":", or only a leading one, means no
-   // prefix.
+   // prefix. The constructors take names as given (the parser's are known good); the
+   // factories and setters check them.
    ElementNodeImpl(const std::string& qualifiedName, int line, int column);
    ElementNodeImpl(const std::string& prefix, const std::string& tag, int line, int column);
 
    int GetNodeType() const override { return kElementNode; }
    const std::string& GetPrefix() const override { return _prefix; }
-   void SetPrefix(const std::string& prefix) override { _prefix = prefix; }
+   void SetPrefix(const std::string& prefix) override;
    const std::string& GetTag() const override { return _tag; }
-   void SetTag(const std::string& tag) override { _tag = tag; }
+   void SetTag(const std::string& tag) override;
    std::string GetName() const override;
    void GetQName(QName& name) const override;
    int GetLineNumber() const override { return _line; }

@@ -166,7 +166,19 @@ void TextNodeImpl::WriteNode(Writer* writer, int) const {
    WriteText(writer, _text);
 }
 
+// Content that would end the construct early is refused before anything of the node is
+// written; checking here costs nothing for the elements and text that make up most trees.
+
 void CDataNodeImpl::WriteNode(Writer* writer, int) const {
+   // The end marker may also be split across text children.
+   int brackets = 0;
+   for (const NodeImpl* child = FirstChildImpl(); child; child = child->NextSiblingImpl()) {
+      for (char c : static_cast<const TextNodeImpl*>(child)->GetText()) {
+         if (c == '>' && brackets >= 2)
+            throw InvalidArgumentException("CDATA section holds \"]]>\"");
+         brackets = c == ']' ? brackets + 1 : 0;
+      }
+   }
    writer->Write("<![CDATA[", 9);
    for (const NodeImpl* child = FirstChildImpl(); child; child = child->NextSiblingImpl())
       WriteString(writer, static_cast<const TextNodeImpl*>(child)->GetText());
@@ -174,6 +186,10 @@ void CDataNodeImpl::WriteNode(Writer* writer, int) const {
 }
 
 void CommentNodeImpl::WriteNode(Writer* writer, int indent) const {
+   if (_comment.find("--") != std::string::npos)
+      throw InvalidArgumentException("comment holds \"--\"");
+   if (!_comment.empty() && _comment.back() == '-')
+      throw InvalidArgumentException("comment ends in \"-\"");
    WriteIndent(writer, indent);
    writer->Write("<!--", 4);
    WriteString(writer, _comment);
@@ -181,6 +197,14 @@ void CommentNodeImpl::WriteNode(Writer* writer, int indent) const {
 }
 
 void ProcessingInstructionNodeImpl::WriteNode(Writer* writer, int) const {
+   VerifyName("processing-instruction target", _target);
+   if (_target.size() == 3 && (_target[0] | 0x20) == 'x' && (_target[1] | 0x20) == 'm' &&
+       (_target[2] | 0x20) == 'l') {
+      throw InvalidArgumentException("processing-instruction target \"" + _target +
+                                     "\" is reserved");
+   }
+   if (_data.find("?>") != std::string::npos)
+      throw InvalidArgumentException("processing-instruction data holds \"?>\"");
    writer->Write("<?", 2);
    WriteString(writer, _target);
    writer->Write(" ", 1);

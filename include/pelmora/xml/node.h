@@ -58,7 +58,11 @@ public:
    virtual void RemoveChild(Node* node) = 0;
    // One of NodeType.
    virtual int GetNodeType() const = 0;
-   // Compact form: no indentation and no added line feeds (comments end in one).
+   // Compact form: no indentation and no added line feeds (comments end in one). A node
+   // that XML cannot represent raises InvalidArgumentException before any of it is written
+   // (what came before it in the tree may be): a comment holding "--" or ending in "-",
+   // CDATA holding "]]>", a processing-instruction target that is not a name or is "xml" in
+   // any case, processing-instruction data holding "?>".
    virtual void WriteNode(Writer* writer) const = 0;
    // Two spaces per level; elements whose first child is an element or comment are laid
    // out one child per line.
@@ -74,6 +78,9 @@ public:
 
 // An element: an optional prefix, a local name (tag), attributes and the position in the
 // source text (0 when built by code). Children: elements, text, CDATA and comments.
+// Names are checked when set: an element or attribute name that is not an XML name (empty,
+// first a digit, "-" or ".", or holding a blank, quote, "=" or other markup; bytes of 128
+// and above pass) raises InvalidArgumentException and changes nothing.
 class PELMORA_EXPORT ElementNode : public virtual Node {
 public:
    virtual const std::string& GetPrefix() const = 0;
