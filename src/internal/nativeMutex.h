@@ -21,7 +21,13 @@ public:
    NativeMutex& operator=(const NativeMutex&) = delete;
    ~NativeMutex() { pthread_mutex_destroy(&_mutex); }
 
+   // The owner check comes first: relocking would otherwise hang in pthread_mutex_lock.
    void Lock() PELMORA_ACQUIRE() {
+      PELMORA_VERIFY(!IsLocked());
+      LockNotHeld();
+   }
+   // Lock for a caller that has checked already that it does not hold the mutex.
+   void LockNotHeld() PELMORA_ACQUIRE() {
       int error = pthread_mutex_lock(&_mutex);
       PELMORA_VERIFY(0 == error);
       PELMORA_VERIFY(0 == _owner);

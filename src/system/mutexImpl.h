@@ -13,7 +13,7 @@ class MutexImpl final : public virtual Mutex, public ObjectImpl {
 public:
    void Lock() PELMORA_ACQUIRE() override {
       PELMORA_VERIFY(!_mutex.IsLocked());
-      _mutex.Lock();
+      _mutex.LockNotHeld();
    }
    void Unlock() PELMORA_RELEASE() override {
       PELMORA_VERIFY(_mutex.IsLocked());

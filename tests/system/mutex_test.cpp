@@ -1,8 +1,11 @@
-#include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <thread>
 
+#include <gtest/gtest.h>
+
 #include "pelmora/system.h"
+#include "src/internal/nativeMutex.h"
 #include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
@@ -58,6 +61,22 @@ TEST(MutexDeathTest, MisusePanics) {
        },
        "Assert Failed: \"_mutex.IsLocked\\(\\)" + where);
    EXPECT_DEATH(mutex->Unlock(), "Assert Failed: \"_mutex.IsLocked\\(\\)" + where);
+}
+
+// The mutex inside the library's other objects: relocking by its owner panics instead of
+// hanging (the alarm turns a hang into a failure).
+TEST(MutexDeathTest, NativeMutexRelockByItsOwnerPanics) {
+   NativeMutex mutex;
+   EXPECT_DEATH(
+       {
+          alarm(5);
+          mutex.Lock();
+          mutex.Lock();
+       },
+       "Assert Failed: \"!IsLocked\\(\\)\" @ src/[a-z]+/nativeMutex.h:[0-9]+\n");
+   mutex.Lock();
+   EXPECT_TRUE(mutex.IsLocked());
+   mutex.Unlock();
 }
 
 class Mailbox : public WaitableObjectImpl {
