@@ -10,7 +10,10 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <cxxabi.h>
+
 #include <climits>
+#include <exception>
 #include <memory>
 
 #include "pelmora/exception/exceptions.h"
@@ -56,12 +59,27 @@ void CleanupThisThread(void* value) {
    thread->DecRef();
 }
 
+// An exception leaving a thread's function would reach std::terminate with no report.
+void RunToTheEnd(const ThreadFunction& function) {
+   try {
+      function();
+   } catch (abi::__forced_unwind&) {
+      throw;  // cancellation unwinds through here and must go on
+   } catch (const Throwable& e) {
+      PanicExit(e);
+   } catch (const std::exception& e) {
+      Panic("Exception escaped a thread: %s", e.what());
+   } catch (...) {
+      Panic("Exception of unknown type escaped a thread");
+   }
+}
+
 void* StartRoutine(void* argument) {
    std::unique_ptr<StartRecord> record(static_cast<StartRecord*>(argument));
    setitimer(ITIMER_PROF, &record->profilingTimer, nullptr);
    StoreThisThread(record->thread.Get());
    if (!record->function) PanicVerify("!IsNull()", __FILE__, __LINE__);
-   record->function();
+   RunToTheEnd(record->function);
    record.reset();
    return nullptr;
 }

@@ -6,6 +6,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <stdexcept>
 #include <thread>
 
 #include "pelmora/exception.h"
@@ -167,6 +168,27 @@ TEST_F(ThreadTest, SleepIsNotCutShortBySignals) {
 }
 
 using ThreadDeathTest = ThreadTest;
+
+// Outside the anonymous namespace: backtraces resolve exported symbols only.
+}  // namespace
+[[gnu::noinline]] void ThrowFromAStartedThread() { throw InvalidStateException("lost in a thread"); }
+namespace {
+
+// An exception leaving a started thread's function panics with its text and the backtrace
+// of where it was thrown, instead of ending in std::terminate with no report.
+TEST_F(ThreadDeathTest, AnExceptionEscapingAStartedThreadPanicsWithItsTextAndBacktrace) {
+   auto startAndWait = [&](ThreadFunction function) {
+      Ref<Thread> started;
+      control->StartThread(function, 256, started);
+      GetThisThread()->Sleep(10000000);
+   };
+   EXPECT_DEATH(startAndWait([] { ThrowFromAStartedThread(); }),
+                "\n\nPanic: lost in a thread\nBacktrace:\n(.*\n)*.*ThrowFromAStartedThread");
+   EXPECT_DEATH(startAndWait([] { throw std::runtime_error("plain"); }),
+                "\n\nPanic: Exception escaped a thread: plain\n");
+   EXPECT_DEATH(startAndWait([] { throw 7; }),
+                "\n\nPanic: Exception of unknown type escaped a thread\n");
+}
 
 TEST_F(ThreadDeathTest, NegativeSleepAndNullFunctionsPanic) {
    const std::string where = "\" @ src/system/threadPosix.cpp:[0-9]+\n";
