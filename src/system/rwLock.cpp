@@ -160,10 +160,14 @@ public:
       ThreadLocks& locks = ThisThreadLocks();
       {
          MutexLock lock(*_mutex);
-         if (_status != 0) PELMORA_VERIFY(locks.find(this) == locks.end());
-         while (_status != 0) {
-            if (_mode == LOCK_MODE_WRITER_PRIORITY) _writerWaiting = 1;
-            _writeCondition->Wait(_mutex.Get());
+         if (_status != 0) {
+            PELMORA_VERIFY(locks.find(this) == locks.end());
+            ++_waitingWriters;
+            while (_status != 0) {
+               if (_mode == LOCK_MODE_WRITER_PRIORITY) _writerWaiting = 1;
+               _writeCondition->Wait(_mutex.Get());
+            }
+            --_waitingWriters;
          }
          // The writer-waiting flag stays set until this writer unlocks or downgrades.
          _status = -1;
@@ -209,10 +213,12 @@ public:
          // Two upgraders would each wait for the other's read hold to go.
          if (_upgradePending) return false;
          _upgradePending = 1;
+         ++_waitingWriters;
          while (_status != 1) {
             if (_mode == LOCK_MODE_WRITER_PRIORITY) _writerWaiting = 1;
             _writeCondition->Wait(_mutex.Get());
          }
+         --_waitingWriters;
          _upgradePending = 0;
          _status = -1;
       }
@@ -249,6 +255,11 @@ public:
       return locks.find(this) == locks.end();
    }
 
+   int CountWaitingWriters() const {
+      MutexLock lock(*_mutex);
+      return _waitingWriters;
+   }
+
 private:
    // 1: a waiting writer or upgrader holds back new readers.
    const int _mode;
@@ -256,6 +267,8 @@ private:
    int32_t _status = 0;
    uint8_t _writerWaiting = 0;
    uint8_t _upgradePending = 0;
+   // Writers and upgraders inside WriteLock or UpgradeReadLock that had to wait.
+   int32_t _waitingWriters = 0;
    Ref<Condition> _readCondition;
    Ref<Condition> _writeCondition;
    // The factory's mutex type, held as such so that the short state changes call it directly.
@@ -266,6 +279,12 @@ private:
 
 void CreateRWLockImpl(int mode, Ref<RWLock>& out) {
    out = new RWLockImpl(mode);
+}
+
+int CountWaitingWriters(RWLock* lock) {
+   auto* impl = dynamic_cast<RWLockImpl*>(lock);
+   PELMORA_VERIFY(impl != NULL);
+   return impl->CountWaitingWriters();
 }
 
 }  // namespace Pelmora::System

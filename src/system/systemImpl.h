@@ -13,5 +13,8 @@ void CreateConditionPosix(Ref<Condition>& out);
 void CreateThreadControlPosix(Ref<ThreadControl>& out);
 // `mode` as RWLockableObject::LockMode.
 void CreateRWLockImpl(int mode, Ref<RWLock>& out);
+// How many threads wait to write-lock or upgrade `lock`, one of the factory's; what a
+// test waits on instead of guessing how long a thread takes to block.
+int CountWaitingWriters(RWLock* lock);
 
 }  // namespace Pelmora::System

@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "pelmora/system.h"
+#include "src/system/systemImpl.h"
 #include "tests/support/watchdog.h"
 
 namespace Pelmora::System {
@@ -19,6 +20,12 @@ Ref<RWLock> NewRWLock(int mode = RWLockableObject::LOCK_MODE_DEFAULT) {
 
 void SleepMillis(int milliseconds) {
    std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds));
+}
+
+// Returns once a writer waits for `lock`: a sleep would only make that likely.
+void AwaitWaitingWriter(RWLock* lock) {
+   Pelmora::Testing::Watchdog watchdog("a writer to wait for the lock");
+   while (CountWaitingWriters(lock) == 0) std::this_thread::yield();
 }
 
 // Each thread sees only its own holds (counts are tested below); readers share.
@@ -62,7 +69,7 @@ TEST(RWLockTest, UpgradeAndDowngradeMoveBetweenReadAndWrite) {
       written = true;
       lock->Unlock();
    });
-   SleepMillis(2);
+   AwaitWaitingWriter(object->GetRWLock());
    EXPECT_FALSE(written);
    lock->Unlock();
    Pelmora::Testing::Join(writer, "writer to finish");
@@ -108,16 +115,14 @@ TEST_P(RWLockModeTest, AReaderRelocksWhileAWriterWaits) {
       char none = 0;
       first.compare_exchange_strong(none, who);
    };
-   std::atomic<bool> writerStarting{false}, readerStarting{false};
+   std::atomic<bool> readerStarting{false};
    lock->ReadLock();
    std::thread writer([&] {
-      writerStarting = true;
       lock->WriteLock();
       record('W');
       lock->Unlock();
    });
-   while (!writerStarting) std::this_thread::yield();
-   SleepMillis(3);  // the writer is waiting now
+   AwaitWaitingWriter(lock.Get());
    std::thread reader([&] {
       readerStarting = true;
       lock->ReadLock();
@@ -126,7 +131,7 @@ TEST_P(RWLockModeTest, AReaderRelocksWhileAWriterWaits) {
    });
    if (writerPriority) {
       while (!readerStarting) std::this_thread::yield();
-      SleepMillis(3);
+      SleepMillis(3);              // time for the reader to get in if it wrongly could
       EXPECT_EQ(0, first.load());  // held back behind the writer
    } else {
       while (first == 0) std::this_thread::yield();
