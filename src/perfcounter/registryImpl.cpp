@@ -23,7 +23,8 @@ public:
    explicit RegistryItemImpl(GroupImpl* group) : _group(group) {}
 
    void Unregister() override {
-      RegistryImpl* registry = _group->GetRegistry();
+      // Held, not just read: a private registry may lose its last reference meanwhile.
+      Ref<RegistryImpl> registry = _group->HoldRegistry();
       if (registry) registry->UnregisterGroup(_group.Get());
    }
    bool IsRegistered() const override { return _group->GetRegistry() != nullptr; }
@@ -59,6 +60,16 @@ void VisitCounters(CounterNode* node, const std::function<void(CounterNode*)>& v
 }
 
 }  // namespace
+
+GroupImpl::GroupImpl(RegistryImpl* registry, uint64_t sequence, RefVector<Metadata> metadata,
+                     GroupPublisher* publisher)
+   : _registry(registry), _registryLink(registry), _sequence(sequence),
+     _metadata(std::move(metadata)), _publisher(publisher) {}
+
+Ref<RegistryImpl> GroupImpl::HoldRegistry() const {
+   if (!GetRegistry()) return Ref<RegistryImpl>();
+   return _registryLink.Promote();
+}
 
 void GroupImpl::CollectValues(std::vector<Value>& values) {
    values.clear();

@@ -15,6 +15,7 @@
 #include <string>
 #include <vector>
 
+#include "pelmora/object/weak.h"
 #include "pelmora/perfCounter/registry.h"
 #include "src/internal/nativeMutex.h"
 
@@ -27,12 +28,14 @@ class QueryImpl;
 class GroupImpl : public ObjectImpl {
 public:
    GroupImpl(RegistryImpl* registry, uint64_t sequence, RefVector<Metadata> metadata,
-             GroupPublisher* publisher)
-      : _registry(registry), _sequence(sequence), _metadata(std::move(metadata)),
-        _publisher(publisher) {}
+             GroupPublisher* publisher);
 
-   // Null once unregistered or once the registry is gone.
+   // Null once unregistered or once the registry is gone; for comparing, not for calling:
+   // the registry may be destroyed at any time by another thread.
    RegistryImpl* GetRegistry() const { return _registry.load(std::memory_order_acquire); }
+   // A counted reference to the registry while the group is registered and the registry
+   // lives; null otherwise. What a caller holds while it calls the registry.
+   Ref<RegistryImpl> HoldRegistry() const;
    void Detach() { _registry.store(nullptr, std::memory_order_release); }
    uint64_t GetSequence() const { return _sequence; }
    RefVector<Metadata>& GetMetadata() { return _metadata; }
@@ -42,6 +45,7 @@ public:
 
 private:
    std::atomic<RegistryImpl*> _registry;
+   const WeakRef<RegistryImpl> _registryLink;
    const uint64_t _sequence;
    RefVector<Metadata> _metadata;
    const Ref<GroupPublisher> _publisher;
@@ -96,7 +100,9 @@ private:
    const bool _held;
 };
 
-class RegistryImpl : public virtual Registry, public System::RWLockableObjectImpl {
+// Weakly linkable so that a registration can hold it while calling it (HoldRegistry).
+class RegistryImpl : public virtual Registry,
+                     public WeakLinkableImpl<System::RWLockableObjectImpl> {
 public:
    RegistryImpl();
    ~RegistryImpl() override;

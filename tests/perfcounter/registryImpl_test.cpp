@@ -1,5 +1,9 @@
+#include <chrono>
+#include <thread>
+
 #include "tests/perfcounter/fixture.h"
 #include "tests/support/logCapture.h"
+#include "tests/support/watchdog.h"
 
 namespace Pelmora::PerfCounter::Testing {
 namespace {
@@ -96,6 +100,26 @@ TEST(RegistryDestructionTest, LeftoverQueriesAndCountersAreReported) {
                ElementsAre("8 Destruction: Queries are still registered -- 1 queries.",
                            "8 Destruction: Counters are still registered -- 2 counters."));
    query.Reset();  // detached: dropping it touches no registry
+}
+
+// Unregistering holds the registry it calls: when another thread drops the last other
+// reference meanwhile, the registry lives until the unregistration is done.
+TEST(RegistryDestructionTest, UnregisteringHoldsAPrivateRegistryUntilDone) {
+   Pelmora::TestSupport::ScopedLogCapture log;
+   Ref<Registry> registry;
+   CreateCounterRegistry(registry);
+   Ref<RegistryItem> item = AddGroup(registry.Get(), {"/going/a"});
+   registry->WriteLock();  // the unregistration waits here, with the registry in hand
+   std::thread unregistering([&] { item->Unregister(); });
+   const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+   while (registry->GetRefCount() < 2 && std::chrono::steady_clock::now() < deadline)
+      std::this_thread::yield();
+   EXPECT_EQ(2, registry->GetRefCount()) << "the unregistration does not hold the registry";
+   registry->Unlock();
+   registry.Reset();
+   Pelmora::Testing::Join(unregistering, "the unregistration");
+   EXPECT_FALSE(item->IsRegistered());
+   EXPECT_THAT(log.Lines(), testing::IsEmpty());  // it was empty when it went
 }
 
 using RegistryDeathTest = RegistryFixture;
