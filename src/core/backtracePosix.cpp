@@ -79,14 +79,24 @@ private:
 }  // namespace
 
 __attribute__((noinline)) void CaptureBacktrace(int skipFrames, Ref<Backtrace>& out) {
-   void* frames[kMaxBacktraceFrames + 8];
-   int wanted = kMaxBacktraceFrames + 1 + (skipFrames > 0 ? skipFrames : 0);
+   void* frames[kMaxBacktraceFrames + 10];
+   int wanted = kMaxBacktraceFrames + 2 + (skipFrames > 0 ? skipFrames : 0);
    if (wanted > static_cast<int>(sizeof(frames) / sizeof(frames[0]))) {
       wanted = sizeof(frames) / sizeof(frames[0]);
    }
    int count = backtrace(frames, wanted);
-   // Leave out this function and the frames the caller asked to skip.
-   int first = 1 + (skipFrames > 0 ? skipFrames : 0);
+   // Leave out this function, and the sanitizers' interceptor of backtrace() where there
+   // is one: the caller's frame is the one holding this function's return address. Then
+   // the frames the caller asked to skip.
+   int caller = 1;
+   void* const returnAddress = __builtin_return_address(0);
+   for (int i = 0; i < count && i < 4; ++i) {
+      if (frames[i] == returnAddress) {
+         caller = i;
+         break;
+      }
+   }
+   int first = caller + (skipFrames > 0 ? skipFrames : 0);
    if (first > count) first = count;
    int kept = count - first;
    if (kept > kMaxBacktraceFrames) kept = kMaxBacktraceFrames;
