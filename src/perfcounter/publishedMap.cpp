@@ -83,6 +83,15 @@ public:
       return static_cast<bool>(_item);
    }
 
+   // Unpublish for callers that may race another unpublishing: whoever comes second
+   // finds nothing to do.
+   void UnpublishIfPublished() {
+      System::NativeSynchronized lock(_publishMutex);
+      if (!_item) return;
+      _item->Unregister();
+      _item.Reset();
+   }
+
 private:
    Registry* const _registry;
    const std::string _key;
@@ -112,30 +121,63 @@ public:
 
    ~PublishedAccumulatorMapImpl() override { Clear(); }
 
+   // New keys are entered and merged under the map's mutex but published after it is
+   // released: publishing waits for the registry's write lock, which a long scrape holds
+   // back, and every thread leaving a statistics scope would wait with it.
    void Merge(LwStatsBuilder& builder) override {
       std::vector<std::pair<Ref<LwAccumulator>, std::string>> entries;
       builder.GetEntries(entries);
-      System::NativeSynchronized lock(_mutex);
-      for (auto itr2 = entries.begin(); itr2 != entries.end(); ++itr2) {
-         const std::string& key = itr2->second;
-         auto itr = _accumulators.find(key);
-         if (itr == _accumulators.end()) {
-            Ref<PublishedAccumulatorImpl> created = Create(key, itr2->first.Get());
-            try {
-               created->Publish();
-            } catch (const std::exception& e) {
-               Internal::LogText(Internal::kLogError,
-                                 MessageFormatter::ASPrint("While publishing ctr %1: %2", key, e.what()));
+      std::vector<Ref<PublishedAccumulatorImpl>> created;
+      std::vector<std::string> clashes;
+      bool limitReached = false;
+      int limit;
+      {
+         System::NativeSynchronized lock(_mutex);
+         limit = _keyLimit;
+         for (auto& [accumulator, key] : entries) {
+            auto itr = _accumulators.find(key);
+            if (itr == _accumulators.end()) {
+               if (static_cast<int>(_accumulators.size()) >= _keyLimit) {
+                  ++_refusedCount;
+                  limitReached = limitReached || !_limitLogged;
+                  _limitLogged = true;
+                  continue;
+               }
+               _limitLogged = false;
+               created.push_back(Create(key, accumulator.Get()));
+               itr = _accumulators.insert(created.back()).first;
+            } else if ((*itr)->GetType() != accumulator->GetType()) {
+               // Two builders disagree on what the key counts: neither may end the process.
+               ++_refusedCount;
+               clashes.push_back(key);
                continue;
             }
-            itr = _accumulators.insert(created).first;
+            try {
+               (*itr)->Merge(accumulator.Get());
+            } catch (const std::exception& e) {
+               Internal::LogText(Internal::kLogError,
+                                 MessageFormatter::ASPrint("While merging %1: %2", key, e.what()));
+            }
          }
-         PELMORA_VERIFY((*itr)->GetType() == itr2->first->GetType());
+      }
+      for (const std::string& key : clashes) {
+         Internal::LogText(Internal::kLogError,
+                           MessageFormatter::ASPrint(
+                               "Refused to merge %1: published as another kind of accumulator", key));
+      }
+      if (limitReached) {
+         Internal::LogText(Internal::kLogWarning,
+                           MessageFormatter::ASPrint(
+                               "Published statistics reached their limit of %1 keys; new keys are refused",
+                               limit));
+      }
+      for (const Ref<PublishedAccumulatorImpl>& accumulator : created) {
          try {
-            (*itr)->Merge(itr2->first.Get());
+            Publish(accumulator);
          } catch (const std::exception& e) {
             Internal::LogText(Internal::kLogError,
-                              MessageFormatter::ASPrint("While merging %1: %2", key, e.what()));
+                              MessageFormatter::ASPrint("While publishing ctr %1: %2",
+                                                        accumulator->GetKey(), e.what()));
          }
       }
    }
@@ -143,12 +185,35 @@ public:
    void Add(const std::string& key, LwAccumulator* accumulator) override {
       if (!accumulator) throw InvalidArgumentException();
       if (!ValidateStatsScope(key)) throw InvalidArgumentException(key);
+      Ref<PublishedAccumulatorImpl> created;
+      {
+         System::NativeSynchronized lock(_mutex);
+         if (_accumulators.find(key) != _accumulators.end()) throw AlreadyExistsException(key);
+         if (static_cast<int>(_accumulators.size()) >= _keyLimit) {
+            throw FullException(MessageFormatter::ASPrint(
+                "Published statistics are at their limit of %1 keys", _keyLimit));
+         }
+         created = Create(key, accumulator);
+         created->Merge(accumulator);
+         _accumulators.insert(created);
+      }
+      Publish(created);
+   }
+
+   void SetKeyLimit(int limit) override {
+      if (limit < 0) throw InvalidArgumentException(std::to_string(limit));
       System::NativeSynchronized lock(_mutex);
-      if (_accumulators.find(key) != _accumulators.end()) throw AlreadyExistsException(key);
-      Ref<PublishedAccumulatorImpl> created = Create(key, accumulator);
-      created->Merge(accumulator);
-      created->Publish();
-      _accumulators.insert(created);
+      _keyLimit = limit;
+   }
+
+   int GetKeyLimit() override {
+      System::NativeSynchronized lock(_mutex);
+      return _keyLimit;
+   }
+
+   long long GetRefusedCount() override {
+      System::NativeSynchronized lock(_mutex);
+      return _refusedCount;
    }
 
    bool Find(const std::string& key, Ref<PublishedAccumulator>& out) override {
@@ -188,6 +253,32 @@ private:
       return new PublishedAccumulatorImpl(_registry, key, accumulator.Get());
    }
 
+   // Publishes an accumulator entered in the map; the caller holds none of the map's locks.
+   // A refused one leaves the map again; one removed from the map meanwhile leaves the
+   // registry again.
+   void Publish(const Ref<PublishedAccumulatorImpl>& accumulator) {
+      try {
+         accumulator->Publish();
+      } catch (...) {
+         Forget(accumulator);
+         throw;
+      }
+      bool kept;
+      {
+         System::NativeSynchronized lock(_mutex);
+         auto itr = _accumulators.find(accumulator->GetKey());
+         kept = itr != _accumulators.end() && *itr == accumulator;
+      }
+      if (!kept) accumulator->UnpublishIfPublished();
+   }
+
+   // Takes the accumulator out of the map unless the key has moved on to another one.
+   void Forget(const Ref<PublishedAccumulatorImpl>& accumulator) {
+      System::NativeSynchronized lock(_mutex);
+      auto itr = _accumulators.find(accumulator->GetKey());
+      if (itr != _accumulators.end() && *itr == accumulator) _accumulators.erase(itr);
+   }
+
    // Someone may still hold the accumulator; it leaves the registry now all the same.
    static void Unpublish(const Ref<PublishedAccumulatorImpl>& accumulator) {
       try {
@@ -202,6 +293,10 @@ private:
    Registry* const _registry;
    System::NativeMutex _mutex;
    std::set<Ref<PublishedAccumulatorImpl>, ByKey> _accumulators;
+   int _keyLimit = kDefaultPublishedKeyLimit;
+   long long _refusedCount = 0;
+   // Set when the limit refused a key and was logged; cleared when a new key fits again.
+   bool _limitLogged = false;
 };
 
 // The calling thread's builder and how deep its TlsScopes are nested.

@@ -1,3 +1,6 @@
+#include <chrono>
+#include <condition_variable>
+#include <mutex>
 #include <thread>
 
 #include "tests/perfcounter/fixture.h"
@@ -102,17 +105,80 @@ TEST_F(PublishedMapTest, ThreadsMergeTheirOwnBuildersThroughScopes) {
    EXPECT_EQ(2 + kThreads, map->GetSize());
 }
 
-using PublishedMapDeathTest = PublishedMapTest;
-
-TEST_F(PublishedMapDeathTest, MergingAnotherKindUnderAKnownKeyPanics) {
+// Two threads' builders disagreeing on a key's kind: the entry is refused, the rest of
+// the merge goes on, and the process too.
+TEST_F(PublishedMapTest, AnotherKindUnderAKnownKeyIsRefusedAndCounted) {
    Ref<LwStatsBuilder> counts, meters;
    CreateLwStatsBuilder(counts);
    CreateLwStatsBuilder(meters);
    counts->Insert("Key", 1, CounterFactory());
    meters->Insert("Key", 1, MeterFactory());
+   meters->Insert("Other", 5, CounterFactory());
    map->Merge(*counts);
-   EXPECT_DEATH(map->Merge(*meters),
-                "Assert Failed: \"\\(\\*itr\\)->GetType\\(\\) == itr2->first->GetType\\(\\)\"");
+   Pelmora::TestSupport::ScopedLogCapture log;
+   map->Merge(*meters);
+   EXPECT_THAT(log.Lines(),
+               ElementsAre("4 Refused to merge Key: published as another kind of accumulator"));
+   EXPECT_EQ(1, map->GetRefusedCount());
+   EXPECT_THAT(All(), ElementsAre("/Key = 1", "/Other = 5"));
+}
+
+// New keys stop at the limit; the limit is logged once each time it is reached.
+TEST_F(PublishedMapTest, NewKeysBeyondTheLimitAreRefusedCountedAndLoggedOnce) {
+   EXPECT_EQ(kDefaultPublishedKeyLimit, map->GetKeyLimit());
+   map->SetKeyLimit(2);
+   Ref<LwStatsBuilder> builder;
+   CreateLwStatsBuilder(builder);
+   for (const char* key : {"A", "B", "C", "D"}) builder->Insert(key, 1, CounterFactory());
+   Pelmora::TestSupport::ScopedLogCapture log;
+   map->Merge(*builder);
+   map->Merge(*builder);  // known keys still add up; the refusals are not logged again
+   EXPECT_THAT(All(), ElementsAre("/A = 2", "/B = 2"));
+   EXPECT_EQ(4, map->GetRefusedCount());
+   const char* const reached =
+       "8 Published statistics reached their limit of 2 keys; new keys are refused";
+   EXPECT_THAT(log.Lines(), ElementsAre(reached));
+   Ref<LwMeterAccumulator> meter = new LwMeterAccumulator("x");
+   EXPECT_THROW(map->Add("E", meter.Get()), FullException);
+
+   EXPECT_TRUE(map->Remove("A"));
+   map->Merge(*builder);  // room for one: A comes back, C and D are refused, logged anew
+   EXPECT_THAT(All(), ElementsAre("/A = 1", "/B = 3"));
+   EXPECT_EQ(6, map->GetRefusedCount());
+   EXPECT_THAT(log.Lines(), ElementsAre(reached, reached));
+}
+
+// A scrape holding the registry back must not stall merges: a new key waits for the
+// registry outside the map's lock, and the map serves others meanwhile.
+TEST_F(PublishedMapTest, PublishingANewKeyDoesNotHoldTheMapWhileTheRegistryIsBusy) {
+   Ref<LwStatsBuilder> known, fresh;
+   CreateLwStatsBuilder(known);
+   CreateLwStatsBuilder(fresh);
+   known->Insert("Known", 1, CounterFactory());
+   fresh->Insert("Fresh", 1, CounterFactory());
+   map->Merge(*known);
+   registry->WriteLock();
+   std::thread publishing([&] { map->Merge(*fresh); });
+   std::mutex mutex;
+   std::condition_variable changed;
+   bool served = false;
+   std::thread other([&] {
+      Ref<PublishedAccumulator> found;
+      while (!map->Find("Fresh", found)) std::this_thread::yield();
+      map->Merge(*known);
+      std::lock_guard<std::mutex> lock(mutex);
+      served = true;
+      changed.notify_all();
+   });
+   {
+      std::unique_lock<std::mutex> lock(mutex);
+      EXPECT_TRUE(changed.wait_for(lock, std::chrono::seconds(5), [&] { return served; }))
+          << "the map waited for the registry";
+   }
+   registry->Unlock();
+   Pelmora::Testing::Join(publishing, "the publishing merge");
+   Pelmora::Testing::Join(other, "the other merge");
+   EXPECT_THAT(All(), ElementsAre("/Fresh = 1", "/Known = 2"));
 }
 
 TEST(PublishedMapProcessTest, TheProcessMapPublishesInTheProcessRegistry) {

@@ -35,15 +35,29 @@ public:
 PELMORA_EXPORT void CreatePublishedAccumulator(Registry* registry, LwAccumulator* accumulator,
                                 Ref<PublishedAccumulator>& out);
 
+// How many keys a map publishes at most unless told otherwise (SetKeyLimit): enough for
+// every component's statistics, few enough that keys made from unbounded data (user or
+// peer names) cannot grow the registry without end.
+constexpr int kDefaultPublishedKeyLimit = 10000;
+
 class PELMORA_EXPORT PublishedAccumulatorMap : public virtual Object {
 public:
    // Folds every accumulator of `builder` into the published one of the same key, creating
-   // and publishing it on first sight. A failure is logged and the merge goes on. The
-   // caller must not hold the registry's lock.
+   // and publishing it on first sight; publishing happens outside the map's lock. A failure
+   // is logged and the merge goes on. Entries are refused, counted and logged (no more than
+   // once each time the limit is reached) when the key is new and the map is at its key
+   // limit, or when the key is published with another kind of accumulator. The caller must
+   // not hold the registry's lock.
    virtual void Merge(LwStatsBuilder& builder) = 0;
    // Publishes a new accumulator under `key` holding what `accumulator` holds.
-   // InvalidArgumentException for an invalid key, AlreadyExistsException for a known one.
+   // InvalidArgumentException for an invalid key, AlreadyExistsException for a known one,
+   // FullException at the key limit.
    virtual void Add(const std::string& key, LwAccumulator* accumulator) = 0;
+   // The most keys the map holds; keys already in it stay when the limit is lowered.
+   virtual void SetKeyLimit(int limit) = 0;
+   virtual int GetKeyLimit() = 0;
+   // The builder entries Merge refused so far.
+   virtual long long GetRefusedCount() = 0;
    virtual bool Find(const std::string& key, Ref<PublishedAccumulator>& out) = 0;
    // Unpublishes and forgets the key; false when it was not there.
    virtual bool Remove(const std::string& key) = 0;
