@@ -31,13 +31,13 @@ public:
       Ref<Node> tree = new Node(kRootTag, nullptr);
       std::string_view rest = text;
       int lineNumber = 0;
+      std::string key;
       std::string value;
       while (!rest.empty()) {
          size_t end = rest.find('\n');
          std::string_view line = rest.substr(0, end);
          rest = end == std::string_view::npos ? std::string_view() : rest.substr(end + 1);
          ++lineNumber;
-         std::string_view key;
          if (!ParseLine(line, lineNumber, key, value)) continue;
          Insert(tree.Get(), key, std::move(value), lineNumber);
       }
@@ -54,11 +54,13 @@ public:
 
 protected:
    // Splits a line into key and value; false for a comment.
-   virtual bool ParseLine(std::string_view line, int lineNumber, std::string_view& key,
+   virtual bool ParseLine(std::string_view line, int lineNumber, std::string& key,
                           std::string& value) = 0;
    virtual void AppendLine(std::string& out, const std::string& key, const std::string& value) = 0;
    // Whether a key may start with `c` in this syntax.
    virtual bool KeyMayStartWith(char c) const { return !IsTrimmed(c); }
+   // The characters no part of a key may hold in this syntax.
+   virtual const char* RefusedInKeys() const { return "=\n\r"; }
 
 private:
    void Insert(Node* root, std::string_view key, std::string value, int lineNumber) {
@@ -117,7 +119,7 @@ private:
 
    // What would not read back as the same key.
    void CheckKeyPart(const std::string& part, bool id, bool first) {
-      bool bad = part.find_first_of("=\n\r") != std::string::npos;
+      bool bad = part.find_first_of(RefusedInKeys()) != std::string::npos;
       if (id) {
          bad = bad || part.find(']') != std::string::npos;
       } else {
@@ -136,7 +138,7 @@ public:
    using FlatConfigBase::FlatConfigBase;
 
 protected:
-   bool ParseLine(std::string_view line, int lineNumber, std::string_view& key,
+   bool ParseLine(std::string_view line, int lineNumber, std::string& key,
                   std::string& value) override {
       if (Trim(line).empty()) return false;
       size_t equals = line.find('=');
@@ -144,7 +146,7 @@ protected:
       size_t open = line.find('"', equals + 1);
       size_t close = line.rfind('"');
       if (open == std::string_view::npos || close <= open) ThrowLine("Not a setting", lineNumber);
-      key = Trim(line.substr(0, equals));
+      key.assign(Trim(line.substr(0, equals)));
       value.assign(line.substr(open + 1, close - open - 1));
       return true;
    }
@@ -165,20 +167,20 @@ public:
    using FlatConfigBase::FlatConfigBase;
 
 protected:
-   bool ParseLine(std::string_view line, int lineNumber, std::string_view& key,
+   bool ParseLine(std::string_view line, int lineNumber, std::string& key,
                   std::string& value) override {
       std::string_view trimmed = Trim(line);
       if (trimmed.empty() || trimmed[0] == '#') return false;
-      size_t equals = line.find('=');
+      size_t equals = FindKeyEnd(line);
       if (equals == std::string_view::npos) ThrowLine("Not a setting", lineNumber);
-      key = Trim(line.substr(0, equals));
+      UnescapeKey(TrimValue(line.substr(0, equals)), key);
       if (key.empty()) ThrowLine("Empty key", lineNumber);
       Unescape(TrimValue(line.substr(equals + 1)), value);
       return true;
    }
 
    void AppendLine(std::string& out, const std::string& key, const std::string& value) override {
-      out += key;
+      AppendKey(out, key);
       out += " = ";
       for (size_t i = 0; i < value.size(); ++i) {
          char c = value[i];
@@ -198,9 +200,73 @@ protected:
       out += '\n';
    }
 
-   bool KeyMayStartWith(char c) const override { return c != '#' && !IsTrimmed(c); }
+   // Every character a key may open with is escaped where another reader would misread it.
+   bool KeyMayStartWith(char) const override { return true; }
+   const char* RefusedInKeys() const override { return "\n\r"; }
 
 private:
+   // Where other readers would end the key or take the line for a comment.
+   static void AppendKey(std::string& out, const std::string& key) {
+      for (size_t i = 0; i < key.size(); ++i) {
+         char c = key[i];
+         switch (c) {
+            case '\t': out += "\\t"; break;
+            case '\f': out += "\\f"; break;
+            case '\\':
+            case ' ':
+            case ':':
+            case '=':
+               out += '\\';
+               out += c;
+               break;
+            case '#':
+            case '!':
+               if (i == 0) out += '\\';
+               out += c;
+               break;
+            default: out += c;
+         }
+      }
+   }
+
+   // The first "=" that no backslash escapes.
+   static size_t FindKeyEnd(std::string_view line) {
+      for (size_t i = 0; i < line.size(); ++i) {
+         if (line[i] == '\\') {
+            ++i;
+         } else if (line[i] == '=') {
+            return i;
+         }
+      }
+      return std::string_view::npos;
+   }
+
+   static void UnescapeKey(std::string_view text, std::string& out) {
+      out.clear();
+      for (size_t i = 0; i < text.size(); ++i) {
+         char c = text[i];
+         if (c != '\\' || i + 1 == text.size()) {
+            out += c;
+            continue;
+         }
+         char next = text[++i];
+         switch (next) {
+            case 't': out += '\t'; break;
+            case 'f': out += '\f'; break;
+            case '\\':
+            case ' ':
+            case ':':
+            case '=':
+            case '#':
+            case '!': out += next; break;
+            default:
+               // As in values: a key written before keys were escaped reads as it did.
+               out += '\\';
+               out += next;
+         }
+      }
+   }
+
    // Trims like Trim, but keeps a white-space character that a backslash escapes.
    static std::string_view TrimValue(std::string_view text) {
       size_t begin = 0;

@@ -10,6 +10,7 @@
 #include <chrono>
 #include <filesystem>
 #include <fstream>
+#include <map>
 #include <random>
 #include <sstream>
 #include <string>
@@ -326,6 +327,134 @@ TEST_F(ConfigFileTest, PropertiesFilesRoundTripWithEscapes) {
       EXPECT_EQ(Thrown<FileFormatException>([&] { CreatePropertiesFileConfig(path, reread); }),
                 std::string("File Format Exception: ") + error);
    }
+}
+
+// Reads properties text by the format's own rules, as other readers (Java's among them)
+// apply them: "#" and "!" comment lines, lines continued by an odd run of backslashes, the
+// key ended by the first unescaped "=", ":" or white space, "\uXXXX" and the other escapes.
+// Bytes beyond ASCII pass unchanged: the text is read as UTF-8.
+std::map<std::string, std::string> ReadPropertiesByTheFormat(const std::string& text) {
+   auto isBlank = [](char c) { return c == ' ' || c == '\t' || c == '\f'; };
+   auto unescape = [](const std::string& raw) {
+      std::string out;
+      for (size_t i = 0; i < raw.size(); ++i) {
+         if (raw[i] != '\\' || i + 1 == raw.size()) {
+            out += raw[i];
+            continue;
+         }
+         char c = raw[++i];
+         if (c == 'u') {
+            unsigned code = std::stoul(raw.substr(i + 1, 4), nullptr, 16);
+            i += 4;
+            if (code < 0x80) {
+               out += static_cast<char>(code);
+            } else if (code < 0x800) {
+               out += static_cast<char>(0xC0 | (code >> 6));
+               out += static_cast<char>(0x80 | (code & 0x3F));
+            } else {
+               out += static_cast<char>(0xE0 | (code >> 12));
+               out += static_cast<char>(0x80 | ((code >> 6) & 0x3F));
+               out += static_cast<char>(0x80 | (code & 0x3F));
+            }
+            continue;
+         }
+         out += c == 't' ? '\t' : c == 'n' ? '\n' : c == 'r' ? '\r' : c == 'f' ? '\f' : c;
+      }
+      return out;
+   };
+   std::vector<std::string> natural;
+   std::string current;
+   for (size_t i = 0; i < text.size(); ++i) {
+      if (text[i] == '\n' || text[i] == '\r') {
+         natural.push_back(current);
+         current.clear();
+         if (text[i] == '\r' && i + 1 < text.size() && text[i + 1] == '\n') ++i;
+      } else {
+         current += text[i];
+      }
+   }
+   if (!current.empty()) natural.push_back(current);
+   std::map<std::string, std::string> read;
+   for (size_t n = 0; n < natural.size(); ++n) {
+      std::string line = natural[n];
+      size_t start = 0;
+      while (start < line.size() && isBlank(line[start])) ++start;
+      if (start == line.size() || line[start] == '#' || line[start] == '!') continue;
+      line.erase(0, start);
+      for (;;) {  // an odd run of backslashes joins the next line, its blanks dropped
+         size_t run = 0;
+         while (run < line.size() && line[line.size() - 1 - run] == '\\') ++run;
+         if (run % 2 == 0 || n + 1 == natural.size()) break;
+         line.pop_back();
+         const std::string& next = natural[++n];
+         size_t skip = 0;
+         while (skip < next.size() && isBlank(next[skip])) ++skip;
+         line += next.substr(skip);
+      }
+      size_t end = 0;
+      while (end < line.size()) {
+         char c = line[end];
+         if (c == '\\') {
+            end += 2;
+            continue;
+         }
+         if (c == '=' || c == ':' || isBlank(c)) break;
+         ++end;
+      }
+      end = std::min(end, line.size());
+      size_t value = end;
+      while (value < line.size() && isBlank(line[value])) ++value;
+      if (value < line.size() && (line[value] == '=' || line[value] == ':')) ++value;
+      while (value < line.size() && isBlank(line[value])) ++value;
+      read[unescape(line.substr(0, end))] = unescape(line.substr(value));
+   }
+   return read;
+}
+
+// Keys holding what other readers take for the end of a key or a comment are escaped, so
+// that such readers and this one read the same keys back.
+TEST_F(ConfigFileTest, PropertiesKeysReadBackTheSameByTheFormatsRules) {
+   std::string path = Path("keys.properties");
+   WriteFile(path, "");
+   Ref<Config> config, reread;
+   CreatePropertiesFileConfig(path, config);
+   const std::pair<const char*, const char*> settings[] = {
+       {"user[john doe]/role", "yes"},  // read as key "user[john" before
+       {"a:b", "colon"},
+       {"a=b", "equals"},
+       {"tab\there", "tab"},
+       {"feed\fhere", "form feed"},
+       {"back\\slash[x\\]", "backslash"},
+       {"#hash", "hash"},
+       {"!bang", "bang"},
+       {"in#side!", "not escaped"},
+       {" lead", "leading blank"},
+       {"caf\xc3\xa9[\xe2\x82\xac]", "\xc3\xa9t\xc3\xa9 = :"},
+   };
+   auto view = MainView(config.Get());
+   for (auto& [key, value] : settings) view->Set(key, value);
+   config->Flush();
+   std::string text = ReadFile(path);
+   EXPECT_NE(text.find("user[john\\ doe].role = yes\n"), std::string::npos) << text;
+   EXPECT_NE(text.find("\\#hash = hash\n"), std::string::npos) << text;
+   EXPECT_NE(text.find("in#side! = not escaped\n"), std::string::npos) << text;
+   EXPECT_NE(text.find("caf\xc3\xa9[\xe2\x82\xac] = "), std::string::npos) << "written as UTF-8";
+
+   std::map<std::string, std::string> expected;
+   for (auto& [key, value] : settings) {
+      std::string dotted = key;
+      std::replace(dotted.begin(), dotted.end(), '/', '.');
+      expected[dotted] = value;
+   }
+   EXPECT_EQ(ReadPropertiesByTheFormat(text), expected);
+
+   CreatePropertiesFileConfig(path, reread);
+   for (auto& [key, value] : settings) EXPECT_EQ(Text(reread.Get(), key), value) << key;
+   // What the format's own writers produce reads back too, escapes the same.
+   WriteFile(path, "a\\:b\\=c\\ d\\\\e\\tf = 1\nplain\\q = 2\n");
+   CreatePropertiesFileConfig(path, reread);
+   EXPECT_EQ(Text(reread.Get(), "a:b=c d\\e\tf"), "1");
+   EXPECT_EQ(Text(reread.Get(), "plain\\q"), "2");  // unknown escapes stay, as in values
 }
 
 TEST_F(ConfigFileTest, FlatFileWithAnotherSeparator) {

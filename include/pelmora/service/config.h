@@ -109,6 +109,12 @@ PELMORA_EXPORT void CreateFlatStringConfig(std::string& text, Ref<Config>& out);
 // Properties files: `key = value` lines, keys joined with "."; "#" lines are comments.
 // In values a backslash escapes: "\\" a backslash, "\n" a line feed, "\r" a carriage
 // return, "\t" a tab, "\ " a blank kept at either end; other backslashes stay as written.
+// Keys are written so that other properties readers split them where this one does: a
+// backslash goes before every blank, ":", "=" and backslash, and before "#" or "!" opening
+// the key; tab and form feed are written "\t" and "\f". Reading undoes these escapes and
+// takes the key up to the first "=" no backslash escapes. Files are UTF-8, characters
+// beyond ASCII written as they are (not as \uXXXX): Java's Properties must load them
+// through a UTF-8 Reader, not an InputStream.
 PELMORA_EXPORT void CreatePropertiesFileConfig(const std::string& path, Ref<Config>& out);
 PELMORA_EXPORT void CreatePropertiesFileConfig(const std::string& path, int sizeLimit, Ref<Config>& out);
 // Memory only: Load and Flush raise NotSupportedException.
