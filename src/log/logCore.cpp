@@ -304,14 +304,18 @@ void LoggerImpl::CreateLogger(const std::string& name, CombinedLevel mask, Ref<L
 }
 
 void LoggerImpl::SetLogHalf(CombinedLevel mask16) {
-   // A lost race between two setters leaves one of their values, as either order would.
-   CombinedLevel old = GetCombinedMask();
-   SetCombinedMask((old & ~kLowHalf) | (mask16 & kLowHalf));
+   // Compare-and-swap: a setter of the other half at the same time keeps its change.
+   CombinedLevel old = _combinedMask.load(std::memory_order_relaxed);
+   while (!_combinedMask.compare_exchange_weak(old, (old & ~kLowHalf) | (mask16 & kLowHalf),
+                                               std::memory_order_relaxed)) {
+   }
 }
 
 void LoggerImpl::SetMemHalf(CombinedLevel mask16) {
-   CombinedLevel old = GetCombinedMask();
-   SetCombinedMask((old & kLowHalf) | ((mask16 & kLowHalf) << kMemoryShift));
+   CombinedLevel old = _combinedMask.load(std::memory_order_relaxed);
+   while (!_combinedMask.compare_exchange_weak(
+       old, (old & kLowHalf) | ((mask16 & kLowHalf) << kMemoryShift), std::memory_order_relaxed)) {
+   }
 }
 
 bool LoggerImpl::SetLevelByName(const std::string& name) {

@@ -218,6 +218,48 @@ TEST(LogLevelTest, NamesInstallCumulativeMasksAndUnknownNamesAreRefused) {
              std::string::npos);
 }
 
+TEST(LogLevelTest, ChangingBothHalvesFromTwoThreadsLosesNoChange) {
+   TestLogger t;
+   // Runs until each thread has seen the other's half change often enough (the threads
+   // ran side by side), or for at most three seconds on a machine too busy for that.
+   constexpr int kChangesSeen = 2000;
+   std::atomic<bool> stop{false};
+   std::atomic<int> lost{0};
+   std::atomic<int> seen[2] = {0, 0};
+   // Each thread owns one half: it must still hold what the thread set last.
+   auto flip = [&](int half) {
+      const char* names[] = {"error", "verbose"};
+      const Logger::CombinedLevel masks[] = {7, 63};
+      Logger::CombinedLevel mine = t.logger->GetCombinedMask() >> (half * 16) & 0xFFFF;
+      Logger::CombinedLevel theirs = t.logger->GetCombinedMask() >> (16 - half * 16) & 0xFFFF;
+      for (int i = 0; !stop.load(std::memory_order_relaxed); ++i) {
+         Logger::CombinedLevel mask = t.logger->GetCombinedMask();
+         if ((mask >> (half * 16) & 0xFFFF) != mine) ++lost;
+         if ((mask >> (16 - half * 16) & 0xFFFF) != theirs) {
+            theirs = mask >> (16 - half * 16) & 0xFFFF;
+            seen[half].fetch_add(1, std::memory_order_relaxed);
+         }
+         if (half == 1) {
+            t.logger->SetMemLevelByName(names[i % 2]);
+         } else {
+            t.logger->SetLevelByName(names[i % 2]);
+         }
+         mine = masks[i % 2];
+      }
+   };
+   std::vector<std::thread> threads;
+   threads.emplace_back(flip, 0);
+   threads.emplace_back(flip, 1);
+   auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(3);
+   while ((seen[0] < kChangesSeen || seen[1] < kChangesSeen) &&
+          std::chrono::steady_clock::now() < deadline) {
+      std::this_thread::sleep_for(std::chrono::milliseconds(1));
+   }
+   stop = true;
+   Pelmora::Testing::JoinAll(threads, "the level setters");
+   EXPECT_EQ(lost, 0) << "changes seen: " << seen[0] << " and " << seen[1];
+}
+
 TEST(LogManagerTest, SubsystemLevelsReachLivingAndLaterLoggers) {
    TestLogger t;
    LogManager* manager = t.logger->GetLogManager();
