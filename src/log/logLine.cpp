@@ -252,8 +252,17 @@ LoggerTlsState& LoggerTlsState::Get() {
    return *state;
 }
 
-std::mutex g_callbackMutex;
-std::map<std::string, LogContextCallback> g_callbacks;
+// The registered log-context callbacks. Lives until exit: detached threads may set
+// their context while static objects are being destroyed.
+struct ContextCallbacks {
+   std::mutex mutex;
+   std::map<std::string, LogContextCallback> callbacks;
+};
+
+ContextCallbacks& GetContextCallbacks() {
+   static ContextCallbacks* const callbacks = new ContextCallbacks();
+   return *callbacks;
+}
 
 }  // namespace
 
@@ -329,9 +338,10 @@ void SetLogContext(const std::string& key, const std::string& value) {
       state.context[key] = value;
    }
    std::map<std::string, LogContextCallback> callbacks;
+   ContextCallbacks& registered = GetContextCallbacks();
    {
-      std::lock_guard<std::mutex> lock(g_callbackMutex);
-      callbacks = g_callbacks;
+      std::lock_guard<std::mutex> lock(registered.mutex);
+      callbacks = registered.callbacks;
    }
    for (auto& [name, callback] : callbacks) callback(key, value);
 }
@@ -343,13 +353,15 @@ std::string GetLogContext(const std::string& key) {
 }
 
 void AddLogContextUpdateCallback(const std::string& name, const LogContextCallback& callback) {
-   std::lock_guard<std::mutex> lock(g_callbackMutex);
-   g_callbacks[name] = callback;
+   ContextCallbacks& registered = GetContextCallbacks();
+   std::lock_guard<std::mutex> lock(registered.mutex);
+   registered.callbacks[name] = callback;
 }
 
 void RemoveLogContextUpdateCallback(const std::string& name) {
-   std::lock_guard<std::mutex> lock(g_callbackMutex);
-   g_callbacks.erase(name);
+   ContextCallbacks& registered = GetContextCallbacks();
+   std::lock_guard<std::mutex> lock(registered.mutex);
+   registered.callbacks.erase(name);
 }
 
 }  // namespace Pelmora::Service

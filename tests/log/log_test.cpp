@@ -1,6 +1,7 @@
 // Loggers, lines and their prefix, levels, nesting, the log context and the memory ring.
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <regex>
@@ -17,6 +18,8 @@
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
+
+extern "C" void __cxa_finalize(void* dso);
 
 namespace {
 
@@ -258,6 +261,30 @@ TEST(LogLevelTest, ChangingBothHalvesFromTwoThreadsLosesNoChange) {
    stop = true;
    Pelmora::Testing::JoinAll(threads, "the level setters");
    EXPECT_EQ(lost, 0) << "changes seen: " << seen[0] << " and " << seen[1];
+}
+
+TEST(LogContextDeathTest, CallbacksOutliveStaticDestruction) {
+   // Static destruction runs as exit runs it; then this thread does what a detached
+   // thread still running at that moment may do.
+   EXPECT_EXIT(
+       {
+          // Callbacks with state on the heap, so that a destroyed registry shows.
+          std::string state(200, 's');
+          for (int i = 0; i < 100; ++i) {
+             AddLogContextUpdateCallback("exit " + std::to_string(i),
+                                         [state](const std::string&, const std::string&) {
+                                            if (state.size() != 200) abort();
+                                         });
+          }
+          SetLogContext("phase", "running");
+          __cxa_finalize(nullptr);
+          SetLogContext("phase", "exiting");
+          AddLogContextUpdateCallback("late", [](const std::string&, const std::string&) {});
+          RemoveLogContextUpdateCallback("late");
+          SetLogContext("phase", "");
+          _exit(0);
+       },
+       testing::ExitedWithCode(0), "");
 }
 
 TEST(LogManagerTest, SubsystemLevelsReachLivingAndLaterLoggers) {
