@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <fstream>
 #include <regex>
 #include <string>
 #include <thread>
@@ -78,6 +79,14 @@ const std::string kPrefix =
 
 bool Matches(const std::string& line, const std::string& rest) {
    return std::regex_match(line, std::regex(kPrefix + rest));
+}
+
+// Whether thread `tid` of this process is asleep in the kernel (waiting on a lock).
+bool IsAsleep(pid_t tid) {
+   std::ifstream in("/proc/self/task/" + std::to_string(tid) + "/stat");
+   std::string stat((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+   size_t end = stat.rfind(')');  // the state follows the command name
+   return end != std::string::npos && end + 2 < stat.size() && stat[end + 2] == 'S';
 }
 
 }  // namespace
@@ -341,16 +350,23 @@ TEST(LogOutputTest, WriteLockIsRecursivePerThreadAndExcludesOtherThreads) {
    output->RecursiveWriteLock();
    output->RecursiveReadLock();
    PELMORA_LOG_INFO(t.logger.Get(), "mine");  // this thread's line goes out, another's waits
+   std::atomic<pid_t> tid{0};
    std::atomic<bool> done{false};
    std::thread other([&] {
+      tid = gettid();
       PELMORA_LOG_INFO(t.logger.Get(), "theirs");
       done = true;
    });
-   std::this_thread::sleep_for(std::chrono::milliseconds(20));
+   // The other thread has reached the lock and sleeps on it, or (a broken lock) got through.
+   auto waitForOther = [&](const char* what) {
+      Pelmora::Testing::Watchdog watchdog(what);
+      while (!done && (tid == 0 || !IsAsleep(tid))) std::this_thread::yield();
+   };
+   waitForOther("the other thread to wait for the held lock");
    EXPECT_FALSE(done.load());
    output->ReadUnlock();
    output->WriteUnlock();
-   std::this_thread::sleep_for(std::chrono::milliseconds(5));
+   waitForOther("the other thread to wait for the lock still held once");
    EXPECT_FALSE(done.load());
    output->WriteUnlock();
    Pelmora::Testing::Join(other, "other to finish");
