@@ -1,6 +1,6 @@
 // The log file writer: buffered appends, size-based rollover by renames at line
-// boundaries, reopening after an outside rotation, and the one thread that writes out
-// buffers that have waited long enough.
+// boundaries, reopening after an outside rotation, holding lines while the file cannot
+// be opened, and the one thread that writes out buffers that have waited long enough.
 
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -74,14 +74,19 @@ std::string RolledName(const std::string& path, int index) {
    return path + "." + std::to_string(index);
 }
 
-class LogFileWriterImpl : public LogWriterImpl {
+class LogFileWriterImpl : public LogWriterImpl, public virtual FileLogWriter {
 public:
-   LogFileWriterImpl(const LogFileOptions& options, Logger::CombinedLevel mask)
-      : LogWriterImpl(nullptr, mask, false), _options(options) {
+   LogFileWriterImpl(const LogFileOptions& options, const LogFileOps& ops,
+                     Logger::CombinedLevel mask)
+      : LogWriterImpl(nullptr, mask, false), _options(options), _ops(ops) {
       if (_options.maxFileNum < 1) _options.maxFileNum = 1;
       if (_options.bufferSize < 0) _options.bufferSize = 0;
+      if (_options.maxHeldBytes < 0) _options.maxHeldBytes = 0;
       _buffer.resize(static_cast<size_t>(_options.bufferSize));
-      Open(true);
+      if (!TryOpen()) {
+         throw SystemException(errno, "cannot open log file " + _options.path + ": " +
+                                          strerror(errno));
+      }
       if (_options.bufferSize > 0) LogFileFlusher::Instance().Add(this, _options.flushIntervalMs);
    }
 
@@ -91,17 +96,20 @@ public:
       CloseLocked();
    }
 
+   uint64_t GetLostCount() const override { return _lost.load(std::memory_order_relaxed); }
+
    void Reopen() override {
       std::lock_guard<std::mutex> lock(_mutex);
       WriteBuffer();
       if (_fd >= 0) close(_fd);
       _fd = -1;
-      Open(false);
+      TryOpen();
    }
 
    // From the flusher thread.
    void FlushIfDue(Clock::time_point now) {
       std::lock_guard<std::mutex> lock(_mutex);
+      if (_fd < 0 && !_held.empty()) RetryOpen(now);
       if (_used > 0 && _options.flushIntervalMs > 0 &&
           now - _dirtySince >= std::chrono::milliseconds(_options.flushIntervalMs)) {
          WriteBuffer();
@@ -110,14 +118,29 @@ public:
 
 protected:
    void WriteLocked(Logger::CombinedLevel level, const char* data, int length) override {
-      if (_atLineStart && _options.maxFileSize > 0 && _size >= _options.maxFileSize) Roll();
+      bool endsLine = data[length - 1] == '\n';
+      if (_atLineStart) _dropping = false;
+      if (_fd < 0 && !RetryOpen(Clock::now())) {
+         Hold(data, static_cast<size_t>(length), endsLine);
+         return;
+      }
+      if (_atLineStart && _options.maxFileSize > 0 && _size >= _options.maxFileSize) {
+         Roll();
+         if (_fd < 0) {
+            Hold(data, static_cast<size_t>(length), endsLine);
+            return;
+         }
+      }
       Append(data, static_cast<size_t>(length));
       _size += length;
-      _atLineStart = data[length - 1] == '\n';
+      _atLineStart = endsLine;
       if (_atLineStart && (level & kSevereLevels) != 0) WriteBuffer();
    }
 
-   void FlushLocked() override { WriteBuffer(); }
+   void FlushLocked() override {
+      if (_fd < 0) RetryOpen(Clock::now());
+      WriteBuffer();
+   }
 
    void CloseLocked() override {
       WriteBuffer();
@@ -126,17 +149,50 @@ protected:
    }
 
 private:
-   // `first`: the constructor's open, whose failure the caller sees.
-   void Open(bool first) {
-      _fd = open(_options.path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC,
-                 static_cast<mode_t>(_options.fileMode));
-      if (_fd < 0) {
-         if (first) throw SystemException(errno, "cannot open log file " + _options.path + ": " +
-                                                     strerror(errno));
-         return;
+   // Opens `path`; on success writes the held lines first. On failure errno tells why and
+   // the next try waits reopenRetryMs.
+   bool TryOpen() {
+      int fd = _ops.open(_options.path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC,
+                         static_cast<mode_t>(_options.fileMode));
+      if (fd < 0) {
+         int error = errno;
+         _nextOpen = Clock::now() + std::chrono::milliseconds(_options.reopenRetryMs);
+         errno = error;
+         return false;
       }
+      _fd = fd;
       struct stat info;
       _size = fstat(_fd, &info) == 0 ? info.st_size : 0;
+      if (!_held.empty()) {
+         std::string held;
+         held.swap(_held);  // and its memory goes with it
+         WriteOut(held.data(), held.size());
+         _size += static_cast<long long>(held.size());
+      }
+      return true;
+   }
+
+   // Only between lines, so that a line is held or written whole, and a line being
+   // dropped is dropped to its end.
+   bool RetryOpen(Clock::time_point now) {
+      if (!_atLineStart || now < _nextOpen) return false;
+      return TryOpen();
+   }
+
+   // Keeps a piece while the file is closed; a line that does not fit what is left of
+   // maxHeldBytes is dropped whole and counted.
+   void Hold(const char* data, size_t length, bool endsLine) {
+      if (_atLineStart) _heldLineStart = _held.size();
+      if (!_dropping) {
+         if (_held.size() + length > static_cast<size_t>(_options.maxHeldBytes)) {
+            _held.resize(_heldLineStart);
+            _dropping = true;
+            _lost.fetch_add(1, std::memory_order_relaxed);
+         } else {
+            _held.append(data, length);
+         }
+      }
+      _atLineStart = endsLine;
    }
 
    void Roll() {
@@ -148,11 +204,12 @@ private:
          unlink(_options.path.c_str());
       } else {
          for (int i = _options.maxFileNum - 1; i >= 2; --i) {
-            rename(RolledName(_options.path, i - 1).c_str(), RolledName(_options.path, i).c_str());
+            _ops.rename(RolledName(_options.path, i - 1).c_str(),
+                        RolledName(_options.path, i).c_str());
          }
-         rename(_options.path.c_str(), RolledName(_options.path, 1).c_str());
+         _ops.rename(_options.path.c_str(), RolledName(_options.path, 1).c_str());
       }
-      Open(false);
+      TryOpen();
    }
 
    void Append(const char* data, size_t length) {
@@ -176,24 +233,31 @@ private:
    }
 
    void WriteOut(const char* data, size_t length) {
-      if (_fd < 0) Open(false);  // a failed roll or reopen: try again
       while (length > 0 && _fd >= 0) {
-         ssize_t n = write(_fd, data, length);
+         ssize_t n = _ops.write(_fd, data, length);
          if (n < 0 && errno == EINTR) continue;
          if (n <= 0) break;
          data += n;
          length -= static_cast<size_t>(n);
       }
-      // What could not be written (disk full, no file) is lost; logging goes on.
+      // What could not be written (disk full) is lost; logging goes on.
    }
 
    LogFileOptions _options;
+   const LogFileOps _ops;
    int _fd = -1;
    long long _size = 0;
    std::vector<char> _buffer;
    size_t _used = 0;
    bool _atLineStart = true;
    Clock::time_point _dirtySince;
+   // While the file is closed: the held lines, where the current one starts among them,
+   // whether it is being dropped, and when the next open may be tried.
+   std::string _held;
+   size_t _heldLineStart = 0;
+   bool _dropping = false;
+   Clock::time_point _nextOpen;
+   std::atomic<uint64_t> _lost{0};
 };
 
 void LogFileFlusher::FlushAll() {
@@ -220,13 +284,33 @@ void LogFileFlusher::Run() {
 
 }  // namespace
 
-void CreateFileLogWriter(const std::string&, const LogFileOptions& options, Ref<LogWriter>& out) {
+const LogFileOps& LogFileOps::Posix() {
+   static const LogFileOps ops{
+       [](const char* path, int flags, mode_t mode) { return ::open(path, flags, mode); },
+       ::write, ::rename};
+   return ops;
+}
+
+void CreateFileLogWriter(const std::string&, const LogFileOptions& options, const LogFileOps& ops,
+                         Ref<FileLogWriter>& out) {
    Logger::CombinedLevel mask;
    if (!FindLevelMask(options.level, mask)) {
       throw InvalidArgumentException("log level '" + options.level + "'");
    }
    if (options.path.empty()) throw InvalidArgumentException("empty log file path");
-   out = new LogFileWriterImpl(options, mask);
+   out = new LogFileWriterImpl(options, ops, mask);
+}
+
+void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
+                         Ref<FileLogWriter>& out) {
+   CreateFileLogWriter(name, options, LogFileOps::Posix(), out);
+}
+
+void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
+                         Ref<LogWriter>& out) {
+   Ref<FileLogWriter> writer;
+   CreateFileLogWriter(name, options, LogFileOps::Posix(), writer);
+   out = writer.Get();
 }
 
 }  // namespace Pelmora::Service

@@ -2,6 +2,7 @@
 // The logging implementation classes shared by the logging units.
 
 #include <pthread.h>
+#include <sys/types.h>
 
 #include <atomic>
 #include <map>
@@ -10,7 +11,7 @@
 #include <string>
 
 #include "pelmora/object/containers.h"
-#include "pelmora/service/logger.h"
+#include "pelmora/service/logWriters.h"
 
 namespace Pelmora::Service {
 
@@ -85,6 +86,17 @@ private:
    std::atomic<const void*> _owner{nullptr};
    int _depth = 0;  // of the owner's write (and nested read) holds
 };
+
+// The system calls a file log writer goes through. Tests replace one to make a step fail
+// or to count it; everything else uses the defaults.
+struct LogFileOps {
+   int (*open)(const char* path, int flags, mode_t mode);
+   ssize_t (*write)(int fd, const void* data, size_t length);
+   int (*rename)(const char* from, const char* to);
+   static const LogFileOps& Posix();
+};
+void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
+                         const LogFileOps& ops, Ref<FileLogWriter>& out);
 
 class LogOutputImpl : public virtual LogOutput, public ObjectImpl {
 public:

@@ -1,11 +1,13 @@
-// The file writer's rollover, buffering and reopening; the syslog writer on a socket of
-// the test's own.
+// The file writer's rollover, buffering, reopening and failed opens; the syslog writer on
+// a socket of the test's own.
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
@@ -18,6 +20,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service.h"
+#include "src/log/logImpl.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
@@ -45,6 +48,14 @@ struct Files {
       Ref<LogWriter> writer;
       CreateFileLogWriter("file", options, writer);
       logger->GetLogOutput()->AddWriter("file", writer.Get());
+   }
+   Ref<FileLogWriter> AddFile(LogFileOptions& options, const std::string& name,
+                              const LogFileOps& ops) {
+      options.path = dir + "/" + name;
+      Ref<FileLogWriter> writer;
+      CreateFileLogWriter("file", options, ops, writer);
+      logger->GetLogOutput()->AddWriter("file", writer.Get());
+      return writer;
    }
    std::string dir;
    Ref<Logger> logger;
@@ -75,6 +86,26 @@ struct SyslogReceiver {
    }
    std::string path;
    int fd = -1;
+};
+
+// The open and rename steps of file writers made with Ops(): a test makes opens fail or
+// counts renames.
+struct FileOps {
+   static inline std::atomic<bool> failOpen{false};
+   static inline std::atomic<int> renames{0};
+
+   static int Open(const char* path, int flags, mode_t mode) {
+      if (failOpen) return errno = EMFILE, -1;
+      return ::open(path, flags, mode);
+   }
+   static int Rename(const char* from, const char* to) {
+      ++renames;
+      return ::rename(from, to);
+   }
+   static const LogFileOps& Ops() {
+      static const LogFileOps ops{Open, ::write, Rename};
+      return ops;
+   }
 };
 
 }  // namespace
@@ -179,6 +210,46 @@ TEST(LogFileWriterTest, ReopenFollowsAnOutsideRotationAndUnopenableFilesAreRefus
    options.path = f.dir + "/x.log";
    options.level = "loud";
    EXPECT_THROW(CreateFileLogWriter("file", options, writer), InvalidArgumentException);
+}
+
+TEST(LogFileWriterTest, FailedOpenAfterARollKeepsTheFilesAndHoldsLinesUntilAnOpenSucceeds) {
+   Files f;
+   LogFileOptions options;
+   options.maxFileSize = 1;  // every line rolls the one before it over
+   options.maxFileNum = 4;
+   options.bufferSize = 0;
+   options.maxHeldBytes = 1000;
+   options.reopenRetryMs = 0;
+   Ref<FileLogWriter> writer = f.AddFile(options, "held.log", FileOps::Ops());
+   for (int i = 0; i < 4; ++i) PELMORA_LOG_INFO(f.logger.Get(), "line %1", i);
+   FileOps::renames = 0;
+   FileOps::failOpen = true;
+   for (int i = 0; i < 20; ++i) PELMORA_LOG_INFO(f.logger.Get(), "held %1", i);
+   f.logger->GetLogManager()->Flush();
+   // One roll, then nothing is renamed while the file cannot be opened.
+   EXPECT_EQ(FileOps::renames, 3);
+   EXPECT_FALSE(fs::exists(options.path));
+   for (int i = 1; i <= 3; ++i) {
+      std::string rolled = ReadFile(options.path + "." + std::to_string(i));
+      EXPECT_NE(rolled.find("] line " + std::to_string(4 - i) + "\n"), std::string::npos) << i;
+   }
+
+   FileOps::failOpen = false;
+   PELMORA_LOG_INFO(f.logger.Get(), "after");
+   EXPECT_NE(ReadFile(options.path).find("] after\n"), std::string::npos);
+   // The held lines went to the reopened file first, whole and in order, up to the limit;
+   // the rest were counted.
+   std::string held = ReadFile(options.path + ".1");
+   EXPECT_LE(held.size(), 1000u);
+   std::vector<std::string> lines;
+   std::stringstream in(held);
+   for (std::string line; std::getline(in, line);) lines.push_back(line);
+   ASSERT_FALSE(lines.empty());
+   for (size_t i = 0; i < lines.size(); ++i) {
+      EXPECT_NE(lines[i].find("] held " + std::to_string(i)), std::string::npos) << lines[i];
+   }
+   EXPECT_EQ(lines.size() + writer->GetLostCount(), 20u);
+   EXPECT_GT(writer->GetLostCount(), 0u);
 }
 
 TEST(LogSyslogWriterTest, LinesArriveWithTheirPriorityAndSurviveTheSocketGoingAway) {

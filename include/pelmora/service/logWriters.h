@@ -22,6 +22,11 @@ namespace Pelmora::Service {
 // `flushIntervalMs` after they were written (checked every half interval by one
 // process-wide thread). Reopen (the manager's, after an outside rotation renamed the
 // file) writes the buffer to the old file and opens `path` anew.
+// When `path` cannot be opened again (after a roll or Reopen; out of descriptors, say),
+// nothing is renamed until an open succeeds: the rolled files stay as they are, new lines
+// are held in memory, up to `maxHeldBytes`, and later ones dropped and counted; the open
+// is tried again at a line start or flush once `reopenRetryMs` have passed, and the held
+// lines are written first when it succeeds.
 struct PELMORA_EXPORT LogFileOptions {
    std::string path;
    std::string level = "info";
@@ -30,10 +35,20 @@ struct PELMORA_EXPORT LogFileOptions {
    int fileMode = 0644;               // of new files, before the umask
    int bufferSize = 65536;            // bytes held before a write; 0 writes every line
    int flushIntervalMs = 200;         // the longest a written line waits in the buffer
+   int maxHeldBytes = 1048576;        // lines held while the file cannot be opened
+   int reopenRetryMs = 1000;          // the shortest wait between two failed opens
+};
+class PELMORA_EXPORT FileLogWriter : public virtual LogWriter {
+public:
+   // Lines dropped since the writer was made because the file could not be opened and
+   // `maxHeldBytes` were held already.
+   virtual uint64_t GetLostCount() const = 0;
 };
 // Opens (creates) the file: SystemException when that fails.
 PELMORA_EXPORT void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
                          Ref<LogWriter>& out);
+PELMORA_EXPORT void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
+                         Ref<FileLogWriter>& out);
 
 // Writes each line to standard error (or standard output) at once.
 PELMORA_EXPORT void CreateConsoleLogWriter(const std::string& name, const std::string& level, bool toStdout,
