@@ -2,6 +2,7 @@
 // boundaries, reopening after an outside rotation, holding lines while the file cannot
 // be opened, and the one thread that writes out buffers that have waited long enough.
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -87,6 +88,7 @@ public:
          throw SystemException(errno, "cannot open log file " + _options.path + ": " +
                                           strerror(errno));
       }
+      _highestRolled = FindHighestRolled();
       if (_options.bufferSize > 0) LogFileFlusher::Instance().Add(this, _options.flushIntervalMs);
    }
 
@@ -195,6 +197,28 @@ private:
       _atLineStart = endsLine;
    }
 
+   // The highest index below maxFileNum of the rolled files present.
+   int FindHighestRolled() const {
+      size_t slash = _options.path.rfind('/');
+      std::string dir = slash == std::string::npos ? "." : _options.path.substr(0, slash + 1);
+      std::string base = (slash == std::string::npos ? _options.path
+                                                     : _options.path.substr(slash + 1)) + ".";
+      int highest = 0;
+      DIR* listing = opendir(dir.c_str());
+      if (!listing) return _options.maxFileNum - 1;  // unknown: assume them all
+      while (struct dirent* entry = readdir(listing)) {
+         const char* name = entry->d_name;
+         if (strncmp(name, base.c_str(), base.size()) != 0) continue;
+         const char* digits = name + base.size();
+         if (*digits == 0 || *digits == '0' || strlen(digits) > 9) continue;
+         if (strspn(digits, "0123456789") != strlen(digits)) continue;
+         int index = atoi(digits);
+         if (index < _options.maxFileNum && index > highest) highest = index;
+      }
+      closedir(listing);
+      return highest;
+   }
+
    void Roll() {
       WriteBuffer();
       if (_fd >= 0) close(_fd);
@@ -203,11 +227,15 @@ private:
          // Only the current file is kept: start it again.
          unlink(_options.path.c_str());
       } else {
-         for (int i = _options.maxFileNum - 1; i >= 2; --i) {
+         // Renames that find no file (one deleted from outside) cost a call each, at
+         // most one per index up to the highest present.
+         int top = std::min(_highestRolled + 1, _options.maxFileNum - 1);
+         for (int i = top; i >= 2; --i) {
             _ops.rename(RolledName(_options.path, i - 1).c_str(),
                         RolledName(_options.path, i).c_str());
          }
          _ops.rename(_options.path.c_str(), RolledName(_options.path, 1).c_str());
+         _highestRolled = top;
       }
       TryOpen();
    }
@@ -247,6 +275,7 @@ private:
    const LogFileOps _ops;
    int _fd = -1;
    long long _size = 0;
+   int _highestRolled = 0;
    std::vector<char> _buffer;
    size_t _used = 0;
    bool _atLineStart = true;

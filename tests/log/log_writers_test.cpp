@@ -252,6 +252,29 @@ TEST(LogFileWriterTest, FailedOpenAfterARollKeepsTheFilesAndHoldsLinesUntilAnOpe
    EXPECT_GT(writer->GetLostCount(), 0u);
 }
 
+TEST(LogFileWriterTest, RollRenamesOnlyTheRolledFilesThereAre) {
+   Files f;
+   LogFileOptions options;
+   options.maxFileSize = 1;
+   options.maxFileNum = 100000;
+   options.bufferSize = 0;
+   std::ofstream(f.dir + "/many.log.1") << "old 1\n";
+   std::ofstream(f.dir + "/many.log.2") << "old 2\n";
+   std::ofstream(f.dir + "/many.log.x") << "not a rolled file\n";
+   f.AddFile(options, "many.log", FileOps::Ops());
+   FileOps::renames = 0;
+   for (int i = 0; i < 4; ++i) PELMORA_LOG_INFO(f.logger.Get(), "line %1", i);
+   // Three rolls over 2, 3 and 4 rolled files: one rename per file.
+   EXPECT_EQ(FileOps::renames, 3 + 4 + 5);
+   EXPECT_EQ(ReadFile(options.path + ".4"), "old 1\n");
+   EXPECT_EQ(ReadFile(options.path + ".5"), "old 2\n");
+   for (int i = 0; i < 3; ++i) {
+      std::string rolled = ReadFile(options.path + "." + std::to_string(3 - i));
+      EXPECT_NE(rolled.find("] line " + std::to_string(i)), std::string::npos) << i;
+   }
+   EXPECT_FALSE(fs::exists(options.path + ".6"));
+}
+
 TEST(LogSyslogWriterTest, LinesArriveWithTheirPriorityAndSurviveTheSocketGoingAway) {
    Files f;
    LogSyslogOptions options;

@@ -17,7 +17,10 @@ namespace Pelmora::Service {
 // `path` becomes `path`.1 and a new `path` is opened (with maxFileNum 1 the file starts
 // again empty). So at most `maxFileNum` files exist, the newest lines are in `path`, and
 // a line is never split across files. Each rename is atomic, so a rolled file is always
-// complete under its name. Bytes are buffered and written out when the buffer fills,
+// complete under its name. Only the rolled files there are get renamed: the highest
+// index present is found when the writer is made and followed from then on, so a roll
+// costs one rename per file kept, however large `maxFileNum` is.
+// Bytes are buffered and written out when the buffer fills,
 // after every line at level error or more severe, on Flush, and otherwise about
 // `flushIntervalMs` after they were written (checked every half interval by one
 // process-wide thread). Reopen (the manager's, after an outside rotation renamed the
