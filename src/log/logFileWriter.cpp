@@ -15,6 +15,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <map>
+#include <set>
 #include <thread>
 #include <vector>
 
@@ -31,7 +32,9 @@ using Clock = std::chrono::steady_clock;
 class LogFileWriterImpl;
 
 // Wakes every half of the shortest interval of its writers and writes out each buffer
-// that has waited its writer's interval. Its lock comes before a writer's lock.
+// that has waited its writer's interval. Writers are flushed outside its lock, so that
+// making or destroying a writer never waits behind a slow disk; Remove waits only while
+// the writer being removed is being flushed.
 class LogFileFlusher {
 public:
    static LogFileFlusher& Instance() {
@@ -56,18 +59,26 @@ public:
    }
 
    void Remove(LogFileWriterImpl* writer) {
-      std::lock_guard<std::mutex> lock(_mutex);
+      std::unique_lock<std::mutex> lock(_mutex);
       _writers.erase(writer);
+      _idle.wait(lock, [&] { return _flushing.count(writer) == 0; });
    }
 
    void FlushAll();
 
 private:
    void Run();
+   // Calls `flush` on each writer present now, with the lock released; `lock` holds
+   // _mutex on entry and on return.
+   template <class Flush>
+   void ForEachUnlocked(std::unique_lock<std::mutex>& lock, Flush flush);
 
    std::mutex _mutex;
    std::condition_variable _wake;
+   std::condition_variable _idle;  // _flushing changed
    std::map<LogFileWriterImpl*, int> _writers;
+   // Writers being flushed now: by the thread, and at exit by FlushAll as well.
+   std::multiset<LogFileWriterImpl*> _flushing;
    bool _started = false;
 };
 
@@ -289,9 +300,25 @@ private:
    std::atomic<uint64_t> _lost{0};
 };
 
+template <class Flush>
+void LogFileFlusher::ForEachUnlocked(std::unique_lock<std::mutex>& lock, Flush flush) {
+   std::vector<LogFileWriterImpl*> writers;
+   for (auto& [writer, interval] : _writers) writers.push_back(writer);
+   for (LogFileWriterImpl* writer : writers) {
+      // Removed meanwhile (and perhaps destroyed): skip it.
+      if (_writers.count(writer) == 0) continue;
+      auto flushing = _flushing.insert(writer);
+      lock.unlock();
+      flush(writer);
+      lock.lock();
+      _flushing.erase(flushing);
+      _idle.notify_all();
+   }
+}
+
 void LogFileFlusher::FlushAll() {
-   std::lock_guard<std::mutex> lock(_mutex);
-   for (auto& [writer, interval] : _writers) writer->Flush();
+   std::unique_lock<std::mutex> lock(_mutex);
+   ForEachUnlocked(lock, [](LogFileWriterImpl* writer) { writer->Flush(); });
 }
 
 void LogFileFlusher::Run() {
@@ -307,7 +334,7 @@ void LogFileFlusher::Run() {
       }
       _wake.wait_for(lock, std::chrono::milliseconds(std::max(1, shortest / 2)));
       Clock::time_point now = Clock::now();
-      for (auto& [writer, interval] : _writers) writer->FlushIfDue(now);
+      ForEachUnlocked(lock, [now](LogFileWriterImpl* writer) { writer->FlushIfDue(now); });
    }
 }
 

@@ -9,9 +9,11 @@
 
 #include <atomic>
 #include <chrono>
+#include <condition_variable>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <mutex>
 #include <regex>
 #include <sstream>
 #include <string>
@@ -21,6 +23,7 @@
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service.h"
 #include "src/log/logImpl.h"
+#include "tests/support/watchdog.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
@@ -88,22 +91,35 @@ struct SyslogReceiver {
    int fd = -1;
 };
 
-// The open and rename steps of file writers made with Ops(): a test makes opens fail or
-// counts renames.
+// The open, write and rename steps of file writers made with Ops(): a test makes opens
+// fail, counts renames, or holds writes until it lets them go.
 struct FileOps {
    static inline std::atomic<bool> failOpen{false};
    static inline std::atomic<int> renames{0};
+   static inline std::mutex mutex;
+   static inline std::condition_variable changed;
+   static inline bool holdWrites = false;
+   static inline bool writeHeld = false;
 
    static int Open(const char* path, int flags, mode_t mode) {
       if (failOpen) return errno = EMFILE, -1;
       return ::open(path, flags, mode);
+   }
+   static ssize_t Write(int fd, const void* data, size_t length) {
+      std::unique_lock<std::mutex> lock(mutex);
+      if (holdWrites) {
+         writeHeld = true;
+         changed.notify_all();
+         changed.wait(lock, [] { return !holdWrites; });
+      }
+      return ::write(fd, data, length);
    }
    static int Rename(const char* from, const char* to) {
       ++renames;
       return ::rename(from, to);
    }
    static const LogFileOps& Ops() {
-      static const LogFileOps ops{Open, ::write, Rename};
+      static const LogFileOps ops{Open, Write, Rename};
       return ops;
    }
 };
@@ -273,6 +289,52 @@ TEST(LogFileWriterTest, RollRenamesOnlyTheRolledFilesThereAre) {
       EXPECT_NE(rolled.find("] line " + std::to_string(i)), std::string::npos) << i;
    }
    EXPECT_FALSE(fs::exists(options.path + ".6"));
+}
+
+TEST(LogFileWriterTest, SlowDiskUnderTheFlusherHoldsUpOnlyItsOwnWriter) {
+   Files f;
+   LogFileOptions options;
+   options.flushIntervalMs = 10;
+   f.AddFile(options, "slow.log", FileOps::Ops());
+   {
+      std::lock_guard<std::mutex> lock(FileOps::mutex);
+      FileOps::holdWrites = true;
+      FileOps::writeHeld = false;
+   }
+   PELMORA_LOG_INFO(f.logger.Get(), "buffered");  // the flusher writes it, and is held
+   {
+      Pelmora::Testing::Watchdog watchdog("the flusher to write");
+      std::unique_lock<std::mutex> lock(FileOps::mutex);
+      FileOps::changed.wait(lock, [] { return FileOps::writeHeld; });
+   }
+   // Making and destroying another file writer does not wait for that write.
+   std::mutex mutex;
+   std::condition_variable doneChanged;
+   bool done = false;
+   std::thread other([&] {
+      LogFileOptions otherOptions;
+      otherOptions.path = f.dir + "/other.log";
+      Ref<LogWriter> writer;
+      CreateFileLogWriter("other", otherOptions, writer);
+      writer.Reset();
+      std::lock_guard<std::mutex> lock(mutex);
+      done = true;
+      doneChanged.notify_all();
+   });
+   bool finished;
+   {
+      std::unique_lock<std::mutex> lock(mutex);
+      finished = doneChanged.wait_for(lock, std::chrono::seconds(2), [&] { return done; });
+   }
+   EXPECT_TRUE(finished);
+   {
+      std::lock_guard<std::mutex> lock(FileOps::mutex);
+      FileOps::holdWrites = false;
+   }
+   FileOps::changed.notify_all();
+   Pelmora::Testing::Join(other, "the other writer to come and go");
+   f.logger->GetLogManager()->Flush();
+   EXPECT_NE(ReadFile(options.path).find("] buffered\n"), std::string::npos);
 }
 
 TEST(LogSyslogWriterTest, LinesArriveWithTheirPriorityAndSurviveTheSocketGoingAway) {

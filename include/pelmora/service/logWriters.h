@@ -19,12 +19,13 @@ namespace Pelmora::Service {
 // a line is never split across files. Each rename is atomic, so a rolled file is always
 // complete under its name. Only the rolled files there are get renamed: the highest
 // index present is found when the writer is made and followed from then on, so a roll
-// costs one rename per file kept, however large `maxFileNum` is.
-// Bytes are buffered and written out when the buffer fills,
-// after every line at level error or more severe, on Flush, and otherwise about
-// `flushIntervalMs` after they were written (checked every half interval by one
-// process-wide thread). Reopen (the manager's, after an outside rotation renamed the
-// file) writes the buffer to the old file and opens `path` anew.
+// costs one rename per file kept, however large `maxFileNum` is. Bytes are buffered and
+// written out when the buffer fills, after every line at level error or more severe, on
+// Flush, and otherwise about `flushIntervalMs` after they were written (checked every
+// half interval by one process-wide thread, which writes outside the lock that making
+// and destroying file writers take, so a slow disk holds up only its own writer).
+// Reopen (the manager's, after an outside rotation renamed the file) writes the buffer
+// to the old file and opens `path` anew.
 // When `path` cannot be opened again (after a roll or Reopen; out of descriptors, say),
 // nothing is renamed until an open succeeds: the rolled files stay as they are, new lines
 // are held in memory, up to `maxHeldBytes`, and later ones dropped and counted; the open
