@@ -110,11 +110,11 @@ public:
    }
 
    System::NativeMutex mutex;  // the meter
-   Meter meter;
+   Meter meter PELMORA_GUARDED_BY(mutex);
 
    System::NativeMutex publishMutex;  // the rest; taken before the registry's lock
-   bool visible[Meter::kCounterCount] = {true, true, true, true, true};
-   Ref<RegistryItem> item;
+   bool visible[Meter::kCounterCount] PELMORA_GUARDED_BY(publishMutex) = {true, true, true, true, true};
+   Ref<RegistryItem> item PELMORA_GUARDED_BY(publishMutex);
 };
 
 MeterAccumulator::MeterAccumulator(Registry* registry, const std::string& name)

@@ -97,7 +97,7 @@ private:
    const std::string _key;
    const Ref<AccumulatorCore> _core;
    mutable System::NativeMutex _publishMutex;  // taken before the registry's lock
-   Ref<RegistryItem> _item;
+   Ref<RegistryItem> _item PELMORA_GUARDED_BY(_publishMutex);
 };
 
 // Orders published accumulators by key and finds them by a key alone.
@@ -292,11 +292,11 @@ private:
 
    Registry* const _registry;
    System::NativeMutex _mutex;
-   std::set<Ref<PublishedAccumulatorImpl>, ByKey> _accumulators;
-   int _keyLimit = kDefaultPublishedKeyLimit;
-   long long _refusedCount = 0;
+   std::set<Ref<PublishedAccumulatorImpl>, ByKey> _accumulators PELMORA_GUARDED_BY(_mutex);
+   int _keyLimit PELMORA_GUARDED_BY(_mutex) = kDefaultPublishedKeyLimit;
+   long long _refusedCount PELMORA_GUARDED_BY(_mutex) = 0;
    // Set when the limit refused a key and was logged; cleared when a new key fits again.
-   bool _limitLogged = false;
+   bool _limitLogged PELMORA_GUARDED_BY(_mutex) = false;
 };
 
 // The calling thread's builder and how deep its TlsScopes are nested.

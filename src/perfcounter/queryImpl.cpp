@@ -150,7 +150,7 @@ public:
 
 protected:
    bool Matches(const std::string& name) const override { return _names.count(name) != 0; }
-   void SelectFromTree() override {
+   void SelectFromTree() PELMORA_REQUIRES(_mutex) override {
       for (const std::string& name : _names) {
          CounterNode* node = _registry->FindNode(name);
          if (node && node->group) Select(node);
@@ -180,8 +180,9 @@ public:
 protected:
    // A search: the pattern may match anywhere in the name.
    bool Matches(const std::string& name) const override { return boost::regex_search(name, _regex); }
-   void SelectFromTree() override {
-      _registry->ForEachCounter([this](CounterNode* node) {
+   void SelectFromTree() PELMORA_REQUIRES(_mutex) override {
+      // The visitor runs within this call, under the lock the analysis cannot see it hold.
+      _registry->ForEachCounter([this](CounterNode* node) PELMORA_NO_THREAD_SAFETY_ANALYSIS {
          if (Matches(node->GetMetadata()->GetName())) Select(node);
       });
    }

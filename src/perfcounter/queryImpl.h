@@ -40,13 +40,15 @@ public:
 protected:
    virtual bool Matches(const std::string& name) const = 0;
    // Adds every matching counter of the tree; the registry is locked.
-   virtual void SelectFromTree() = 0;
+   virtual void SelectFromTree() PELMORA_REQUIRES(_mutex) = 0;
    virtual std::string DescribeCriteria() const = 0;
 
    // Adds one counter node to the selection.
-   void Select(CounterNode* node);
+   void Select(CounterNode* node) PELMORA_REQUIRES(_mutex);
 
    RegistryImpl* const _registry;
+   // Guards the state and the selection; subclasses select under it.
+   mutable System::NativeMutex _mutex;
 
 private:
    struct Selected {
@@ -55,13 +57,12 @@ private:
       std::vector<int> indices;  // ascending: the group's order
    };
 
-   void Compile();
+   void Compile() PELMORA_REQUIRES(_mutex);
 
-   mutable System::NativeMutex _mutex;
-   State _state = UNINITIALIZED;
-   bool _trackNewCounters = true;
-   bool _sortByName = false;
-   std::map<uint64_t, Selected> _selection;  // by group sequence: registration order
+   State _state PELMORA_GUARDED_BY(_mutex) = UNINITIALIZED;
+   bool _trackNewCounters PELMORA_GUARDED_BY(_mutex) = true;
+   bool _sortByName PELMORA_GUARDED_BY(_mutex) = false;
+   std::map<uint64_t, Selected> _selection PELMORA_GUARDED_BY(_mutex);  // by group sequence: registration order
 };
 
 }  // namespace Pelmora::PerfCounter

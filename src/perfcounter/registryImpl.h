@@ -144,7 +144,7 @@ private:
    // Queries are added under the read lock, so the list has a mutex of its own; they are
    // told of changes under the write lock.
    mutable System::NativeMutex _queriesMutex;
-   std::set<QueryImpl*> _queries;
+   std::set<QueryImpl*> _queries PELMORA_GUARDED_BY(_queriesMutex);
 };
 
 }  // namespace Pelmora::PerfCounter
