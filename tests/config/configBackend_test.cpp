@@ -22,9 +22,11 @@
 #include "pelmora/service/config.h"
 #include "src/config/configBackend.h"
 #include "src/config/configBase.h"
+#include "tests/support/configViews.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
+using namespace Pelmora::TestSupport;
 
 namespace {
 
@@ -37,16 +39,6 @@ std::string ReadFile(const std::string& path) {
    return s.str();
 }
 bool Exists(const std::string& path) { return access(path.c_str(), F_OK) == 0; }
-
-Ref<Config::View> MainView(Config* config) {
-   Ref<Config::View> view;
-   config->GetMainView(view);
-   return view;
-}
-std::string Text(Config* config, const std::string& path) {
-   std::string value;
-   return MainView(config)->Get(path, &value) ? value : "<absent>";
-}
 
 // The text of the E that `f` raises.
 template <class E, class F>
@@ -553,4 +545,23 @@ TEST_F(ConfigFileTest, KilledWriterLeavesTheOldOrTheNewFile) {
    CreateXmlFileConfig(path, 1 << 20, 0, reread);
    std::string last = Text(reread.Get(), "item[1499]");
    EXPECT_TRUE(last == "first" || last == "second") << last;
+}
+
+TEST(ConfigStringTest, StringRefreshFollowsTheCallersTextAndScratchHasNoSource) {
+   std::string text = "a = \"1\"\n";
+   Ref<Config> config;
+   CreateFlatStringConfig(text, config);
+   EXPECT_FALSE(config->Refresh());
+   MainView(config.Get())->Set("b", "2");
+   text = "a = \"3\"\n";
+   EXPECT_TRUE(config->Refresh());
+   EXPECT_EQ(Text(config.Get(), "a"), "3");
+   EXPECT_EQ(Text(config.Get(), "b"), "<absent>");  // unsaved changes give way
+   EXPECT_FALSE(config->IsDirty());
+   EXPECT_FALSE(config->Refresh());
+
+   CreateScratchConfig(config);
+   EXPECT_THROW(config->Load(), NotSupportedException);
+   EXPECT_THROW(config->Flush(), NotSupportedException);
+   EXPECT_FALSE(config->Refresh());
 }

@@ -1,4 +1,5 @@
-// The three syntaxes: exact reading and writing rules, round trips, malformed input.
+// The flat syntax, and the rules every syntax shares checked against each: exact reading
+// and writing, round trips, malformed input, trees a syntax cannot hold.
 
 #include <string>
 #include <tuple>
@@ -9,36 +10,11 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/config.h"
+#include "tests/support/configViews.h"
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
-
-namespace {
-
-Ref<Config::View> MainView(Config* config) {
-   Ref<Config::View> view;
-   config->GetMainView(view);
-   return view;
-}
-
-std::string Text(Config* config, const std::string& path) {
-   std::string value;
-   return MainView(config)->Get(path, &value) ? value : "<absent>";
-}
-
-using StringFactory = void (*)(std::string&, Ref<Config>&);
-
-std::string ParseError(StringFactory factory, std::string text) {
-   Ref<Config> config;
-   try {
-      factory(text, config);
-   } catch (const FileFormatException& e) {
-      return e.what();
-   }
-   return "no exception";
-}
-
-}  // namespace
+using namespace Pelmora::TestSupport;
 
 TEST(ConfigSyntaxTest, OneTreeRoundTripsThroughEverySyntax) {
    // Ids, nesting, awkward values and many siblings.
@@ -112,37 +88,6 @@ TEST(ConfigSyntaxTest, MalformedTextRaisesFileFormatException) {
    EXPECT_EQ(Text(config.Get(), "a"), "z");
 }
 
-TEST(ConfigSyntaxTest, XmlValuesAreTrimmedUnlessQuotedAndTheRootKeepsItsTag) {
-   std::string xml =
-       "<?xml version=\"1.0\"?>\n<settings>\n  <!-- comment -->\n"
-       "  <log>\n    <level>\n      info\n    </level>\n    <name>\"  spaced  \"</name>\n"
-       "    <one>\"</one>\n    <cdata><![CDATA[ <raw> ]]></cdata>\n  </log>\n"
-       "  <level id=\"0001\"><logName>http</logName></level>\n  <empty/>\n</settings>\n";
-   Ref<Config> config, reread;
-   CreateXmlStringConfig(xml, config);
-   const std::pair<const char*, const char*> read[] = {
-       {"log/level", "info"}, {"log/name", "  spaced  "},         {"log/one", "\""},
-       {"log/cdata", "<raw>"}, {"level[0001]/logName", "http"}, {"empty", ""}};
-   for (auto& [path, value] : read) EXPECT_EQ(Text(config.Get(), path), value) << path;
-
-   // Values that trimming would change are written quoted, and read back whole.
-   const std::string values[] = {"  two leading, one trailing ", "\"wrapped\"", "\"", "\tx\n",
-                                 "inner \"quotes\" stay", "\r\n", "line\r\nbreaks"};
-   for (size_t i = 0; i < std::size(values); ++i) {
-      MainView(config.Get())->Set("v[" + std::to_string(i) + "]", values[i]);
-   }
-   config->Flush();
-   for (const char* written :
-        {"<settings>", "<level id=\"0001\">", "<v id=\"0\">\"  two leading, one trailing \"</v>",
-         "<v id=\"1\">\"\"wrapped\"\"</v>", "<v id=\"4\">inner \"quotes\" stay</v>"}) {
-      EXPECT_NE(xml.find(written), std::string::npos) << written << "\n" << xml;
-   }
-   CreateXmlStringConfig(xml, reread);
-   for (size_t i = 0; i < std::size(values); ++i) {
-      EXPECT_EQ(Text(reread.Get(), "v[" + std::to_string(i) + "]"), values[i]) << i;
-   }
-}
-
 TEST(ConfigSyntaxTest, DeepNestingIsRefused) {
    std::string open, close, key;
    for (int i = 0; i <= kConfigMaxDepth + 1; ++i) open += "<a>", close += "</a>";
@@ -173,39 +118,4 @@ TEST(ConfigSyntaxTest, TreesASyntaxCannotHoldAreRefusedAndTheTextKept) {
       MainView(config.Get())->Unset(setting.first);
       config->Flush();  // the rest of the tree still writes
    }
-}
-
-// Found by fuzzing: an empty root written and read again must write the same text.
-TEST(ConfigSyntaxTest, EmptyXmlTextIsAnEmptyConfiguration) {
-   std::string xml = " \n";
-   Ref<Config> config, reread;
-   CreateXmlStringConfig(xml, config);
-   config->Flush();
-   EXPECT_EQ(xml, "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<config/>\n");
-   std::string again = xml;
-   CreateXmlStringConfig(again, reread);
-   reread->Flush();
-   EXPECT_EQ(again, xml);
-   MainView(config.Get())->Set("a", "1");
-   config->Flush();
-   EXPECT_EQ(xml, "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<config>\n  <a>1</a>\n</config>\n");
-}
-
-TEST(ConfigSyntaxTest, StringRefreshFollowsTheCallersTextAndScratchHasNoSource) {
-   std::string text = "a = \"1\"\n";
-   Ref<Config> config;
-   CreateFlatStringConfig(text, config);
-   EXPECT_FALSE(config->Refresh());
-   MainView(config.Get())->Set("b", "2");
-   text = "a = \"3\"\n";
-   EXPECT_TRUE(config->Refresh());
-   EXPECT_EQ(Text(config.Get(), "a"), "3");
-   EXPECT_EQ(Text(config.Get(), "b"), "<absent>");  // unsaved changes give way
-   EXPECT_FALSE(config->IsDirty());
-   EXPECT_FALSE(config->Refresh());
-
-   CreateScratchConfig(config);
-   EXPECT_THROW(config->Load(), NotSupportedException);
-   EXPECT_THROW(config->Flush(), NotSupportedException);
-   EXPECT_FALSE(config->Refresh());
 }
