@@ -7,6 +7,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -35,6 +36,8 @@ Logger::LogLevel HighestLevel(Logger::CombinedLevel level) {
    return static_cast<Logger::LogLevel>(1u << (31 - __builtin_clz(low)));
 }
 
+bool IsContinuationByte(char c) { return (static_cast<unsigned char>(c) & 0xC0) == 0x80; }
+
 class SyslogLogWriterImpl : public LogWriterImpl, public virtual SyslogLogWriter {
 public:
    SyslogLogWriterImpl(const LogSyslogOptions& options, Logger::CombinedLevel mask)
@@ -61,35 +64,78 @@ public:
 
 protected:
    void WriteLocked(Logger::CombinedLevel level, const char* data, int length) override {
-      if (_line.empty()) _lineLevel = level;
-      _line.append(data, static_cast<size_t>(length));
-      if (_line.back() != '\n') return;
-      _line.pop_back();
+      if (!_inLine) BeginMessage(level);
+      bool endsLine = data[length - 1] == '\n';
+      if (!_cut) AppendCut(data, static_cast<size_t>(length) - (endsLine ? 1 : 0));
+      if (!endsLine) return;
+      _inLine = false;
       Send();
-      _line.clear();
+      // One huge line (with a large maxMessageSize) must not stay resident.
+      if (_message.capacity() > static_cast<size_t>(std::max(0, _options.keepBufferBytes))) {
+         std::string().swap(_message);
+      }
    }
 
    void FlushLocked() override {}
    void CloseLocked() override { Disconnect(); }
 
 private:
-   void Send() {
+   void BeginMessage(Logger::CombinedLevel level) {
+      _inLine = true;
+      _cut = false;
       char head[128];
       time_t now = time(nullptr);
       struct tm local;
       localtime_r(&now, &local);
-      int priority = _options.facility | GetSyslogSeverity(HighestLevel(_lineLevel));
+      int priority = _options.facility | GetSyslogSeverity(HighestLevel(level));
       int n = snprintf(head, sizeof(head), "<%d>%s %2d %02d:%02d:%02d %s[%d]: ", priority,
                        kMonths[local.tm_mon % 12], local.tm_mday, local.tm_hour, local.tm_min,
                        local.tm_sec, _options.ident.c_str(), static_cast<int>(getpid()));
-      if (n < 0) return;
+      if (n < 0) n = 0;
       if (n >= static_cast<int>(sizeof(head))) n = sizeof(head) - 1;
       _message.assign(head, static_cast<size_t>(n));
-      _message += _line;
-      if (_message.size() > static_cast<size_t>(_options.maxMessageSize)) {
-         _message.resize(static_cast<size_t>(_options.maxMessageSize));
-         _truncated.fetch_add(1, std::memory_order_relaxed);
+      _headerSize = _message.size();
+   }
+
+   // Appends what still fits of the line's maxMessageSize bytes; the cut never splits a
+   // UTF-8 character, and the rest of the line is not kept at all.
+   void AppendCut(const char* data, size_t length) {
+      size_t room = _headerSize + static_cast<size_t>(_options.maxMessageSize) - _message.size();
+      if (length <= room) {
+         _message.append(data, length);
+         return;
       }
+      _cut = true;
+      _truncated.fetch_add(1, std::memory_order_relaxed);
+      // data[room] is the first byte left out: when it continues a character, the cut
+      // goes back to that character's first byte.
+      size_t take = room;
+      if (IsContinuationByte(data[room])) {
+         size_t first = room;
+         while (first > 0 && room - first < 3 && IsContinuationByte(data[first - 1])) --first;
+         if (first == 0) {
+            take = 0;
+            DropPartialCharacter();  // it began in an earlier piece
+         } else if (static_cast<unsigned char>(data[first - 1]) >= 0xC0) {
+            take = first - 1;
+         }
+      }
+      _message.append(data, take);
+   }
+
+   // Removes a character whose first bytes end the message.
+   void DropPartialCharacter() {
+      size_t end = _message.size();
+      size_t start = end;
+      while (start > _headerSize && end - start < 3 && IsContinuationByte(_message[start - 1])) {
+         --start;
+      }
+      if (start > _headerSize && static_cast<unsigned char>(_message[start - 1]) >= 0xC0) {
+         _message.resize(start - 1);
+      }
+   }
+
+   void Send() {
       if (_fd < 0 && !Connect()) {
          _lost.fetch_add(1, std::memory_order_relaxed);
          return;
@@ -143,9 +189,11 @@ private:
    LogSyslogOptions _options;
    int _fd = -1;
    Clock::time_point _nextAttempt;
-   std::string _line;
+   // The datagram being built: the header, then the line as far as it fits.
    std::string _message;
-   Logger::CombinedLevel _lineLevel = 0;
+   size_t _headerSize = 0;
+   bool _inLine = false;
+   bool _cut = false;
    std::atomic<uint64_t> _lost{0};
    std::atomic<uint64_t> _truncated{0};
 };

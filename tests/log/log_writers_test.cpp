@@ -3,6 +3,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <malloc.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -82,14 +83,20 @@ struct SyslogReceiver {
       fd = -1;
       unlink(path.c_str());
    }
-   std::string Receive() {
+   std::string Receive(int flags = 0) {
       char buffer[16384];
-      ssize_t n = recv(fd, buffer, sizeof(buffer), 0);
+      ssize_t n = recv(fd, buffer, sizeof(buffer), flags);
       return n < 0 ? std::string("<nothing>") : std::string(buffer, static_cast<size_t>(n));
    }
    std::string path;
    int fd = -1;
 };
+
+// The text of a syslog datagram after its header.
+std::string SyslogLine(const std::string& message) {
+   size_t end = message.find("]: ");
+   return end == std::string::npos ? message : message.substr(end + 3);
+}
 
 // The open, write and rename steps of file writers made with Ops(): a test makes opens
 // fail, counts renames, or holds writes until it lets them go.
@@ -123,6 +130,24 @@ struct FileOps {
       return ops;
    }
 };
+
+bool IsValidUtf8(const std::string& text) {
+   for (size_t i = 0; i < text.size();) {
+      auto byte = static_cast<unsigned char>(text[i]);
+      size_t length = byte < 0x80 ? 1 : byte >= 0xF0 ? 4 : byte >= 0xE0 ? 3 : byte >= 0xC0 ? 2 : 0;
+      if (length == 0 || i + length > text.size()) return false;
+      for (size_t k = 1; k < length; ++k) {
+         if ((static_cast<unsigned char>(text[i + k]) & 0xC0) != 0x80) return false;
+      }
+      i += length;
+   }
+   return true;
+}
+
+size_t HeapInUse() {
+   struct mallinfo2 info = mallinfo2();
+   return info.uordblks + info.hblkhd;
+}
 
 }  // namespace
 
@@ -363,7 +388,7 @@ TEST(LogSyslogWriterTest, LinesArriveWithTheirPriorityAndSurviveTheSocketGoingAw
    PELMORA_LOG_TRIVIA(f.logger.Get(), "%1", std::string(500, 'z'));
    message = receiver.Receive();
    EXPECT_EQ(message.substr(0, 4), "<31>");
-   EXPECT_EQ(message.size(), 200u);
+   EXPECT_EQ(SyslogLine(message).size(), 200u);
    EXPECT_EQ(writer->GetTruncatedCount(), 1u);
 
    receiver.Unbind();
@@ -379,4 +404,73 @@ TEST(LogSyslogWriterTest, LinesArriveWithTheirPriorityAndSurviveTheSocketGoingAw
    EXPECT_EQ(GetSyslogSeverity(Logger::LOG_QUIET), 5);
    EXPECT_EQ(GetSyslogSeverity(Logger::LOG_PANIC), 2);
    EXPECT_EQ(GetSyslogSeverity(Logger::LOG_VERBOSE), 7);
+}
+
+TEST(LogSyslogWriterTest, LongLinesAreCutToTheLineLimitAtACharacterBoundaryAndNotKept) {
+   Files f;
+   LogSyslogOptions options;
+   options.socketPath = f.dir + "/log";
+   SyslogReceiver receiver(options.socketPath);
+   auto send = [&](int maxMessageSize, auto&& log) {
+      options.maxMessageSize = maxMessageSize;
+      Ref<SyslogLogWriter> writer;
+      CreateSyslogLogWriter("syslog", options, writer);
+      f.logger->GetLogOutput()->AddWriter("syslog", writer.Get());
+      log();
+      Ref<LogWriter> removed;
+      f.logger->GetLogOutput()->RemoveWriter("syslog", removed);
+      return std::make_pair(SyslogLine(receiver.Receive()), writer->GetTruncatedCount());
+   };
+   std::string full = send(8192, [&] { PELMORA_LOG_INFO(f.logger.Get(), "%1", "x"); }).first;
+   size_t prefix = full.size() - 1;
+
+   // Two-, three- and four-byte characters, cut at every offset of each (64 is the least
+   // limit taken; a prefix is about 50 bytes).
+   std::string text;
+   for (int i = 0; i < 10; ++i) text += "a\xC3\xA9\xE2\x82\xAC\xF0\x9D\x84\x9E";
+   ASSERT_LT(prefix, 64u);
+   for (size_t size = 64; size < 84; ++size) {
+      auto [line, cuts] = send(static_cast<int>(size),
+                               [&] { PELMORA_LOG_INFO(f.logger.Get(), "%1", text); });
+      EXPECT_TRUE(IsValidUtf8(line)) << size;
+      EXPECT_LE(line.size(), size);
+      EXPECT_GT(line.size() + 4, size);
+      size_t body = std::min(prefix, line.size());
+      EXPECT_EQ(line.substr(body), text.substr(0, line.size() - body));
+      EXPECT_EQ(cuts, 1u);
+   }
+
+   // A character split between two pieces of a line, with the limit right between them.
+   std::string first = std::string(1499, 'p') + "\xE2";
+   std::string second = "\x82\xAC" + std::string(1500, 'q');
+   auto [line, cuts] = send(static_cast<int>(prefix + first.size()), [&] {
+      f.logger->Begin(Logger::LOG_INFO);
+      f.logger->Write(first);
+      f.logger->Write(second);
+      f.logger->End();
+   });
+   EXPECT_EQ(line.substr(std::min(prefix, line.size())), std::string(1499, 'p'));
+   EXPECT_EQ(cuts, 1u);
+
+   // A huge line is cut while it arrives, and its size is not kept afterwards.
+   options.maxMessageSize = 8192;
+   Ref<SyslogLogWriter> writer;
+   CreateSyslogLogWriter("syslog", options, writer);
+   f.logger->GetLogOutput()->AddWriter("syslog", writer.Get());
+   size_t before = HeapInUse();
+   PELMORA_LOG_INFO(f.logger.Get(), "%1", std::string(8 << 20, 'h'));
+   EXPECT_LT(HeapInUse(), before + (1 << 20));
+   EXPECT_EQ(SyslogLine(receiver.Receive()).size(), 8192u);
+   EXPECT_EQ(writer->GetTruncatedCount(), 1u);
+   // With a large limit, the room one long line needed is given back after it.
+   Ref<LogWriter> removed;
+   f.logger->GetLogOutput()->RemoveWriter("syslog", removed);
+   options.maxMessageSize = 200000;
+   CreateSyslogLogWriter("syslog", options, writer);
+   f.logger->GetLogOutput()->AddWriter("syslog", writer.Get());
+   before = HeapInUse();
+   PELMORA_LOG_INFO(f.logger.Get(), "%1", std::string(150000, 'l'));
+   EXPECT_LT(HeapInUse(), before + 65536);
+   EXPECT_NE(receiver.Receive().find("] lll"), std::string::npos);
+   EXPECT_EQ(writer->GetTruncatedCount() + writer->GetLostCount(), 0u);
 }

@@ -62,15 +62,18 @@ PELMORA_EXPORT void CreateConsoleLogWriter(const std::string& name, const std::s
 // "<priority>Mmm dd hh:mm:ss ident[pid]: line" to a local datagram socket. The socket
 // need not exist: a line that cannot be sent is dropped and counted, never waited for,
 // and the writer connects again on the next line (at most once per
-// `reconnectIntervalMs`). Priorities: quiet -> notice, panic -> crit, error -> err,
-// warning -> warning, info -> info, verbose and trivia -> debug; with the facility.
+// `reconnectIntervalMs`). A line longer than `maxMessageSize` bytes (the line, without
+// the syslog header and the newline) is cut to fit at a UTF-8 character boundary.
+// Priorities: quiet -> notice, panic -> crit, error -> err, warning -> warning, info ->
+// info, verbose and trivia -> debug; with the facility.
 struct PELMORA_EXPORT LogSyslogOptions {
    std::string socketPath = "/dev/log";
    std::string ident;               // empty: the program's name
    std::string level = "info";
    int facility = 3 << 3;           // daemon
-   int maxMessageSize = 8192;       // longer lines are cut to this many bytes
+   int maxMessageSize = 8192;       // bytes of a line kept; at least 64
    int reconnectIntervalMs = 1000;
+   int keepBufferBytes = 16384;     // capacity kept between lines; more is released
 };
 class PELMORA_EXPORT SyslogLogWriter : public virtual LogWriter {
 public:
