@@ -1,7 +1,8 @@
-// The syslog writer: one datagram per line in the local syslog format, sent without
-// waiting over a local datagram socket that may come and go.
+// The syslog writer: one datagram per line in the local syslog format over a local
+// datagram socket that may come and go, waiting a bounded time when it is full.
 
 #include <fcntl.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <time.h>
@@ -12,6 +13,7 @@
 #include <chrono>
 #include <cstdio>
 #include <cstring>
+#include <optional>
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/logWriters.h"
@@ -44,6 +46,8 @@ public:
       : LogWriterImpl(nullptr, mask, false), _options(options) {
       if (_options.ident.empty()) _options.ident = program_invocation_short_name;
       if (_options.maxMessageSize < 64) _options.maxMessageSize = 64;
+      if (_options.sendTimeoutMs < 0) _options.sendTimeoutMs = 0;
+      if (_options.sendWaitBudgetMs < 0) _options.sendWaitBudgetMs = 0;
       Connect();
    }
 
@@ -140,14 +144,58 @@ private:
          _lost.fetch_add(1, std::memory_order_relaxed);
          return;
       }
-      if (SendOnce()) return;
-      int error = errno;
-      if (error != EAGAIN && error != EWOULDBLOCK && error != ENOBUFS) {
+      std::optional<Clock::time_point> deadline;  // from the first time the socket is full
+      bool reconnected = false;
+      for (;;) {
+         if (SendOnce()) {
+            _stalled = false;
+            return;
+         }
+         int error = errno;
+         if (error == EAGAIN || error == EWOULDBLOCK || error == ENOBUFS) {
+            if (!deadline) {
+               deadline = Clock::now() + std::chrono::milliseconds(_options.sendTimeoutMs);
+            }
+            if (WaitForRoom(*deadline)) continue;
+            break;
+         }
          // The receiver went away (restarted, socket replaced): connect anew once.
+         if (reconnected) break;
+         reconnected = true;
          Disconnect();
-         if (Connect(true) && SendOnce()) return;
+         if (!Connect(true)) break;
       }
       _lost.fetch_add(1, std::memory_order_relaxed);
+   }
+
+   // Waits until the socket takes a datagram again, the line's deadline passes or the
+   // budget of the current second is spent. A deadline passed in vain marks the receiver
+   // as stopped, and nothing is waited for until a line gets through.
+   bool WaitForRoom(Clock::time_point deadline) {
+      if (_stalled) return false;
+      Clock::time_point now = Clock::now();
+      if (now - _windowStart >= std::chrono::seconds(1)) {
+         _windowStart = now;
+         _waitedInWindow = Clock::duration::zero();
+      }
+      Clock::duration budget =
+          std::chrono::milliseconds(_options.sendWaitBudgetMs) - _waitedInWindow;
+      Clock::duration wait = std::min(deadline - now, budget);
+      if (wait <= Clock::duration::zero()) {
+         if (deadline <= now) _stalled = true;
+         return false;
+      }
+      struct pollfd ready = {_fd, POLLOUT, 0};
+      auto waitNs = std::chrono::duration_cast<std::chrono::nanoseconds>(wait).count();
+      struct timespec timeout = {static_cast<time_t>(waitNs / 1000000000),
+                                 static_cast<long>(waitNs % 1000000000)};
+      int n = ppoll(&ready, 1, &timeout, nullptr);
+      Clock::time_point after = Clock::now();
+      _waitedInWindow += after - now;
+      if (n > 0) return true;
+      if (n < 0 && errno == EINTR) return true;  // try the send again
+      if (after >= deadline) _stalled = true;
+      return false;
    }
 
    bool SendOnce() {
@@ -194,6 +242,11 @@ private:
    size_t _headerSize = 0;
    bool _inLine = false;
    bool _cut = false;
+   // Waiting for a full socket: whether the receiver looks stopped, and the time waited
+   // in the second that began at _windowStart.
+   bool _stalled = false;
+   Clock::time_point _windowStart;
+   Clock::duration _waitedInWindow{};
    std::atomic<uint64_t> _lost{0};
    std::atomic<uint64_t> _truncated{0};
 };

@@ -88,8 +88,33 @@ struct SyslogReceiver {
       ssize_t n = recv(fd, buffer, sizeof(buffer), flags);
       return n < 0 ? std::string("<nothing>") : std::string(buffer, static_cast<size_t>(n));
    }
+   // Fills the receive queue from sockets of the test's own until a fresh one cannot
+   // send either (each sender's own buffer may fill before the queue does).
+   void Fill() {
+      for (int senders = 0; senders < 1000; ++senders) {
+         int sender = socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+         sockaddr_un address{};
+         address.sun_family = AF_UNIX;
+         strncpy(address.sun_path, path.c_str(), sizeof(address.sun_path) - 1);
+         ASSERT_EQ(connect(sender, reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
+         fillers.push_back(sender);
+         int sent = 0;
+         while (send(sender, "f", 1, MSG_DONTWAIT) == 1) ++sent;
+         if (sent == 0) return;
+      }
+      FAIL() << "the receive queue never filled";
+   }
+   // Reads what is queued without waiting.
+   int Drain() {
+      int n = 0;
+      while (Receive(MSG_DONTWAIT) != "<nothing>") ++n;
+      for (int filler : fillers) close(filler);
+      fillers.clear();
+      return n;
+   }
    std::string path;
    int fd = -1;
+   std::vector<int> fillers;
 };
 
 // The text of a syslog datagram after its header.
@@ -404,6 +429,79 @@ TEST(LogSyslogWriterTest, LinesArriveWithTheirPriorityAndSurviveTheSocketGoingAw
    EXPECT_EQ(GetSyslogSeverity(Logger::LOG_QUIET), 5);
    EXPECT_EQ(GetSyslogSeverity(Logger::LOG_PANIC), 2);
    EXPECT_EQ(GetSyslogSeverity(Logger::LOG_VERBOSE), 7);
+}
+
+TEST(LogSyslogWriterTest, FullSocketIsWaitedForWithinTheBoundsAndThenDropped) {
+   Files f;
+   LogSyslogOptions options;
+   options.socketPath = f.dir + "/log";
+   options.level = "trivia";
+   SyslogReceiver receiver(options.socketPath);
+   auto elapsedMs = [](std::chrono::steady_clock::time_point start) {
+      return std::chrono::duration_cast<std::chrono::milliseconds>(
+                 std::chrono::steady_clock::now() - start).count();
+   };
+   auto makeWriter = [&](int timeoutMs, int budgetMs) {
+      options.sendTimeoutMs = timeoutMs;
+      options.sendWaitBudgetMs = budgetMs;
+      Ref<SyslogLogWriter> writer;
+      CreateSyslogLogWriter("syslog", options, writer);
+      Ref<LogWriter> removed;
+      f.logger->GetLogOutput()->RemoveWriter("syslog", removed);
+      f.logger->GetLogOutput()->AddWriter("syslog", writer.Get());
+      return writer;
+   };
+
+   // A receiver slower than the burst: nothing lost, in order. The bounds are far off.
+   Ref<SyslogLogWriter> writer = makeWriter(10000, 10000);
+   constexpr int kBurst = 1000;
+   std::vector<std::string> received;
+   std::thread reader([&] {
+      for (int i = 0; i < kBurst; ++i) {
+         std::string message = receiver.Receive();
+         if (message == "<nothing>") break;  // two seconds without a line: some were lost
+         received.push_back(SyslogLine(message));
+         if (i % 10 == 0) std::this_thread::sleep_for(std::chrono::microseconds(200));
+      }
+   });
+   for (int i = 0; i < kBurst; ++i) PELMORA_LOG_INFO(f.logger.Get(), "burst %1", i);
+   Pelmora::Testing::Join(reader, "the slow reader");
+   EXPECT_EQ(writer->GetLostCount(), 0u);
+   ASSERT_EQ(received.size(), size_t(kBurst));
+   for (int i = 0; i < kBurst; ++i) {
+      ASSERT_NE(received[i].find("] burst " + std::to_string(i)), std::string::npos) << received[i];
+   }
+
+   // A receiver that never reads costs one bound, not one per line.
+   writer = makeWriter(50, 10000);
+   receiver.Fill();
+   auto start = std::chrono::steady_clock::now();
+   for (int i = 0; i < 40; ++i) PELMORA_LOG_INFO(f.logger.Get(), "unread %1", i);
+   EXPECT_LT(elapsedMs(start), 1000);  // 40 bounds would be 2000
+   EXPECT_EQ(writer->GetLostCount(), 40u);
+   // Once it reads again, lines get through (and are waited for) again.
+   receiver.Drain();
+   PELMORA_LOG_INFO(f.logger.Get(), "read again");
+   EXPECT_NE(receiver.Receive().find("] read again"), std::string::npos);
+   EXPECT_EQ(writer->GetLostCount(), 40u);
+
+   // A receiver that trickles costs at most the budget per second.
+   writer = makeWriter(1000, 100);
+   receiver.Fill();
+   std::atomic<bool> stop{false};
+   std::thread trickle([&] {
+      while (!stop) {
+         std::this_thread::sleep_for(std::chrono::milliseconds(50));
+         receiver.Receive(MSG_DONTWAIT);
+      }
+   });
+   start = std::chrono::steady_clock::now();
+   for (int i = 0; i < 20; ++i) PELMORA_LOG_INFO(f.logger.Get(), "trickle %1", i);
+   EXPECT_LT(elapsedMs(start), 600);  // a slot per 50 ms for each line would be 1000
+   EXPECT_GT(writer->GetLostCount(), 0u);
+   stop = true;
+   Pelmora::Testing::Join(trickle, "the trickling reader");
+   receiver.Drain();
 }
 
 TEST(LogSyslogWriterTest, LongLinesAreCutToTheLineLimitAtACharacterBoundaryAndNotKept) {

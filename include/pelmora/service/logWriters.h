@@ -60,12 +60,17 @@ PELMORA_EXPORT void CreateConsoleLogWriter(const std::string& name, const std::s
 
 // Sends each line as one datagram in the local syslog format
 // "<priority>Mmm dd hh:mm:ss ident[pid]: line" to a local datagram socket. The socket
-// need not exist: a line that cannot be sent is dropped and counted, never waited for,
+// need not exist: a line that cannot be sent for want of a socket is dropped and counted,
 // and the writer connects again on the next line (at most once per
-// `reconnectIntervalMs`). A line longer than `maxMessageSize` bytes (the line, without
-// the syslog header and the newline) is cut to fit at a UTF-8 character boundary.
-// Priorities: quiet -> notice, panic -> crit, error -> err, warning -> warning, info ->
-// info, verbose and trivia -> debug; with the facility.
+// `reconnectIntervalMs`). A full socket (the receiver is behind) is waited for, up to
+// `sendTimeoutMs` per line and `sendWaitBudgetMs` for all lines within any one second;
+// then the line is dropped and counted. A line that waited its whole `sendTimeoutMs` in
+// vain marks the receiver as stopped: later lines are not waited for until one gets
+// through, so a receiver that never reads costs one `sendTimeoutMs`.
+// A line longer than `maxMessageSize` bytes (the line, without the syslog header and
+// the newline) is cut to fit at a UTF-8 character boundary. Priorities: quiet -> notice,
+// panic -> crit, error -> err, warning -> warning, info -> info, verbose and trivia ->
+// debug; with the facility.
 struct PELMORA_EXPORT LogSyslogOptions {
    std::string socketPath = "/dev/log";
    std::string ident;               // empty: the program's name
@@ -73,11 +78,13 @@ struct PELMORA_EXPORT LogSyslogOptions {
    int facility = 3 << 3;           // daemon
    int maxMessageSize = 8192;       // bytes of a line kept; at least 64
    int reconnectIntervalMs = 1000;
+   int sendTimeoutMs = 100;         // the longest one line waits for a full socket
+   int sendWaitBudgetMs = 500;      // the longest all lines wait within one second
    int keepBufferBytes = 16384;     // capacity kept between lines; more is released
 };
 class PELMORA_EXPORT SyslogLogWriter : public virtual LogWriter {
 public:
-   // Lines dropped since the writer was made (no socket, or the receiver was full).
+   // Lines dropped since the writer was made (no socket, or the receiver stayed full).
    virtual uint64_t GetLostCount() const = 0;
    // Lines cut to maxMessageSize.
    virtual uint64_t GetTruncatedCount() const = 0;
