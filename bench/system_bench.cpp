@@ -1,6 +1,6 @@
-// Locks and conditions against their peers: MutexImpl against std::mutex, RWLockImpl read
-// holds against pthread_rwlock_t, and a two-thread Condition ping-pong against
-// std::condition_variable.
+// Locks and conditions against their peers: MutexImpl and the embedded NativeMutex against
+// std::mutex, RWLockImpl read holds against pthread_rwlock_t, and a two-thread Condition
+// ping-pong against std::condition_variable.
 
 #include <pthread.h>
 
@@ -10,6 +10,7 @@
 #include <thread>
 
 #include "pelmora/pelmora.h"
+#include "src/system/nativeMutex.h"
 #include "support/ratioMain.h"
 
 using namespace Pelmora;
@@ -26,6 +27,16 @@ void BM_MutexImplLockUnlock(benchmark::State& state) {
    }
 }
 BENCHMARK(BM_MutexImplLockUnlock);
+
+// The mutex the library's objects embed, owner check included.
+void BM_NativeMutexLockUnlock(benchmark::State& state) {
+   NativeMutex mutex;
+   for (auto _ : state) {
+      mutex.Lock();
+      mutex.Unlock();
+   }
+}
+BENCHMARK(BM_NativeMutexLockUnlock);
 
 void BM_StdMutexLockUnlock(benchmark::State& state) {
    std::mutex mutex;
@@ -123,6 +134,7 @@ int main(int argc, char** argv) {
    return PelmoraBench::RunWithRatios(
        argc, argv,
        {{"BM_MutexImplLockUnlock", "BM_StdMutexLockUnlock"},
+        {"BM_NativeMutexLockUnlock", "BM_StdMutexLockUnlock"},
         {"BM_RWLockImplReadLockUnlock", "BM_PthreadRWLockReadLockUnlock"},
         {"BM_ConditionPingPong/real_time", "BM_StdConditionVariablePingPong/real_time"}});
 }
