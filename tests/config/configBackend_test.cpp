@@ -497,21 +497,17 @@ TEST_F(ConfigFileTest, KilledWriterLeavesTheOldOrTheNewFile) {
    setAll("second");
    config->Flush();
    const std::string second = ReadFile(path);
-   auto start = std::chrono::steady_clock::now();
    setAll("first");
    config->Flush();
-   auto passTime = std::chrono::duration_cast<std::chrono::microseconds>(
-       std::chrono::steady_clock::now() - start);
    const std::string first = ReadFile(path);
    ASSERT_GT(first.size(), 40000u);
-   // Kills land anywhere within about three writes, however fast this machine writes.
-   const long window = std::max<long>(2000, 3 * passTime.count());
 
    std::mt19937 random(12345);
    int completedWrites = 0;
    for (int round = 0; round < 20; ++round) {
       int pipeFds[2];
       ASSERT_EQ(pipe(pipeFds), 0);
+      auto forked = std::chrono::steady_clock::now();
       pid_t child = fork();
       ASSERT_GE(child, 0);
       if (child == 0) {  // the configuration came along with the fork: writing starts at once
@@ -526,6 +522,11 @@ TEST_F(ConfigFileTest, KilledWriterLeavesTheOldOrTheNewFile) {
       // The first write warms the child up (a forked sanitizer build starts slowly).
       char started = 0;
       ASSERT_EQ(read(pipeFds[0], &started, 1), 1);
+      // Kills land anywhere within about three writes at the pace the child writes now,
+      // however fast or loaded this machine is.
+      long passTime = std::chrono::duration_cast<std::chrono::microseconds>(
+                          std::chrono::steady_clock::now() - forked).count();
+      long window = std::max<long>(2000, 3 * passTime);
       usleep(static_cast<useconds_t>(random() % window));
       kill(child, SIGKILL);
       int status = 0;
