@@ -10,7 +10,7 @@
 #include <thread>
 
 #include "pelmora/pelmora.h"
-#include "src/system/nativeMutex.h"
+#include "src/internal/nativeMutex.h"
 #include "support/ratioMain.h"
 
 using namespace Pelmora;
