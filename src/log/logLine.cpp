@@ -38,8 +38,8 @@ constexpr int kPrefixLimit = 65;
 // the output's write lock from its first flush to its end.
 // Text of at most kPrefixLimit - 1 bytes; what does not fit is cut.
 struct BoundedText {
-   void Append(const char* text) {
-      size_t length = strlen(text);
+   void Append(const char* text) { Append(text, strlen(text)); }
+   void Append(const char* text, size_t length) {
       size_t room = static_cast<size_t>(kPrefixLimit - 1 - size);
       if (length > room) length = room;
       CopyBytes(data + size, text, length);
@@ -152,28 +152,32 @@ private:
                   static_cast<unsigned>(local.tm_hour) % 100u,
                   static_cast<unsigned>(local.tm_min) % 100u,
                   static_cast<unsigned>(local.tm_sec) % 100u);
+         // What the prefix holds before and after the milliseconds, for the next lines
+         // of this second.
+         BoundedText stamp;
+         stamp.Append(_dateText);
+         stamp.Append("T");
+         stamp.Append(_secondText);
+         _stamp = stamp;
+         BoundedText tail;
+         tail.Append(_biasText);
+         tail.Append(" [");
+         tail.Append(_threadText);
+         tail.Append(" ");
+         _tail = tail;
       }
       // "%sT%s%s [%p %s '" with the date, time, bias, thread and level texts, bounded to
       // kPrefixLimit bytes with its terminator as a bounded printf would; assembled from
       // the cached texts because a printf here costs a third of a short line.
       unsigned millis = static_cast<unsigned>(now.tv_nsec / 1000000) % 1000u;
-      char timeText[14];
-      size_t secondLength = strlen(_secondText);
-      CopyBytes(timeText, _secondText, secondLength);
-      timeText[secondLength] = static_cast<char>('0' + millis / 100);
-      timeText[secondLength + 1] = static_cast<char>('0' + millis / 10 % 10);
-      timeText[secondLength + 2] = static_cast<char>('0' + millis % 10);
-      timeText[secondLength + 3] = 0;
-      BoundedText head;
-      head.Append(_dateText);
-      head.Append("T");
-      head.Append(timeText);
-      head.Append(_biasText);
-      head.Append(" [");
-      head.Append(_threadText);
-      head.Append(" ");
+      char millisText[3] = {static_cast<char>('0' + millis / 100),
+                            static_cast<char>('0' + millis / 10 % 10),
+                            static_cast<char>('0' + millis % 10)};
+      BoundedText head = _stamp;
+      head.Append(millisText, sizeof(millisText));
+      head.Append(_tail.data, static_cast<size_t>(_tail.size));
       head.Append(GetCombinedLevelName(_level));
-      head.Append(" '");
+      head.Append(" '", 2);
       if (context.empty() &&
           static_cast<int>(subsystem.size()) + head.size + 3 <= kChunkSize - _chunkPos) {
          // The usual prefix: straight into the empty chunk.
@@ -212,6 +216,10 @@ private:
    long _bias = 0;
    time_t _second = -1;
    char _secondText[10] = "";  // "hh:mm:ss."
+   // The prefix up to the milliseconds ("date" T "hh:mm:ss."), and after them up to the
+   // level name ("bias [thread "), as of _second.
+   BoundedText _stamp;
+   BoundedText _tail;
    char _threadText[24];
 };
 
