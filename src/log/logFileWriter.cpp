@@ -133,6 +133,10 @@ protected:
    void WriteLocked(Logger::CombinedLevel level, const char* data, int length) override {
       bool endsLine = data[length - 1] == '\n';
       if (_atLineStart) _dropping = false;
+      if (_dropping) {
+         _atLineStart = endsLine;  // the rest of a dropped line, even if a Reopen came
+         return;
+      }
       if (_fd < 0 && !RetryOpen(Clock::now())) {
          Hold(data, static_cast<size_t>(length), endsLine);
          return;

@@ -316,6 +316,21 @@ TEST(LogFileWriterTest, FailedOpenAfterARollKeepsTheFilesAndHoldsLinesUntilAnOpe
    }
    EXPECT_EQ(lines.size() + writer->GetLostCount(), 20u);
    EXPECT_GT(writer->GetLostCount(), 0u);
+
+   // A line dropped for want of room stays dropped to its end, even when the file opens
+   // again in its middle.
+   uint64_t lost = writer->GetLostCount();
+   FileOps::failOpen = true;
+   f.logger->Begin(Logger::LOG_INFO);
+   f.logger->Write(std::string(1500, 'd'));  // rolls, cannot open, does not fit: dropped
+   FileOps::failOpen = false;
+   f.logger->GetLogManager()->Reopen();
+   f.logger->Write(std::string(1500, 't'));
+   f.logger->End();
+   PELMORA_LOG_INFO(f.logger.Get(), "last");
+   EXPECT_EQ(writer->GetLostCount(), lost + 1);
+   EXPECT_EQ(ReadFile(options.path + ".1").find("tttt"), std::string::npos);
+   EXPECT_TRUE(std::regex_match(ReadFile(options.path), std::regex("[^\\n]*\\] last\\n")));
 }
 
 TEST(LogFileWriterTest, RollRenamesOnlyTheRolledFilesThereAre) {
