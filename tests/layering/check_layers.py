@@ -7,6 +7,9 @@ the families that several layers share (service, system, xml), by its file name.
 src/internal/ belong to no layer of their own: each counts as the highest layer it includes,
 and any layer may include it as long as that is not above its own.
 
+Tests follow units: tests/<layer>/<stem>_test.cpp tests src/<layer>/<stem>.cpp, which must
+exist (shared fixtures live in tests/support/).
+
 Usage: check_layers.py ROOT      prints each violation, exits 1 if there is any
        check_layers.py --self-test   checks the checker on a small tree with planted faults
 """
@@ -101,6 +104,15 @@ def check(root):
                 bad.append('%s:%d (%s) includes %s, a private header of %s' % (rel, line, own, inc, other))
             elif other and RANK[other] > RANK[own]:
                 bad.append('%s:%d (%s) includes %s (%s)' % (rel, line, own, inc, other))
+    tests_dir = os.path.join(root, 'tests')
+    for layer in sorted(os.listdir(tests_dir)) if os.path.isdir(tests_dir) else []:
+        if layer not in RANK:
+            continue
+        for name in sorted(os.listdir(os.path.join(tests_dir, layer))):
+            if name.endswith('_test.cpp') and not os.path.exists(
+                    os.path.join(root, 'src', layer, name[:-len('_test.cpp')] + '.cpp')):
+                bad.append('tests/%s/%s tests no unit: src/%s/%s.cpp does not exist'
+                           % (layer, name, layer, name[:-len('_test.cpp')]))
     return bad
 
 
@@ -119,15 +131,18 @@ def self_test():
         'include/pelmora/service/config.h': '', 'include/pelmora/xml/node.h': '',
         'include/pelmora/system.h': '#include "pelmora/system/threadPool.h"\n',
         'include/pelmora/system/threadPool.h': '',
+        'tests/config/own_test.cpp': '', 'src/config/own.cpp': '',
+        'tests/config/stray_test.cpp': '',                              # no unit of that name
+        'tests/support/helper_test.cpp': '',
     }
     with tempfile.TemporaryDirectory() as root:
         for rel, text in planted.items():
             os.makedirs(os.path.dirname(os.path.join(root, rel)), exist_ok=True)
             with open(os.path.join(root, rel), 'w') as f:
                 f.write(text)
-        found = sorted(v.split(':')[0] for v in check(root))
+        found = sorted(v.split(':')[0].split(' ')[0] for v in check(root))
     expected = ['include/pelmora/object/e.h', 'src/core/a.cpp', 'src/core/b.cpp',
-                'src/log/c.cpp', 'src/log/d.cpp']
+                'src/log/c.cpp', 'src/log/d.cpp', 'tests/config/stray_test.cpp']
     if found != expected:
         print('self-test: expected violations in %s, found %s' % (expected, found))
         return 1

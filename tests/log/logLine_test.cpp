@@ -1,0 +1,159 @@
+// Lines and their prefix, nesting, long lines and the log context.
+
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <fstream>
+#include <regex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "pelmora/exception/exceptions.h"
+#include "pelmora/exception/panic.h"
+#include "pelmora/io/writers.h"
+#include "pelmora/object/ref.h"
+#include "pelmora/service.h"
+#include "tests/support/watchdog.h"
+#include "tests/support/logLines.h"
+
+using namespace Pelmora;
+using namespace Pelmora::Service;
+using namespace Pelmora::TestSupport;
+
+TEST(LogLineTest, PrefixHasDateTimeBiasThreadLevelSubsystemAndThisThreadsContextInKeyOrder) {
+   TestLogger t;
+   std::vector<std::string> seen;
+   AddLogContextUpdateCallback("test", [&seen](const std::string& key, const std::string& value) {
+      seen.push_back(key + "=" + value);
+   });
+   SetLogContext("user", "ann");
+   RemoveLogContextUpdateCallback("test");
+   SetLogContext("request", "12");
+   PELMORA_LOG_WARNING(t.logger.Get(), "disk at %1%%", 93);
+   std::thread([&t] { PELMORA_LOG_INFO(t.logger.Get(), "theirs"); }).join();
+   SetLogContext("user", "");
+   SetLogContext("request", "");
+   EXPECT_EQ(GetLogContext("request"), "");
+   PELMORA_LOG_INFO(t.logger.Get(), "plain");
+   EXPECT_EQ(seen, std::vector<std::string>{"user=ann"});
+
+   std::vector<std::string> lines = t.Lines();
+   ASSERT_EQ(lines.size(), 3u);
+   EXPECT_TRUE(Matches(lines[0], "warning 'sub' request=12 user=ann\\] disk at 93%")) << lines[0];
+   EXPECT_TRUE(Matches(lines[1], "info 'sub'\\] theirs")) << lines[1];
+   EXPECT_TRUE(Matches(lines[2], "info 'sub'\\] plain")) << lines[2];
+   EXPECT_EQ(t.target->pieces.size(), 3u);  // a short line reaches the output in one piece
+}
+
+TEST(LogLineTest, UnwantedLevelFormatsAndEvaluatesNothing) {
+   TestLogger t("info");
+   t.logger->SetMemLevelByName("info");  // verbose is wanted nowhere
+   CountingObject counted;
+   int evaluated = 0;
+   auto next = [&evaluated] { return ++evaluated; };
+   PELMORA_LOG_VERBOSE(t.logger.Get(), "%1 %2", counted, next());
+   EXPECT_EQ(counted.calls, 0);
+   EXPECT_EQ(evaluated, 0);
+   EXPECT_TRUE(t.target->pieces.empty());
+
+   PELMORA_LOG_INFO(t.logger.Get(), "%1 %2", counted, next());
+   EXPECT_EQ(counted.calls, 1);
+   ASSERT_EQ(t.Lines().size(), 1u);
+   EXPECT_NE(t.Lines()[0].find("] counted 1"), std::string::npos);
+}
+
+TEST(LogLineTest, BadFormatEndsTheLineAndNestedCallIsASeparateLineMarkedWithItsDepth) {
+   TestLogger t;
+   CountingObject counted;
+   counted.nested = t.logger.Get();
+   PELMORA_LOG_ERROR(t.logger.Get(), "before %3 after", 1);
+   PELMORA_LOG_ERROR(t.logger.Get(), "outer %1 end", counted);
+   std::vector<std::string> lines = t.Lines();
+   ASSERT_EQ(lines.size(), 3u);
+   EXPECT_TRUE(Matches(lines[0], "error 'sub'\\] before ")) << lines[0];
+   EXPECT_TRUE(Matches(lines[1], "error 'sub'\\] \\(Log recursion level 1\\) inner 7")) << lines[1];
+   EXPECT_TRUE(Matches(lines[2], "error 'sub'\\] outer counted end")) << lines[2];
+}
+
+TEST(LogLineTest, LargePiecesGoStraightThroughAndOtherPiecesStayWithinTheChunk) {
+   TestLogger t;
+   std::string big(1500, 'b'), medium(1000, 'm');
+   PELMORA_LOG_INFO(t.logger.Get(), "%1|%2|%3|%4", medium, medium, big, medium);
+   ASSERT_EQ(t.Lines().size(), 1u);
+   EXPECT_NE(t.Lines()[0].find(medium + "|" + medium + "|" + big + "|" + medium),
+             std::string::npos);
+   int bigPieces = 0;
+   for (const std::string& piece : t.target->pieces) {
+      bigPieces += piece == big;
+      EXPECT_TRUE(piece == big || piece.size() <= 2048u) << piece.size();
+   }
+   EXPECT_EQ(bigPieces, 1);
+}
+
+// A long line holds the output from its first flush to its end, fast path on or off.
+class LongLineTest : public testing::TestWithParam<bool> {};
+
+TEST_P(LongLineTest, LongLineArrivesWholeWhileAnotherThreadLogs) {
+   bool saved = IsUsingLogFastPath();
+   SetUsingLogFastPath(GetParam());
+   TestLogger t;
+   std::atomic<bool> stop{false};
+   std::atomic<int> shortLines{0};
+   std::thread other([&] {
+      while (!stop.load()) {
+         PELMORA_LOG_INFO(t.logger.Get(), "short %1", 1);
+         ++shortLines;
+      }
+   });
+   {
+      Pelmora::Testing::Watchdog watchdog("the other thread's first line");
+      while (shortLines.load() == 0) std::this_thread::yield();
+   }
+   std::string chunk(300, 'x'), tail = chunk + std::string(300, 'y');
+   for (int i = 0; i < 300; ++i) {  // ten pieces that fit the chunk: several flushes per line
+      PELMORA_LOG_INFO(t.logger.Get(), "long %1%2%3%4%5%6%7%8%9", chunk, chunk, chunk, chunk,
+                       chunk, chunk, chunk, chunk, tail);
+   }
+   stop = true;
+   Pelmora::Testing::Join(other, "other to finish");
+   SetUsingLogFastPath(saved);
+
+   std::string body = "long " + std::string(2700, 'x') + std::string(300, 'y');
+   int longLines = 0;
+   for (const std::string& line : t.Lines()) {
+      std::string rest = line.substr(line.find("] ") + 2);
+      if (rest != "short 1") {
+         ASSERT_EQ(rest, body);
+         ++longLines;
+      }
+   }
+   EXPECT_EQ(longLines, 300);
+}
+
+INSTANTIATE_TEST_SUITE_P(FastPath, LongLineTest, testing::Bool());
+
+TEST(LogContextDeathTest, CallbacksOutliveStaticDestruction) {
+   // Static destruction runs as exit runs it; then this thread does what a detached
+   // thread still running at that moment may do.
+   EXPECT_EXIT(
+       {
+          // Callbacks with state on the heap, so that a destroyed registry shows.
+          std::string state(200, 's');
+          for (int i = 0; i < 100; ++i) {
+             AddLogContextUpdateCallback("exit " + std::to_string(i),
+                                         [state](const std::string&, const std::string&) {
+                                            if (state.size() != 200) abort();
+                                         });
+          }
+          SetLogContext("phase", "running");
+          __cxa_finalize(nullptr);
+          SetLogContext("phase", "exiting");
+          AddLogContextUpdateCallback("late", [](const std::string&, const std::string&) {});
+          RemoveLogContextUpdateCallback("late");
+          SetLogContext("phase", "");
+          _exit(0);
+       },
+       testing::ExitedWithCode(0), "");
+}
