@@ -1,11 +1,15 @@
 // Thread control on POSIX: starting threads, naming them, and the pipe pairs and poll
 // loop that wake the pools' I/O threads.
 
+#include <dirent.h>
 #include <errno.h>
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/prctl.h>
 #include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/formatter/messageFormatter.h"
@@ -18,6 +22,19 @@ namespace Pelmora::System {
 namespace {
 
 constexpr int kMaxPollables = 8192;
+constexpr int kReportWarningLevel = 8;
+
+// Open descriptors of this process, counted in /proc; -1 when it cannot be read.
+int CountOpenDescriptors() {
+   DIR* dir = opendir("/proc/self/fd");
+   if (!dir) return -1;
+   int count = 0;
+   while (dirent* entry = readdir(dir)) {
+      if (entry->d_name[0] != '.') ++count;
+   }
+   closedir(dir);
+   return count - 1;  // the directory's own descriptor
+}
 
 class ThreadControlPosix : public virtual ThreadControl, public ObjectImpl {
 public:
@@ -84,6 +101,27 @@ public:
          if (entries[i].revents != 0) readyIndices.push_back(static_cast<int>(i));
       }
    }
+
+   void OnThreadPoolStartup(int maxFdsPerThread) override {
+      _maxFdsPerThread.store(maxFdsPerThread > 0 ? maxFdsPerThread : 0);
+   }
+
+   void OnThreadPoolShutdown() override { _maxFdsPerThread.store(0); }
+
+   int CheckDescriptors(int threadCount) override {
+      int count = CountOpenDescriptors();
+      long long limit = static_cast<long long>(_maxFdsPerThread.load()) * std::max(threadCount, 1);
+      if (limit > 0 && count > limit) {
+         Internal::GetReportSink().Log(
+             kReportWarningLevel,
+             MessageFormatter::ASPrint("Open descriptors %1 exceed MaxFdsPerThread %2 for %3 threads",
+                                       count, _maxFdsPerThread.load(), threadCount));
+      }
+      return count;
+   }
+
+private:
+   std::atomic<int> _maxFdsPerThread{0};
 };
 
 }  // namespace

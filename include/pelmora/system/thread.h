@@ -64,6 +64,14 @@ public:
    // `readyIndices` with the positions (in `pollables`) of the ready ones, in order.
    virtual void DoPoll(const std::vector<std::pair<int, POLL_EVENT>>& pollables,
                        std::vector<int>& readyIndices) = 0;
+
+   // A pool starting: `maxFdsPerThread` is its descriptor budget per thread (0: none).
+   virtual void OnThreadPoolStartup(int maxFdsPerThread) = 0;
+   // The pool shut down: the budget no longer applies.
+   virtual void OnThreadPoolShutdown() = 0;
+   // Counts the process's open descriptors and logs a warning when they pass the budget
+   // for `threadCount` threads. Returns the count (-1 when it cannot be read).
+   virtual int CheckDescriptors(int threadCount) = 0;
 };
 
 // The calling thread's object, created on first use for a thread the library did not start.

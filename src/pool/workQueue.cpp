@@ -1,0 +1,157 @@
+// Work queues and work items of the fair pool.
+
+#include <atomic>
+#include <exception>
+#include <typeinfo>
+
+#include "pelmora/exception/panic.h"
+#include "pelmora/exception/throwable.h"
+#include "pelmora/formatter/messageFormatter.h"
+#include "pelmora/perfCounter/lwStats.h"
+#include "pelmora/service/logMacros.h"
+#include "src/pool/priorityInfo.h"
+#include "src/pool/threadPoolFair.h"
+#include "src/pool/workQueueImpl.h"
+
+namespace Pelmora::System {
+
+namespace {
+
+std::atomic<bool> sCatchWorkItemExceptions{false};
+
+}  // namespace
+
+void SetCatchWorkItemExceptions(bool catchThem) { sCatchWorkItemExceptions.store(catchThem); }
+bool GetCatchWorkItemExceptions() { return sCatchWorkItemExceptions.load(); }
+
+void WorkItemImplCatchEx::Run() {
+   try {
+      _function();
+   } catch (const Throwable& e) {
+      PELMORA_LOG_PANIC(GetPoolLogger(), "Worker: Unhandled exception:\n%1",
+                        e.GetMessage() + "\n" + e.Where());
+   } catch (const std::exception& e) {
+      PELMORA_LOG_PANIC(GetPoolLogger(), "Worker: Unhandled exception:\n%1, %2", typeid(e).name(),
+                        e.what());
+   } catch (...) {
+      PELMORA_LOG_PANIC(GetPoolLogger(), "Worker: Unhandled exception of unknown type");
+   }
+}
+
+void CreateWorkItem(const Functor<>& function, Ref<WorkItem>& out) {
+   if (sCatchWorkItemExceptions.load(std::memory_order_relaxed)) {
+      out = new WorkItemImplCatchEx(function);
+   } else {
+      out = new WorkItem(function);
+   }
+}
+
+Atomic<long long> WorkQueueImpl::enqCount;
+Atomic<long long> WorkQueueImpl::popCount;
+
+WorkQueueImpl::WorkQueueImpl(const WorkQueueSpec& spec, Kind kind, ThreadPoolFair* pool,
+                             PriorityInfo* level)
+    : _id(spec.id), _kind(kind), _itemWeight(spec.itemWeight), _priority(spec.priority),
+      _pool(pool), _level(level) {}
+
+void WorkQueueImpl::Enqueue(const Functor<>& item) {
+   Ref<WorkItem> workItem;
+   CreateWorkItem(item, workItem);
+   EnqueueItem(workItem.Get());
+}
+
+void WorkQueueImpl::EnqueueItem(WorkItem* item) {
+   if (_pool->IsShuttingDown()) return;
+   bool first;
+   bool announce;
+   {
+      Synchronized lock(this);
+      enqCount.ReadInc();
+      _items.emplace_back(item);
+      first = _items.size() == 1;
+      if (first) _dispatched = 0;
+      // A serial queue with its item running re-enters its level on completion.
+      announce = first && !(_kind == KIND_SERIAL && _executing > 0);
+   }
+   if (!_level) {
+      _pool->MainQueueNonEmpty();
+   } else if (announce) {
+      _level->QueueNonEmpty(this);
+   } else if (!first && _kind == KIND_FAIR) {
+      _pool->PostWork();
+   }
+}
+
+int WorkQueueImpl::GetQueueSize() {
+   Synchronized lock(this);
+   return static_cast<int>(_items.size());
+}
+
+int WorkQueueImpl::GetWeigth() {
+   Synchronized lock(this);
+   // A queue that just received work goes ahead of those already being served.
+   if (_executing == 0) return _dispatched == 0 ? -1 : 0;
+   return _executing * _itemWeight;
+}
+
+int WorkQueueImpl::PopItem(Ref<WorkItem>& item) {
+   Synchronized lock(this);
+   popCount.ReadInc();
+   PELMORA_VERIFY(!_items.empty());
+   item = std::move(_items.front());
+   _items.pop_front();
+   ++_executing;
+   ++_dispatched;
+   return _kind == KIND_SERIAL ? 0 : static_cast<int>(_items.size());
+}
+
+void WorkQueueImpl::ItemCompleted(long long elapsedMicroseconds) {
+   bool reenter;
+   {
+      Synchronized lock(this);
+      --_executing;
+      ++_completed;
+      _executionMicroseconds += elapsedMicroseconds;
+      reenter = _kind == KIND_SERIAL && !_items.empty();
+   }
+   if (_level) _level->ItemCompleted(this, reenter);
+}
+
+int WorkQueueImpl::Clear() {
+   std::deque<Ref<WorkItem>> dropped;
+   {
+      Synchronized lock(this);
+      dropped.swap(_items);
+   }
+   return static_cast<int>(dropped.size());
+}
+
+void WorkQueueImpl::GetStats(PerfCounter::LwStatsBuilder& builder) {
+   long long size, executing, dispatched, completed, time;
+   {
+      Synchronized lock(this);
+      size = static_cast<long long>(_items.size());
+      executing = _executing;
+      dispatched = _dispatched;
+      completed = _completed;
+      time = _executionMicroseconds;
+   }
+   PerfCounter::CounterFactory counter;
+   builder.Push("ThreadPool");
+   builder.Push("Pelmora");
+   builder.Push("WorkQueue");
+   builder.Push(_id);
+   builder.Insert("QueueSize", size, counter);
+   builder.Insert("currentConcurrency", executing, counter);
+   builder.Insert("ExecutionCount", dispatched, counter);
+   builder.Insert("TotalExecionCount", completed, counter);
+   builder.Insert("TotalExecutionTime", time, counter);
+   for (int i = 0; i < 4; ++i) builder.Pop();
+}
+
+std::string WorkQueueImpl::ToString() const {
+   return MessageFormatter::ASPrint("WorkQueue.%1, type = %2, priority = %3 , itemWeight = %4", _id,
+                                    _kind == KIND_SERIAL ? "serial" : "fair", _priority, _itemWeight);
+}
+
+}  // namespace Pelmora::System

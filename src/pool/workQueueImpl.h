@@ -1,0 +1,86 @@
+#pragma once
+// The work queue of the fair pool and its items. A queue keeps its pending items and its
+// counts under its own lock, taken alone: it is released before the level hears of a new
+// first item or of a completion.
+
+#include <cstdint>
+#include <deque>
+#include <string>
+
+#include "pelmora/object/atomic.h"
+#include "pelmora/system/lockable.h"
+#include "pelmora/system/workQueue.h"
+
+namespace Pelmora::PerfCounter {
+class LwStatsBuilder;
+}
+
+namespace Pelmora::System {
+
+class PriorityInfo;
+class ThreadPoolFair;
+
+class WorkItem : public ObjectImpl {
+public:
+   explicit WorkItem(Functor<> function) : _function(std::move(function)) {}
+   virtual void Run() { _function(); }
+
+protected:
+   Functor<> _function;
+};
+
+// Logs what escapes the item at panic level and carries on.
+class WorkItemImplCatchEx : public WorkItem {
+public:
+   using WorkItem::WorkItem;
+   void Run() override;
+};
+
+// A work item of the form the process-wide switch selects.
+void CreateWorkItem(const Functor<>& function, Ref<WorkItem>& out);
+
+class WorkQueueImpl : public virtual WorkQueue, public LockableObjectImpl {
+public:
+   enum Kind { KIND_FAIR = 0, KIND_SERIAL = 1 };
+
+   // `level` is null for the main-thread queue, whose items only MainThreadRun takes.
+   WorkQueueImpl(const WorkQueueSpec& spec, Kind kind, ThreadPoolFair* pool, PriorityInfo* level);
+
+   const std::string& GetId() const override { return _id; }
+   bool IsSerial() const override { return _kind == KIND_SERIAL; }
+   int GetPriority() const override { return _priority; }
+   void Enqueue(const Functor<>& item) override;
+   int GetQueueSize() override;
+   void GetCompletionQueue(Ref<WorkQueue>& out) override { out = this; }
+   std::string ToString() const override;
+
+   void EnqueueItem(WorkItem* item);
+   // The fairness key among the queues of one level.
+   int GetWeigth();
+   // Takes the first item; answers the items left (0 for a serial queue).
+   int PopItem(Ref<WorkItem>& item);
+   // Its level is told after the queue lock is released.
+   void ItemCompleted(long long elapsedMicroseconds);
+   // Drops every pending item (shutdown); returns how many.
+   int Clear();
+   void GetStats(PerfCounter::LwStatsBuilder& builder);
+   PriorityInfo* GetPriorityInfo() const { return _level; }
+
+   static Atomic<long long> enqCount;
+   static Atomic<long long> popCount;
+
+private:
+   const std::string _id;
+   const Kind _kind;
+   const int _itemWeight;
+   const int _priority;
+   Ref<ThreadPoolFair> _pool;
+   std::deque<Ref<WorkItem>> _items;
+   PriorityInfo* const _level;
+   int32_t _executing = 0;
+   int32_t _dispatched = 0;  // since the queue last became non-empty
+   int64_t _completed = 0;
+   int64_t _executionMicroseconds = 0;
+};
+
+}  // namespace Pelmora::System
