@@ -43,6 +43,9 @@ long long NowMicroseconds() {
        .count();
 }
 
+// The record of the pool whose handlers the calling thread serves.
+thread_local void* tServingInfo = nullptr;
+
 enum TimerState { TIMER_WAITING = 0, TIMER_FIRED = 1, TIMER_CANCELLED = 2, TIMER_RUNNING = 3 };
 
 }  // namespace
@@ -245,6 +248,7 @@ void ThreadPoolFair::RunWorkerThread() {
 }
 
 void ThreadPoolFair::ServeLoop(TlsInfo* info) {
+   void* outer = std::exchange(tServingInfo, info);
    while (!IsShuttingDown() && !info->_exit) {
       info->_working = 0;
       // Nothing is left to run only once shutdown took the work guard away.
@@ -253,6 +257,7 @@ void ThreadPoolFair::ServeLoop(TlsInfo* info) {
          break;
       }
    }
+   tServingInfo = outer;
 }
 
 void ThreadPoolFair::PostWork() {
@@ -267,7 +272,8 @@ void ThreadPoolFair::PriorityNonEmpty(int level) { _runnable.set(level); }
 void ThreadPoolFair::HandleWork() {
    if (IsShuttingDown()) return;
    handleWorkCount.ReadInc();
-   TlsInfo* _tlsInfo = AttachThisThread(false);
+   TlsInfo* _tlsInfo = static_cast<TlsInfo*>(tServingInfo);
+   if (!_tlsInfo || _tlsInfo->_pool != this) _tlsInfo = AttachThisThread(false);
    PELMORA_VERIFY(!_tlsInfo->_working);
    _tlsInfo->_working = 1;
    int minThreads = std::max(_limits.minThreads.load(std::memory_order_relaxed), 1);
@@ -563,6 +569,7 @@ void ThreadPoolFair::RequestShutdown() {
 }
 
 bool ThreadPoolFair::WaitShutdown(long long timeoutMicroseconds) {
+   Ref<ThreadPoolFair> self(this);  // releasing the queues may drop the last other reference
    long long deadline = timeoutMicroseconds < 0 ? -1 : NowMicroseconds() + timeoutMicroseconds;
    auto remaining = [deadline] { return deadline < 0 ? -1 : std::max(deadline - NowMicroseconds(), 0LL); };
    {
@@ -579,17 +586,15 @@ bool ThreadPoolFair::WaitShutdown(long long timeoutMicroseconds) {
 }
 
 void ThreadPoolFair::ReleaseAll() {
-   std::map<std::string, Ref<WorkQueueImpl>> queues;
-   Ref<WorkQueueImpl> defaults[3];
+   std::vector<Ref<WorkQueueImpl>> queues;
    Ref<TimerItem> shrinkTimer;
    {
       Synchronized lock(this);
       if (_released) return;
       _released = true;
-      queues.swap(_queues);
-      defaults[0] = std::move(_defaultIOQueue);
-      defaults[1] = std::move(_defaultLongTaskQueue);
-      defaults[2] = std::move(_mainThreadQueue);
+      // The default queues stay: callers may still hold them; closed, they drop items.
+      for (auto& [id, queue] : _queues) queues.push_back(queue);
+      queues.push_back(_mainThreadQueue);
    }
    // Aborted timer waits still hold their items (and so this pool) until they complete.
    for (;;) {
@@ -605,13 +610,15 @@ void ThreadPoolFair::ReleaseAll() {
       Synchronized lock(_exitMutex.Get());
       if (_timers.empty()) break;
    }
-   for (auto& [id, queue] : queues) queue->Clear();
-   for (Ref<WorkQueueImpl>& queue : defaults) {
-      if (queue) queue->Clear();
+   std::vector<Ref<ThreadPoolFair>> references;
+   for (Ref<WorkQueueImpl>& queue : queues) {
+      references.emplace_back();
+      queue->Close(references.back());
    }
 }
 
 void ThreadPoolFair::GetConfig(ThreadPoolConfig& out) {
+   Synchronized lock(this);
    out.minThreads = _limits.minThreads.load();
    out.maxThreads = _limits.maxThreads.load();
    out.reservationRatio = _reservationRatio;

@@ -52,7 +52,7 @@ Atomic<long long> WorkQueueImpl::popCount;
 WorkQueueImpl::WorkQueueImpl(const WorkQueueSpec& spec, Kind kind, ThreadPoolFair* pool,
                              PriorityInfo* level)
     : _id(spec.id), _kind(kind), _itemWeight(spec.itemWeight), _priority(spec.priority),
-      _pool(pool), _level(level) {}
+      _pool(pool), _keepPool(pool), _level(level) {}
 
 void WorkQueueImpl::Enqueue(const Functor<>& item) {
    Ref<WorkItem> workItem;
@@ -61,7 +61,8 @@ void WorkQueueImpl::Enqueue(const Functor<>& item) {
 }
 
 void WorkQueueImpl::EnqueueItem(WorkItem* item) {
-   if (_pool->IsShuttingDown()) return;
+   // A closed queue may have outlived its pool: it looks no further.
+   if (_closed.load(std::memory_order_acquire) || _pool->IsShuttingDown()) return;
    bool first;
    bool announce;
    {
@@ -117,13 +118,14 @@ void WorkQueueImpl::ItemCompleted(long long elapsedMicroseconds) {
    if (_level) _level->ItemCompleted(this, reenter);
 }
 
-int WorkQueueImpl::Clear() {
+void WorkQueueImpl::Close(Ref<ThreadPoolFair>& pool) {
    std::deque<Ref<WorkItem>> dropped;
    {
       Synchronized lock(this);
+      _closed.store(true, std::memory_order_release);
       dropped.swap(_items);
+      pool = std::move(_keepPool);
    }
-   return static_cast<int>(dropped.size());
 }
 
 void WorkQueueImpl::GetStats(PerfCounter::LwStatsBuilder& builder) {

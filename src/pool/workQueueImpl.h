@@ -3,6 +3,7 @@
 // counts under its own lock, taken alone: it is released before the level hears of a new
 // first item or of a completion.
 
+#include <atomic>
 #include <cstdint>
 #include <deque>
 #include <string>
@@ -61,8 +62,9 @@ public:
    int PopItem(Ref<WorkItem>& item);
    // Its level is told after the queue lock is released.
    void ItemCompleted(long long elapsedMicroseconds);
-   // Drops every pending item (shutdown); returns how many.
-   int Clear();
+   // Shutdown: drops every pending item and every later one, and hands over the
+   // queue's reference to its pool (released by the caller, outside the queue).
+   void Close(Ref<ThreadPoolFair>& pool);
    void GetStats(PerfCounter::LwStatsBuilder& builder);
    PriorityInfo* GetPriorityInfo() const { return _level; }
 
@@ -74,7 +76,9 @@ private:
    const Kind _kind;
    const int _itemWeight;
    const int _priority;
-   Ref<ThreadPoolFair> _pool;
+   ThreadPoolFair* const _pool;
+   Ref<ThreadPoolFair> _keepPool;  // until Close: a queue in use keeps its pool
+   std::atomic<bool> _closed{false};
    std::deque<Ref<WorkItem>> _items;
    PriorityInfo* const _level;
    int32_t _executing = 0;
