@@ -306,8 +306,9 @@ TEST_F(ThreadPoolFairTest, CaughtItemExceptionsAreLoggedAtPanicLevel) {
    EXPECT_NE(std::string::npos, text.find("Worker: Unhandled exception of unknown type"));
 }
 
-TEST_F(ThreadPoolFairTest, TheMainThreadRunsTheMainQueue) {
+TEST_F(ThreadPoolFairTest, TheMainThreadRunsTheMainQueueAndOthersMayServe) {
    Pool({{"minThreads", "1"}});
+   std::thread helper([&] { pool->ThreadRun(); });
    std::atomic<long long> mainId{0}, ranOn{0};
    std::atomic<WorkQueue*> current{nullptr};
    std::thread main([&] {
@@ -326,6 +327,7 @@ TEST_F(ThreadPoolFairTest, TheMainThreadRunsTheMainQueue) {
    EXPECT_EQ(pool->GetMainThreadWorkQueue(), current.load());
    pool->RequestShutdown();
    Testing::Join(main, "MainThreadRun to return at shutdown");
+   Testing::Join(helper, "ThreadRun to return at shutdown");
 }
 
 // Items queued at shutdown are released unrun; none runs after WaitShutdown.
@@ -351,10 +353,14 @@ TEST_F(ThreadPoolFairTest, ShutdownReleasesQueuedItemsAndLeavesNoThread) {
    EXPECT_EQ(0, living.load()) << "queued items were not released";
    int ranAtShutdown = ran.load();
    EXPECT_EQ(0, ranAtShutdown);
+   // Queues, default ones too, outlive the shutdown and drop what they are given.
    queue->Enqueue([&] { ++ran; });
+   pool->ScheduleWorkItem([&] { ++ran; });
+   pool->GetMainThreadWorkQueue()->Enqueue([&] { ++ran; });
    std::this_thread::sleep_for(milliseconds(5));
    EXPECT_EQ(ranAtShutdown, ran.load());
    pool.Reset();
+   queue->Enqueue([&] { ++ran; });
 }
 
 TEST_F(ThreadPoolFairTest, StatsAndTheProcessPool) {
