@@ -441,7 +441,8 @@ void ThreadPoolFair::FindCompletionQueue(const WorkQueueSpec& spec, Ref<WorkQueu
 
 WorkQueue* ThreadPoolFair::GetCurrentWorkQueue() {
    TlsInfo* info = GetTlsInfo();
-   return info ? info->_queue : nullptr;
+   if (!info || !info->_queue) return nullptr;
+   return info->_queue;
 }
 
 void ThreadPoolFair::ScheduleWorkItem(const Functor<>& item) { _defaultIOQueue->Enqueue(item); }

@@ -16,8 +16,13 @@ using namespace PoolTesting;
 class PollSchedulerTest : public testing::Test {
 protected:
    PollSchedulerTest() : control(new TestThreadControl(true)) {}
-   ~PollSchedulerTest() override {
+   // Shuts down before the test's locals, which callbacks may still use, go away.
+   void Finish() {
       if (pool) ShutDown(pool.Get());
+      pool.Reset();
+   }
+   ~PollSchedulerTest() override {
+      Finish();
       for (int fd : fds) close(fd);
    }
    void Start() { pool = MakePool({{"minThreads", "2"}}, control.Get()); }
@@ -59,6 +64,7 @@ TEST_F(PollSchedulerTest, WaitsFireOnceWhenTheDescriptorIsReady) {
    pool->ScheduleReadReady(readFd, [&] { ++marker; }, again);
    WaitFor([&] { return marker.load() == 1; }, "a second wait");
    EXPECT_EQ(1, readable.load());
+   Finish();
 }
 
 TEST_F(PollSchedulerTest, ACancelledWaitNeverFires) {
@@ -76,6 +82,7 @@ TEST_F(PollSchedulerTest, ACancelledWaitNeverFires) {
    ASSERT_EQ(1, write(otherWrite, "x", 1));
    WaitFor([&] { return marker.load() == 1; }, "the other wait");
    EXPECT_EQ(0, cancelledFired.load());
+   Finish();
 }
 
 // With room for three descriptors beside its signal, one thread cannot take seven waits.
@@ -94,6 +101,7 @@ TEST_F(PollSchedulerTest, FullPollingThreadsAreJoinedByAnother) {
    EXPECT_EQ(3, control->started.load() - before) << "polling threads";
    for (int i = 0; i < kWaits; ++i) ASSERT_EQ(1, write(writeFds[i], "x", 1));
    WaitFor([&] { return fired.load() == kWaits; }, "every wait");
+   Finish();
 }
 
 }  // namespace

@@ -63,9 +63,12 @@ protected:
       pool = MakePool(settings, control.Get(), shrinkPeriod);
       return pool;
    }
-   void TearDown() override {
+   // Shuts down before the test's locals, which items may still use, go away.
+   void Finish() {
       if (pool) ShutDown(pool.Get());
+      pool.Reset();
    }
+   void TearDown() override { Finish(); }
 
    Ref<TestThreadControl> control{new TestThreadControl(true)};
    Ref<ThreadPoolFair> pool;
@@ -84,6 +87,7 @@ TEST_F(ThreadPoolFairTest, StackSizesAreClampedWithWarnings) {
       EXPECT_EQ(std::string(configured) == "4096",
                 log.Contains("Stack size value 4096 bigger than maxStackSize 2048, Set to max"));
    }
+   Finish();
 }
 
 TEST_F(ThreadPoolFairTest, StartUpLogsTheLimitsAndStartsMinThreads) {
@@ -101,6 +105,7 @@ TEST_F(ThreadPoolFairTest, StartUpLogsTheLimitsAndStartsMinThreads) {
    ShutDown(pool.Get());
    EXPECT_EQ(1, control->shutdowns.load());
    pool.Reset();
+   Finish();
 }
 
 TEST_F(ThreadPoolFairTest, SingleThreadedStartsTheFirstWorkerOnTheFirstItem) {
@@ -111,6 +116,7 @@ TEST_F(ThreadPoolFairTest, SingleThreadedStartsTheFirstWorkerOnTheFirstItem) {
    pool->ScheduleWorkItem([&] { ran = true; });
    WaitFor([&] { return ran.load(); }, "the first item");
    EXPECT_GE(control->started.load(), 1);
+   Finish();
 }
 
 TEST_F(ThreadPoolFairTest, QueueIdsAreUnique) {
@@ -131,6 +137,7 @@ TEST_F(ThreadPoolFairTest, QueueIdsAreUnique) {
    EXPECT_EQ(5, found->GetPriority());
    pool->FindCompletionQueue(WorkQueueSpec("replies", 3), found);
    EXPECT_FALSE(found->IsSerial());
+   Finish();
 }
 
 using ThreadPoolFairDeathTest = ThreadPoolFairTest;
@@ -155,6 +162,7 @@ TEST_F(ThreadPoolFairTest, ItemsKnowTheirQueueAndThreadsCanEnlist) {
    EXPECT_EQ(nullptr, pool->GetCurrentWorkQueue());
    pool->EnlistThisThread();
    pool->DelistThisThread();
+   Finish();
 }
 
 // Two fair queues of one level share it: neither gets far ahead of the other, although
@@ -196,6 +204,7 @@ TEST_F(ThreadPoolFairTest, FairQueuesOfOneLevelShareIt) {
    for (int i = 0; i < kItems; ++i) fromA += order[i] == 'a';
    EXPECT_GT(fromA, kItems * 45 / 100);
    EXPECT_LT(fromA, kItems * 55 / 100);
+   Finish();
 }
 
 // Lower levels fill every slot they may; the urgent level still finds a thread.
@@ -219,6 +228,7 @@ TEST_F(ThreadPoolFairTest, AnUrgentLevelRunsWhileLowerLevelsSaturateThePool) {
    EXPECT_LE(pool->GetThreadCount(), 6);
    gate.Open();
    WaitFor([&] { return low->GetQueueSize() == 0 && lower->GetQueueSize() == 0; }, "the lower items");
+   Finish();
 }
 
 // Busy workers make the pool grow up to maxThreads; once maxThreads is lowered the shrink
@@ -245,6 +255,7 @@ TEST_F(ThreadPoolFairTest, GrowsUnderLoadAndShrinksOnTheTimer) {
    EXPECT_GT(grown, 2);
    std::this_thread::sleep_for(milliseconds(10));
    EXPECT_EQ(2, pool->GetThreadCount()) << "shrinking stops at maxThreads";
+   Finish();
 }
 
 TEST_F(ThreadPoolFairTest, TimersFireOnceAndCancelledOnesNever) {
@@ -262,6 +273,7 @@ TEST_F(ThreadPoolFairTest, TimersFireOnceAndCancelledOnesNever) {
    EXPECT_EQ(0, cancelledFired.load());
    EXPECT_FALSE(once->Cancel()) << "already ran";
    EXPECT_FALSE(once->IsCancelled());
+   Finish();
 }
 
 TEST_F(ThreadPoolFairTest, IOCompletionsGetACopyOfTheError) {
@@ -285,6 +297,7 @@ TEST_F(ThreadPoolFairTest, IOCompletionsGetACopyOfTheError) {
    for (auto& [text, bytes] : calls) byBytes[bytes] = text;
    EXPECT_EQ(std::string(typeid(TimeoutException).name()) + ":read timed out", byBytes[0]);
    EXPECT_EQ("", byBytes[42]);
+   Finish();
 }
 
 TEST_F(ThreadPoolFairTest, CaughtItemExceptionsAreLoggedAtPanicLevel) {
@@ -304,6 +317,7 @@ TEST_F(ThreadPoolFairTest, CaughtItemExceptionsAreLoggedAtPanicLevel) {
    EXPECT_NE(std::string::npos, text.find("Worker: Unhandled exception:\nInvalid argument : bad thing"));
    EXPECT_NE(std::string::npos, text.find("Worker: Unhandled exception:\nSt13runtime_error, std thing"));
    EXPECT_NE(std::string::npos, text.find("Worker: Unhandled exception of unknown type"));
+   Finish();
 }
 
 TEST_F(ThreadPoolFairTest, TheMainThreadRunsTheMainQueueAndOthersMayServe) {
@@ -328,6 +342,7 @@ TEST_F(ThreadPoolFairTest, TheMainThreadRunsTheMainQueueAndOthersMayServe) {
    pool->RequestShutdown();
    Testing::Join(main, "MainThreadRun to return at shutdown");
    Testing::Join(helper, "ThreadRun to return at shutdown");
+   Finish();
 }
 
 // Items queued at shutdown are released unrun; none runs after WaitShutdown.
@@ -361,6 +376,7 @@ TEST_F(ThreadPoolFairTest, ShutdownReleasesQueuedItemsAndLeavesNoThread) {
    EXPECT_EQ(ranAtShutdown, ran.load());
    pool.Reset();
    queue->Enqueue([&] { ++ran; });
+   Finish();
 }
 
 TEST_F(ThreadPoolFairTest, StatsAndTheProcessPool) {
@@ -387,6 +403,7 @@ TEST_F(ThreadPoolFairTest, StatsAndTheProcessPool) {
    EXPECT_EQ(pool.Get(), GetThreadPool());
    SetThreadPool(nullptr);
    EXPECT_NE(std::string::npos, queue->ToString().find("WorkQueue.Stats, type = fair, priority = 5 , itemWeight = 1"));
+   Finish();
 }
 
 }  // namespace

@@ -22,7 +22,12 @@ protected:
    WorkQueueTest() : control(new TestThreadControl(true)) {
       pool = MakePool({{"minThreads", "4"}, {"maxThreads", "8"}}, control.Get());
    }
-   ~WorkQueueTest() override { ShutDown(pool.Get()); }
+   // Shuts down before the test's locals, which items may still use, go away.
+   void Finish() {
+      if (pool) ShutDown(pool.Get());
+      pool.Reset();
+   }
+   ~WorkQueueTest() override { Finish(); }
 
    Ref<TestThreadControl> control;
    Ref<ThreadPoolFair> pool;
@@ -63,6 +68,7 @@ TEST_F(WorkQueueTest, SerialQueuesNeverOverlapAndKeepOrder) {
       ASSERT_EQ(static_cast<size_t>(kItems), track.order.size());
       for (int i = 0; i < kItems; ++i) ASSERT_EQ(i, track.order[i]) << track.queue->GetId();
    }
+   Finish();
 }
 
 TEST_F(WorkQueueTest, FairQueueItemsRunSideBySide) {
@@ -89,6 +95,7 @@ TEST_F(WorkQueueTest, FairQueueItemsRunSideBySide) {
       std::lock_guard<std::mutex> lock(mutex);
       return running == 0 && queue->GetQueueSize() == 0;
    }, "the items to end");
+   Finish();
 }
 
 TEST_F(WorkQueueTest, DescribesItself) {
@@ -99,6 +106,7 @@ TEST_F(WorkQueueTest, DescribesItself) {
    Ref<WorkQueue> completion;
    serial->GetCompletionQueue(completion);
    EXPECT_EQ(serial.Get(), completion.Get());
+   Finish();
 }
 
 }  // namespace
