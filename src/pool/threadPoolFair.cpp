@@ -15,6 +15,7 @@
 #include "pelmora/exception/panic.h"
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/perfCounter/publishedMap.h"
+#include "pelmora/perfCounter/registry.h"
 #include "pelmora/service/logMacros.h"
 #include "pelmora/system/systemFactory.h"
 #include "src/pool/pollScheduler.h"
@@ -163,6 +164,8 @@ ThreadPoolFair::ThreadPoolFair(Service::Config::View* view, ThreadControl* threa
    _defaultLongTaskQueue = created.Cast<WorkQueueImpl>();
    _mainThreadQueue = new WorkQueueImpl(WorkQueueSpec("MainThreadQueue", 0), WorkQueueImpl::KIND_SERIAL,
                                         this, nullptr);
+   for (WorkQueueImpl* queue : {_defaultIOQueue.Get(), _defaultLongTaskQueue.Get(), _mainThreadQueue.Get()})
+      queue->PublishStats(PerfCounter::GetCounterRegistry());
 
    if (view) view->Get("threadNamePrefix", &_threadNamePrefix);
    int stackSizeKb = ReadInt(view, "ThreadStackSizeKb", kDefaultStackSizeKb);
@@ -415,10 +418,12 @@ void ThreadPoolFair::CreateQueueInt(const WorkQueueSpec& spec, WorkQueueImpl::Ki
 
 void ThreadPoolFair::CreateSerialWorkQueue(const WorkQueueSpec& spec, Ref<WorkQueue>& out) {
    CreateQueueInt(spec, WorkQueueImpl::KIND_SERIAL, out);
+   out.Cast<WorkQueueImpl>()->PublishStats(PerfCounter::GetCounterRegistry());
 }
 
 void ThreadPoolFair::CreateFairWorkQueue(const WorkQueueSpec& spec, Ref<WorkQueue>& out) {
    CreateQueueInt(spec, WorkQueueImpl::KIND_FAIR, out);
+   out.Cast<WorkQueueImpl>()->PublishStats(PerfCounter::GetCounterRegistry());
 }
 
 void ThreadPoolFair::FindCompletionQueue(const WorkQueueSpec& spec, Ref<WorkQueue>& out) {

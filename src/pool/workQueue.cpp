@@ -7,7 +7,9 @@
 #include "pelmora/exception/panic.h"
 #include "pelmora/exception/throwable.h"
 #include "pelmora/formatter/messageFormatter.h"
+#include "pelmora/perfCounter/counter.h"
 #include "pelmora/perfCounter/lwStats.h"
+#include "pelmora/perfCounter/registry.h"
 #include "pelmora/service/logMacros.h"
 #include "src/pool/priorityInfo.h"
 #include "src/pool/threadPoolFair.h"
@@ -120,12 +122,72 @@ void WorkQueueImpl::ItemCompleted(long long elapsedMicroseconds) {
 
 void WorkQueueImpl::Close(Ref<ThreadPoolFair>& pool) {
    std::deque<Ref<WorkItem>> dropped;
+   Ref<PerfCounter::RegistryItem> stats;
    {
       Synchronized lock(this);
       _closed.store(true, std::memory_order_release);
       dropped.swap(_items);
       pool = std::move(_keepPool);
+      stats = std::move(_statsItem);
    }
+   // Outside the queue lock: the registry collects values under its own lock, then ours.
+   if (stats) stats->Unregister();
+}
+
+const char* const WorkQueueImpl::kStatNames[5] = {"QueueSize", "currentConcurrency", "ExecutionCount",
+                                                  "TotalExecionCount", "TotalExecutionTime"};
+
+void WorkQueueImpl::ReadStats(long long values[5]) {
+   Synchronized lock(this);
+   values[0] = static_cast<long long>(_items.size());
+   values[1] = _executing;
+   values[2] = _dispatched;
+   values[3] = _completed;
+   values[4] = _executionMicroseconds;
+}
+
+namespace {
+
+// Reads a queue's counters for the registry; holds the queue until it unregisters at Close.
+class QueueStatsPublisher : public virtual PerfCounter::GroupPublisher, public ObjectImpl {
+public:
+   explicit QueueStatsPublisher(WorkQueueImpl* queue) : _queue(queue) {}
+   void CollectValues(RefVector<PerfCounter::Metadata>& metadata,
+                      std::vector<PerfCounter::Value>& values) override {
+      long long read[5];
+      _queue->ReadStats(read);
+      values.clear();
+      for (size_t i = 0; i < metadata.size() && i < 5; ++i) values.emplace_back(read[i]);
+   }
+
+private:
+   const Ref<WorkQueueImpl> _queue;
+};
+
+}  // namespace
+
+void WorkQueueImpl::PublishStats(PerfCounter::Registry* registry) {
+   RefVector<PerfCounter::Metadata> metadata;
+   for (int i = 0; i < 5; ++i) {
+      auto type = i < 2 ? PerfCounter::Metadata::TYPE_GAUGE : PerfCounter::Metadata::TYPE_COUNTER;
+      metadata.push_back(new PerfCounter::Metadata(
+          "/ThreadPool/Pelmora/WorkQueue/" + _id + "/" + kStatNames[i], type));
+   }
+   Ref<PerfCounter::RegistryItem> item;
+   try {
+      registry->RegisterGroup(metadata, new QueueStatsPublisher(this), item);
+   } catch (const Exception& e) {
+      PELMORA_LOG_WARNING(GetPoolLogger(), "WorkQueue.%1 publishes no counters: %2", _id, e.GetMessage());
+      return;
+   }
+   {
+      Synchronized lock(this);
+      if (!_closed.load(std::memory_order_acquire)) {
+         _statsItem = item;
+         return;
+      }
+   }
+   item->Unregister();  // closed meanwhile
 }
 
 void WorkQueueImpl::GetStats(PerfCounter::LwStatsBuilder& builder) {
@@ -138,17 +200,19 @@ void WorkQueueImpl::GetStats(PerfCounter::LwStatsBuilder& builder) {
       completed = _completed;
       time = _executionMicroseconds;
    }
+   // Statistics keys take an upper-case letter after every "/" and quote free text, so the
+   // id is quoted and the running count is capitalised here; the registry's counters keep
+   // the names exactly (PublishStats).
    PerfCounter::CounterFactory counter;
    builder.Push("ThreadPool");
    builder.Push("Pelmora");
-   builder.Push("WorkQueue");
-   builder.Push(_id);
+   builder.Push("WorkQueue", _id);
    builder.Insert("QueueSize", size, counter);
-   builder.Insert("currentConcurrency", executing, counter);
+   builder.Insert("CurrentConcurrency", executing, counter);
    builder.Insert("ExecutionCount", dispatched, counter);
    builder.Insert("TotalExecionCount", completed, counter);
    builder.Insert("TotalExecutionTime", time, counter);
-   for (int i = 0; i < 4; ++i) builder.Pop();
+   for (int i = 0; i < 3; ++i) builder.Pop();
 }
 
 std::string WorkQueueImpl::ToString() const {

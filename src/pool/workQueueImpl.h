@@ -14,6 +14,8 @@
 
 namespace Pelmora::PerfCounter {
 class LwStatsBuilder;
+class Registry;
+class RegistryItem;
 }
 
 namespace Pelmora::System {
@@ -66,6 +68,13 @@ public:
    // queue's reference to its pool (released by the caller, outside the queue).
    void Close(Ref<ThreadPoolFair>& pool);
    void GetStats(PerfCounter::LwStatsBuilder& builder);
+   // Registers the queue's counters "/ThreadPool/Pelmora/WorkQueue/<id>/<value>" until
+   // Close. A name taken already (a queue of the same id in another live pool) is logged
+   // and the queue goes without counters. Called without any lock held.
+   void PublishStats(PerfCounter::Registry* registry);
+   // The five values in the order of kStatNames.
+   void ReadStats(long long values[5]);
+   static const char* const kStatNames[5];
    PriorityInfo* GetPriorityInfo() const { return _level; }
 
    static Atomic<long long> enqCount;
@@ -80,6 +89,7 @@ private:
    Ref<ThreadPoolFair> _keepPool;  // until Close: a queue in use keeps its pool
    std::atomic<bool> _closed{false};
    std::deque<Ref<WorkItem>> _items;
+   Ref<PerfCounter::RegistryItem> _statsItem;  // registered counters, until Close
    PriorityInfo* const _level;
    int32_t _executing = 0;
    int32_t _dispatched = 0;  // since the queue last became non-empty

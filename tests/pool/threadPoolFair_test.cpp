@@ -393,17 +393,33 @@ TEST_F(ThreadPoolFairTest, StatsAndTheProcessPool) {
       long long completed = 0;
       builder->Push("ThreadPool");
       builder->Push("Pelmora");
-      builder->Push("WorkQueue");
-      builder->Push("Stats");
+      builder->Push("WorkQueue", "Stats");
       builder->GetTotalCount("TotalExecionCount", completed);
       return completed == 3;
    }, "the completed count");
+   // The registry carries the queue's counters under their exact names until shutdown.
+   auto registered = [](const std::string& name, long long* value) {
+      std::vector<std::string> names{name};
+      Ref<PerfCounter::Query> query;
+      PerfCounter::GetCounterRegistry()->CreateNamesQuery(names, query);
+      PerfCounter::QueryResults results;
+      query->Execute(results);
+      if (results.empty()) return false;
+      if (value) *value = results[0].value.Get();
+      return true;
+   };
+   long long completed = 0;
+   EXPECT_TRUE(registered("/ThreadPool/Pelmora/WorkQueue/Stats/TotalExecionCount", &completed));
+   EXPECT_EQ(3, completed);
+   EXPECT_TRUE(registered("/ThreadPool/Pelmora/WorkQueue/Stats/currentConcurrency", nullptr));
+   EXPECT_TRUE(registered("/ThreadPool/Pelmora/WorkQueue/DefaultIOQueue/QueueSize", nullptr));
    EXPECT_EQ(nullptr, GetThreadPool());
    SetThreadPool(pool.Get());
    EXPECT_EQ(pool.Get(), GetThreadPool());
    SetThreadPool(nullptr);
    EXPECT_NE(std::string::npos, queue->ToString().find("WorkQueue.Stats, type = fair, priority = 5 , itemWeight = 1"));
    Finish();
+   EXPECT_FALSE(registered("/ThreadPool/Pelmora/WorkQueue/Stats/QueueSize", nullptr));
 }
 
 }  // namespace
