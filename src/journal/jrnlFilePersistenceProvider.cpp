@@ -59,6 +59,7 @@ public:
    }
 
    void WriteRecord(const char* data, unsigned int length) override {
+      if (!data || length == 0) throw InvalidArgumentException("empty journal record");
       std::string record(4 + length, '\0');
       for (int i = 0; i < 4; ++i) record[i] = static_cast<char>(length >> (8 * i));
       std::memcpy(&record[4], data, length);

@@ -259,7 +259,8 @@ private:
    std::string _id;
 };
 
-// Where records are kept. WriteRecord appends one record and makes it durable before
+// Where records are kept. WriteRecord appends one non-empty record (an empty one could
+// not be told from a torn one: InvalidArgumentException) and makes it durable before
 // returning; ReadRecord hands back the next record in a new[] buffer of length + 1 bytes
 // (the caller deletes it), or false at the end (a torn last record counts as the end).
 class PELMORA_EXPORT JrnlPersistenceProvider : public virtual Object {
