@@ -79,6 +79,7 @@ public:
       char prefix[4];
       if (!ReadAt(_readOffset, prefix, 4)) return false;
       uint32_t n = ReadU32(prefix);
+      if (n > _end - _readOffset - 4) return false;  // never allocate for a length past the end
       buffer = new char[size_t(n) + 1];
       if (!ReadAt(_readOffset + 4, buffer, n)) {
          delete[] buffer;
