@@ -1,5 +1,7 @@
 #pragma once
-// The XML document model, its serialisers and simple paths, and the expat-based parser.
+// The XML document model, its serialisers and simple paths, the expat-based parser, and
+// canonicalisation for signatures.
 
 #include "pelmora/xml/node.h"
 #include "pelmora/xml/parser.h"
+#include "pelmora/xml/security/canonicalizer.h"

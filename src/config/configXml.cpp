@@ -5,7 +5,8 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/formatter/messageFormatter.h"
-#include "pelmora/xml.h"
+#include "pelmora/xml/node.h"
+#include "pelmora/xml/parser.h"
 #include "src/config/configBase.h"
 #include "src/config/configText.h"
 
