@@ -159,11 +159,11 @@ void C14NCanonicalizer::GatherAllVisibleNamespaces(
    // Nearest first: the nearest ancestor's xml:lang or xml:space is the one in force.
    for (ElementNode* ancestor : ancestors) {
       ancestor->GetAttributes(attributes);
-      for (const auto& [name, value] : attributes) {
-         if (name.compare(0, 4, "xml:") != 0) continue;
+      for (const auto& attribute : attributes) {
+         if (attribute.first.compare(0, 4, "xml:") != 0) continue;
          auto known = std::find_if(xmlAttributes->begin(), xmlAttributes->end(),
-                                   [&](const auto& a) { return a.first == name; });
-         if (known == xmlAttributes->end()) xmlAttributes->emplace_back(name, value);
+                                   [&](const auto& a) { return a.first == attribute.first; });
+         if (known == xmlAttributes->end()) xmlAttributes->push_back(attribute);
       }
    }
 }

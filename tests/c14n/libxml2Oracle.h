@@ -76,13 +76,25 @@ inline int OracleVisible(void* data, xmlNodePtr node, xmlNodePtr parent) {
    return 0;
 }
 
+inline void CountOracleError(void* count, xmlErrorPtr) {
+   ++*static_cast<int*>(count);
+}
+
+// With `strict`, a document libxml2 reports anything about (a namespace error or warning
+// it would otherwise recover from) counts as refused.
 inline std::optional<std::string> OracleCanonical(const std::string& text, const std::string& path, bool exclusive,
                                                   const std::vector<std::string>& prefixes,
-                                                  bool hideDroppedKinds = true) {
+                                                  bool hideDroppedKinds = true, bool strict = false) {
+   int errors = 0;
+   xmlSetStructuredErrorFunc(&errors, CountOracleError);
    xmlDocPtr doc = xmlReadMemory(text.data(), static_cast<int>(text.size()), "oracle.xml", nullptr,
-                                 XML_PARSE_NOENT | XML_PARSE_DTDATTR | XML_PARSE_NONET | XML_PARSE_NOERROR |
-                                     XML_PARSE_NOWARNING | XML_PARSE_HUGE);
+                                 XML_PARSE_NOENT | XML_PARSE_DTDATTR | XML_PARSE_NONET | XML_PARSE_HUGE);
+   xmlSetStructuredErrorFunc(nullptr, nullptr);
    if (doc == nullptr) return std::nullopt;
+   if (strict && errors > 0) {
+      xmlFreeDoc(doc);
+      return std::nullopt;
+   }
    xmlNodePtr apex = reinterpret_cast<xmlNodePtr>(doc);
    std::vector<std::string> steps = SplitPath(path);
    for (size_t i = 0; i < steps.size() && apex != nullptr; ++i) {
