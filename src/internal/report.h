@@ -3,6 +3,7 @@
 // the logging layer installs a sink at start-up that writes through the default logger
 // and its in-memory output. Levels use the logger's bit values.
 
+#include <chrono>
 #include <string>
 
 namespace Pelmora::Internal {
@@ -29,5 +30,9 @@ void SetReportSink(ReportSink* sink);
 // Installs `sink` unless another one is installed; true when it is now the sink.
 bool SetReportSinkIfUnset(ReportSink* sink);
 ReportSink& GetReportSink();
+
+// How long a panic's report child may take to log before its watchdog writes the report
+// to standard error without locks and ends it. 30 s unless changed.
+void SetPanicReportTimeout(std::chrono::milliseconds limit);
 
 }  // namespace Pelmora::Internal

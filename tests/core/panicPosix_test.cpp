@@ -1,9 +1,20 @@
 #include <gtest/gtest.h>
 
+#include <poll.h>
+#include <signal.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <atomic>
+#include <chrono>
+#include <memory>
+#include <thread>
+#include <vector>
+
 #include "pelmora/exception.h"
+#include "pelmora/service/logMacros.h"
+#include "pelmora/service/logger.h"
+#include "src/internal/report.h"
 
 namespace Pelmora {
 namespace {
@@ -54,6 +65,82 @@ TEST(PanicTest, AForkedChildWritesTheReportAndTheProcessDumpsCore) {
    EXPECT_EQ(SIGABRT, WTERMSIG(status));
    EXPECT_EQ(0u, report.find("\n\nPanic: Assert Failed: \"forked\" @ a/b:9\nBacktrace:\n#0 "))
       << report;
+}
+
+// Everything the process at `pid` and its report child write to `fd`, until both close it
+// or `deadline` passes (then the process is killed and `timedOut` set).
+std::string ReadUntilClosed(int fd, pid_t pid, std::chrono::steady_clock::time_point deadline,
+                            bool& timedOut) {
+   std::string text;
+   char buffer[4096];
+   timedOut = false;
+   for (;;) {
+      auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+          deadline - std::chrono::steady_clock::now());
+      pollfd entry{fd, POLLIN, 0};
+      if (left.count() <= 0 || poll(&entry, 1, static_cast<int>(left.count())) == 0) {
+         timedOut = true;
+         kill(pid, SIGKILL);
+         break;
+      }
+      ssize_t n = read(fd, buffer, sizeof(buffer));
+      if (n <= 0) break;
+      text.append(buffer, static_cast<size_t>(n));
+   }
+   return text;
+}
+
+// Other threads hold the allocator's and the logger's locks at any moment; the report child
+// must get its report out regardless, each time.
+TEST(PanicTest, TheReportArrivesWhileOtherThreadsLogAndAllocate) {
+   constexpr int kRounds = 12;
+   auto end = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+   for (int round = 0; round < kRounds; ++round) {
+      int pipeFds[2];
+      ASSERT_EQ(0, pipe(pipeFds));
+      pid_t pid = fork();
+      ASSERT_GE(pid, 0);
+      if (pid == 0) {
+         dup2(pipeFds[1], STDERR_FILENO);
+         close(pipeFds[0]);
+         close(pipeFds[1]);
+         SetPanicMayFork(true);
+         Internal::SetPanicReportTimeout(std::chrono::milliseconds(200));
+         Service::Logger* logger = Service::GetDefaultLogger();
+         std::atomic<int> busy{0};
+         std::vector<std::thread> threads;
+         for (int i = 0; i < 3; ++i) {
+            threads.emplace_back([&, i] {
+               bool counted = false;
+               for (unsigned n = 0;; ++n) {
+                  if (i == 0) {
+                     auto block = std::make_unique<char[]>(64 + n % 4096);
+                     block[0] = 1;
+                  } else {
+                     PELMORA_LOG_ERROR(logger, "busy line %1 from %2", n, i);
+                  }
+                  if (!counted && n == 200) {
+                     counted = true;
+                     busy.fetch_add(1);
+                  }
+               }
+            });
+         }
+         while (busy.load() < 3) std::this_thread::yield();
+         PanicVerify("hammered", "a/b", round);
+      }
+      close(pipeFds[1]);
+      bool timedOut = false;
+      std::string report = ReadUntilClosed(pipeFds[0], pid, end, timedOut);
+      close(pipeFds[0]);
+      int status = 0;
+      ASSERT_EQ(pid, waitpid(pid, &status, 0));
+      ASSERT_FALSE(timedOut) << "round " << round << " never finished its report";
+      EXPECT_TRUE(WIFSIGNALED(status));
+      std::string first = "Panic: Assert Failed: \"hammered\" @ a/b:" + std::to_string(round) +
+                          "\nBacktrace:\n#0 ";
+      ASSERT_NE(std::string::npos, report.find(first)) << "round " << round;
+   }
 }
 
 }  // namespace
