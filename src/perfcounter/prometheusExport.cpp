@@ -3,14 +3,17 @@
 
 #include "pelmora/perfCounter/prometheus.h"
 
+#include <algorithm>
 #include <charconv>
+#include <cstring>
+#include <memory_resource>
 #include <initializer_list>
-#include <map>
 #include <optional>
 #include <string_view>
 #include <unordered_map>
 #include <unordered_set>
 
+#include "pelmora/exception/panic.h"
 #include "pelmora/perfCounter/meter.h"
 
 namespace Pelmora::PerfCounter {
@@ -95,11 +98,11 @@ void AppendEscaped(std::string& out, std::string_view text, bool quotes) {
    }
 }
 
-// `base` followed by the label set, with one extra label when `extraName` is given.
-std::string SeriesName(std::string_view base, const Labels& labels,
-                       const char* extraName = nullptr, const char* extraValue = nullptr) {
-   std::string text(base);
-   if (labels.empty() && !extraName) return text;
+// Appends `base` followed by the label set, with one extra label when `extraName` is given.
+void AppendSeriesName(std::string& text, std::string_view base, const Labels& labels,
+                      const char* extraName = nullptr, const char* extraValue = nullptr) {
+   text += base;
+   if (labels.empty() && !extraName) return;
    text += '{';
    bool first = true;
    for (const auto& [name, value] : labels) {
@@ -118,11 +121,10 @@ std::string SeriesName(std::string_view base, const Labels& labels,
       text += '"';
    }
    text += '}';
-   return text;
 }
 
 struct Series {
-   std::string name;  // the sample's metric name with labels
+   std::string_view name;  // the sample's metric name with labels, in the exposition's store
    long long value;
    bool nan;  // the value is not a number: a meter without samples
 };
@@ -134,9 +136,22 @@ struct Family {
 };
 
 // The families being built, and who owns each sample name so that a family of another
-// type cannot claim it.
+// type cannot claim it. Names are kept once, in a store whose text never moves, and
+// looked up by view; families are put in name order only when written. The lookups
+// allocate from one arena that goes with the exposition.
 class Exposition {
 public:
+   explicit Exposition(size_t expected)
+       : _owners(expected, &_arena), _seriesNames(expected, &_arena) {}
+
+   // The series name of `base` with `labels` (and the extra label), kept in the store.
+   std::string_view SeriesName(std::string_view base, const Labels& labels,
+                               const char* extraName = nullptr, const char* extraValue = nullptr) {
+      _scratch.clear();
+      AppendSeriesName(_scratch, base, labels, extraName, extraValue);
+      return Keep(_scratch);
+   }
+
    // Whether `family` of `type` may take `sampleNames`: no family of that name has another
    // type and no other family owns one of the names.
    bool CanAdd(const std::string& family, const char* type,
@@ -155,30 +170,58 @@ public:
    bool Add(const std::string& family, const char* type, const char* helpPrefix,
             const std::string& pattern, std::initializer_list<const std::string*> sampleNames,
             std::vector<Series>& series) {
-      if (!CanAdd(family, type, sampleNames)) return false;
-      for (const Series& s : series) {
-         if (_seriesNames.count(s.name)) return false;
-      }
+      // Each name is hashed once: the family and the series are entered first and taken
+      // out again on a clash, which is rare.
       auto [entry, added] = _families.try_emplace(family);
       Family& target = entry->second;
+      if (!added && target.type != type) return false;
+      const std::string* owners[3] = {};
+      PELMORA_VERIFY(sampleNames.size() <= 3);
+      size_t next = 0;
+      bool clash = false;
+      for (const std::string* sample : sampleNames) {
+         auto owner = _owners.find(*sample);
+         if (owner == _owners.end()) {
+            owners[next++] = sample;
+         } else if (owner->second != &entry->first) {
+            clash = true;
+         }
+      }
+      size_t entered = 0;
+      while (!clash && entered < series.size()) {
+         if (_seriesNames.insert(series[entered].name).second) {
+            ++entered;
+         } else {
+            clash = true;
+         }
+      }
+      if (clash) {
+         for (size_t i = 0; i < entered; ++i) _seriesNames.erase(series[i].name);
+         if (added) _families.erase(entry);
+         return false;
+      }
       if (added) {
          target.type = type;
          target.help = helpPrefix;
          target.help += pattern;
       }
-      for (const std::string* sample : sampleNames) _owners.try_emplace(*sample, &entry->first);
-      for (Series& s : series) {
-         _seriesNames.insert(s.name);
-         target.series.push_back(std::move(s));
-      }
+      for (size_t i = 0; i < next; ++i) _owners.emplace(Keep(*owners[i]), &entry->first);
+      target.series.insert(target.series.end(), series.begin(), series.end());
       return true;
    }
 
    void Write(Writer* writer) const {
+      std::vector<const std::pair<const std::string, Family>*> ordered;
+      ordered.reserve(_families.size());
+      for (const auto& entry : _families) ordered.push_back(&entry);
+      std::sort(ordered.begin(), ordered.end(),
+                [](const auto* a, const auto* b) { return a->first < b->first; });
       std::string text;
       text.reserve(kFlushSize + 4096);
       char number[24];
-      for (const auto& [name, family] : _families) {
+      for (const auto* entry : ordered) {
+         const std::string& name = entry->first;
+         const Family& family = entry->second;
          text += "# HELP ";
          text += name;
          text += ' ';
@@ -212,10 +255,18 @@ private:
       text.clear();
    }
 
-   std::map<std::string, Family> _families;
+   std::string_view Keep(std::string_view name) {
+      void* text = _arena.allocate(name.size() + 1, 1);
+      std::memcpy(text, name.data(), name.size());
+      return {static_cast<const char*>(text), name.size()};
+   }
+
+   std::pmr::monotonic_buffer_resource _arena{64 * 1024};
+   std::string _scratch;
+   std::unordered_map<std::string, Family> _families;
    // Sample name to the name of the family that owns it (a key of _families).
-   std::unordered_map<std::string, const std::string*> _owners;
-   std::unordered_set<std::string> _seriesNames;
+   std::pmr::unordered_map<std::string_view, const std::string*> _owners;
+   std::pmr::unordered_set<std::string_view> _seriesNames;
 };
 
 const char* const kSummary = "summary";
@@ -232,23 +283,23 @@ void AddMeter(Exposition& out, const MeterParts& meter, MappedPath& mapped) {
    const std::string& name = mapped.name;
    const auto& fields = meter.fields;
    bool empty = fields[Meter::COUNTER_NUM_SAMPLES] && *fields[Meter::COUNTER_NUM_SAMPLES] == 0;
-   auto series = [&](std::string seriesName, Meter::Counter c) {
-      return Series{std::move(seriesName), *fields[c],
+   auto series = [&](std::string_view seriesName, Meter::Counter c) {
+      return Series{seriesName, *fields[c],
                     empty && c != Meter::COUNTER_TOTAL && c != Meter::COUNTER_NUM_SAMPLES};
    };
    std::vector<Series> summary;
    if (fields[Meter::COUNTER_MIN]) {
-      summary.push_back(series(SeriesName(name, mapped.labels, "quantile", "0"), Meter::COUNTER_MIN));
+      summary.push_back(series(out.SeriesName(name, mapped.labels, "quantile", "0"), Meter::COUNTER_MIN));
    }
    if (fields[Meter::COUNTER_MAX]) {
-      summary.push_back(series(SeriesName(name, mapped.labels, "quantile", "1"), Meter::COUNTER_MAX));
+      summary.push_back(series(out.SeriesName(name, mapped.labels, "quantile", "1"), Meter::COUNTER_MAX));
    }
    const std::string sumName = name + "_sum", countName = name + "_count";
    if (fields[Meter::COUNTER_TOTAL]) {
-      summary.push_back(series(SeriesName(sumName, mapped.labels), Meter::COUNTER_TOTAL));
+      summary.push_back(series(out.SeriesName(sumName, mapped.labels), Meter::COUNTER_TOTAL));
    }
    if (fields[Meter::COUNTER_NUM_SAMPLES]) {
-      summary.push_back(series(SeriesName(countName, mapped.labels), Meter::COUNTER_NUM_SAMPLES));
+      summary.push_back(series(out.SeriesName(countName, mapped.labels), Meter::COUNTER_NUM_SAMPLES));
    }
    const std::string meanName = name + "_mean";
    bool hasMean = fields[Meter::COUNTER_MEAN].has_value();
@@ -259,7 +310,7 @@ void AddMeter(Exposition& out, const MeterParts& meter, MappedPath& mapped) {
    }
    if (hasMean) {
       std::vector<Series> mean;
-      mean.push_back(series(SeriesName(meanName, mapped.labels), Meter::COUNTER_MEAN));
+      mean.push_back(series(out.SeriesName(meanName, mapped.labels), Meter::COUNTER_MEAN));
       out.Add(meanName, kGauge, "Mean of meter ", mapped.pattern, {&meanName}, mean);
    }
 }
@@ -269,7 +320,7 @@ void AddCounter(Exposition& out, const QueryResult& result, MappedPath& mapped,
    MapPath(result.metadata->GetName(), mapped);
    bool isCounter = result.metadata->GetType() == Metadata::TYPE_COUNTER;
    scratch.clear();
-   scratch.push_back({SeriesName(mapped.name, mapped.labels), result.value.Get(), false});
+   scratch.push_back({out.SeriesName(mapped.name, mapped.labels), result.value.Get(), false});
    out.Add(mapped.name, isCounter ? kCounter : kGauge, isCounter ? "Counter " : "Gauge ",
            mapped.pattern, {&mapped.name}, scratch);
 }
@@ -311,7 +362,7 @@ void WritePrometheusText(Registry* registry, Writer* writer) {
       meters[it->second].fields[type - Metadata::TYPE_METER_TOTAL] = result.value.Get();
    }
 
-   Exposition exposition;
+   Exposition exposition(results.size());
    MappedPath mapped;
    std::vector<Series> scratch;
    for (const Item& item : items) {
