@@ -237,7 +237,8 @@ void PrintFormatter::FormatStringView(Writer* writer, const FormatValue& value, 
 
 void PrintFormatter::FormatObject(Writer* writer, const FormatValue& value, const char*) {
    if (!value.object) return WriteNull(writer);
-   std::string text = value.object->ToString();
+   // Describing an object does not change it; ToString is not const for its overriders.
+   std::string text = const_cast<Object*>(value.object)->ToString();
    WriteAll(writer, text.data(), text.size());
 }
 

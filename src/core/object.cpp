@@ -1,6 +1,7 @@
 // Reference counting, the first/last-reference hooks and the object's text form.
 
 #include <sstream>
+#include <utility>
 
 #include "pelmora/exception/panic.h"
 #include "pelmora/object/ref.h"
@@ -20,7 +21,8 @@ const char* TypeName(const std::type_info& type) {
 void ObjectImpl::IncRef() const {
    if (_refCount.ReadInc() != 0) return;
    try {
-      FirstIncRef(typeid(*this));
+      // Counting is const so that a Ref<const T> works; the hooks see the object whole.
+      const_cast<ObjectImpl*>(this)->FirstIncRef(typeid(*this));
    } catch (...) {
       // The object never became live: undo the count and destroy it.
       if (_refCount.ReadDec() != 1) {
@@ -34,7 +36,7 @@ void ObjectImpl::IncRef() const {
 int ObjectImpl::DecRef() const {
    int before = _refCount.ReadDec();
    if (before != 1) return before;
-   FinalDecRef(typeid(*this));
+   const_cast<ObjectImpl*>(this)->FinalDecRef(typeid(*this));
    delete this;
    return before;
 }
@@ -42,6 +44,8 @@ int ObjectImpl::DecRef() const {
 ObjectImpl::~ObjectImpl() {
    if (_refCount.Read() != 0) PanicVerify("0 == _refCount", __FILE__, __LINE__);
 }
+
+std::string ObjectImpl::ToString() { return std::as_const(*this).ToString(); }
 
 std::string ObjectImpl::ToString() const {
    try {
@@ -61,7 +65,7 @@ std::string ObjectImpl::ToString() const {
    }
 }
 
-void ObjectImpl::FirstIncRef(const std::type_info& type) const {
+void ObjectImpl::FirstIncRef(const std::type_info& type) {
    Scoreboard* scoreboard = Internal::GetOrCreateScoreboard();
    scoreboard->Increment(TypeName(type));
    if (RefTracker* tracker = GetRefTracker()) {
@@ -70,7 +74,7 @@ void ObjectImpl::FirstIncRef(const std::type_info& type) const {
    }
 }
 
-void ObjectImpl::FinalDecRef(const std::type_info& type) const {
+void ObjectImpl::FinalDecRef(const std::type_info& type) {
    if (Scoreboard* scoreboard = GetScoreboard()) scoreboard->Decrement(TypeName(type));
    if (RefTracker* tracker = GetRefTracker()) tracker->OnFinalDecRef(this, type);
 }

@@ -21,7 +21,7 @@ public:
    explicit RefTrackerImpl(const std::unordered_set<std::string>& classNames)
       : _classNames(classNames) {}
 
-   void OnFirstIncRef(const Object* obj, const std::type_info& type) override {
+   void OnFirstIncRef(Object* obj, const std::type_info& type) override {
       PELMORA_VERIFY(obj != NULL);
       const char* name = TypeName(type);
       if (!name || _classNames.count(name) == 0) return;
@@ -35,7 +35,7 @@ public:
       _objects[obj] = &_records.find(text)->first;
    }
 
-   void OnFinalDecRef(const Object* obj, const std::type_info&) override {
+   void OnFinalDecRef(Object* obj, const std::type_info&) override {
       System::NativeSynchronized lock(_mutex);
       auto it = _objects.find(obj);
       if (it == _objects.end()) return;

@@ -51,8 +51,8 @@ public:
       _wrapped = false;
    }
 
-   const char* GetCurrentWritePointer() const override { return _ring.get() + _position; }
-   const char* GetBufferStart() const override { return _ring.get(); }
+   const char* GetCurrentWritePointer() override { return _ring.get() + _position; }
+   const char* GetBufferStart() override { return _ring.get(); }
    int GetRingSize() const override { return _size; }
 
 protected:

@@ -18,7 +18,7 @@ public:
 
    // Keeps the capacity: a writer that is reset is usually refilled to a similar size.
    void Reset() override { _string.clear(); }
-   int GetLength() const override { return static_cast<int>(_string.size()); }
+   int GetLength() override { return static_cast<int>(_string.size()); }
    const std::string& GetString() const override { return _string; }
    void Reserve(unsigned int size) override { _string.reserve(size); }
 

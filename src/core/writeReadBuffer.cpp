@@ -62,7 +62,7 @@ public:
       _readOffset = 0;
    }
 
-   long long GetSize() const override { return _size; }
+   long long GetSize() override { return _size; }
 
    // The bytes stay readable: closing the writing side is what usually precedes reading.
    void Close() override {}

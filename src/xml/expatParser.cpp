@@ -36,7 +36,7 @@ public:
       _handler = handler;
    }
 
-   XMLHandler* GetXMLHandler() const override { return _handler.Get(); }
+   XMLHandler* GetXMLHandler() override { return _handler.Get(); }
 
    void Parse(Reader* reader, bool restricted, Ref<Object>& result) override;
 

@@ -66,6 +66,19 @@ TEST(ExceptionTest, EveryClassIsCaughtAsException) {
    }
 }
 
+// An exception class of the application's own, with Throw in its documented form.
+class ApplicationException : public Exception {
+public:
+   ApplicationException() : Exception("application") {}
+   ApplicationException* Clone() const override { return new ApplicationException(*this); }
+   [[noreturn]] void Throw() override { throw ApplicationException(*this); }
+};
+
+TEST(ExceptionTest, AnApplicationExceptionRethrowsAsItself) {
+   std::unique_ptr<Exception> kept(ApplicationException().Clone());
+   EXPECT_THROW(kept->Throw(), ApplicationException);
+}
+
 TEST(ExceptionTest, CloneAndThrowKeepTheDynamicTypeAcrossThreads) {
    std::unique_ptr<Exception> kept;
    try {

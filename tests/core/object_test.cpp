@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "pelmora/exception.h"
+#include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/object.h"
 #include "tests/support/watchdog.h"
 
@@ -32,11 +33,47 @@ public:
    ~RefusesFirstReference() override { *_destroyed = true; }
 
 protected:
-   void FirstIncRef(const std::type_info&) const override { throw InvalidStateException(); }
+   void FirstIncRef(const std::type_info&) override { throw InvalidStateException(); }
 
 private:
    bool* _destroyed;
 };
+
+// Overrides the operations in the form the interfaces document: ToString and the hooks
+// are not const.
+class DescribesItself : public ObjectImpl {
+public:
+   DescribesItself(int* firsts, int* finals) : _firsts(firsts), _finals(finals) {}
+   std::string ToString() override { return "itself"; }
+
+protected:
+   void FirstIncRef(const std::type_info& type) override {
+      ++*_firsts;
+      ObjectImpl::FirstIncRef(type);
+   }
+   void FinalDecRef(const std::type_info& type) override {
+      ++*_finals;
+      ObjectImpl::FinalDecRef(type);
+   }
+
+private:
+   int* _firsts;
+   int* _finals;
+};
+
+TEST(RefTest, OverridesOfTheDocumentedFormsAreTheOnesCalled) {
+   int firsts = 0, finals = 0;
+   {
+      Ref<DescribesItself> object = new DescribesItself(&firsts, &finals);
+      Ref<Object> other = object;
+      EXPECT_EQ("itself", other->ToString());
+      const Object* constant = object.Get();
+      EXPECT_EQ("<itself>", MessageFormatter::ASPrint("<%1>", constant));
+      EXPECT_EQ(1, firsts);
+      EXPECT_EQ(0, finals);
+   }
+   EXPECT_EQ(1, finals);
+}
 
 TEST(RefTest, CountsReferencesAndDestroysOnTheLastOne) {
    int destroyed = 0;

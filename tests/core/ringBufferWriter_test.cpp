@@ -12,7 +12,7 @@ const std::string marker("**********\0\0\0", 13);
 const std::string zeros(13, '\0');
 
 // The ring and its 13 spare bytes as they stand in memory.
-std::string Memory(const RingBufferWriter& ring) {
+std::string Memory(RingBufferWriter& ring) {
    return std::string(ring.GetBufferStart(), ring.GetRingSize() + 13);
 }
 

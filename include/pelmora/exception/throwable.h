@@ -37,12 +37,12 @@ class PELMORA_EXPORT Exception : public Throwable {
 public:
    using Throwable::Throwable;
    virtual Exception* Clone() const { return new Exception(*this); }
-   [[noreturn]] virtual void Throw() const { throw Exception(*this); }
+   [[noreturn]] virtual void Throw() { throw Exception(*this); }
 };
 
 // Declares the Clone and Throw overrides of an exception class.
 #define PELMORA_EXCEPTION_CLONE(Class)                                      \
    Class* Clone() const override { return new Class(*this); }               \
-   [[noreturn]] void Throw() const override { throw Class(*this); }
+   [[noreturn]] void Throw() override { throw Class(*this); }
 
 }  // namespace Pelmora

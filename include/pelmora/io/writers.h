@@ -12,7 +12,7 @@ namespace Pelmora {
 class PELMORA_EXPORT StringWriter : public virtual Writer {
 public:
    virtual void Reset() = 0;
-   virtual int GetLength() const = 0;
+   virtual int GetLength() = 0;
    virtual const std::string& GetString() const = 0;
    virtual void Reserve(unsigned int size) = 0;
 };
@@ -24,7 +24,7 @@ class PELMORA_EXPORT BufferedWriter : public virtual Writer {};
 // to read mode for good: a later Write throws InvalidStateException.
 class PELMORA_EXPORT WriteReadBuffer : public virtual Writer, public virtual Reader {
 public:
-   virtual long long GetSize() const = 0;
+   virtual long long GetSize() = 0;
    virtual void Rewind() = 0;
    using Writer::Close;
 };
@@ -35,8 +35,8 @@ public:
 class PELMORA_EXPORT RingBufferWriter : public virtual Writer {
 public:
    virtual void Reset() = 0;
-   virtual const char* GetCurrentWritePointer() const = 0;
-   virtual const char* GetBufferStart() const = 0;
+   virtual const char* GetCurrentWritePointer() = 0;
+   virtual const char* GetBufferStart() = 0;
    virtual int GetRingSize() const = 0;
 };
 

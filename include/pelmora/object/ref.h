@@ -23,7 +23,7 @@ public:
    // Returns the count held before the decrement.
    virtual int DecRef() const = 0;
    // "[" mangled-type-name ":" address "]", or "<Unknown Type>".
-   virtual std::string ToString() const = 0;
+   virtual std::string ToString() = 0;
    virtual int GetRefCount() const = 0;
    virtual ~Object() = default;
 };
@@ -37,7 +37,10 @@ public:
 
    void IncRef() const override;
    int DecRef() const override;
-   std::string ToString() const override;
+   // Calls the const form, so that a class may override either one.
+   std::string ToString() override;
+   // The default text, for classes that describe themselves from a const object.
+   virtual std::string ToString() const;
    int GetRefCount() const override { return _refCount.Read(); }
    // Panics unless the count is zero: an object dies only through its last DecRef.
    ~ObjectImpl() override;
@@ -47,8 +50,8 @@ public:
 
 protected:
    // Run on the 0 -> 1 and 1 -> 0 transitions with the dynamic type.
-   virtual void FirstIncRef(const std::type_info& type) const;
-   virtual void FinalDecRef(const std::type_info& type) const;
+   virtual void FirstIncRef(const std::type_info& type);
+   virtual void FinalDecRef(const std::type_info& type);
 
    mutable Atomic<int32_t> _refCount{0};
 

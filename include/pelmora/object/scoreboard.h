@@ -37,8 +37,8 @@ class PELMORA_EXPORT RefTracker : public virtual Object {
 public:
    // Appends, per tracked class, the backtraces of first references by descending count.
    virtual void GetScores(std::string& out) = 0;
-   virtual void OnFirstIncRef(const Object* object, const std::type_info& type) = 0;
-   virtual void OnFinalDecRef(const Object* object, const std::type_info& type) = 0;
+   virtual void OnFirstIncRef(Object* object, const std::type_info& type) = 0;
+   virtual void OnFinalDecRef(Object* object, const std::type_info& type) = 0;
 };
 
 // Creates the reference tracker for the named classes (mangled names) and installs it

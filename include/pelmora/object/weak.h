@@ -6,6 +6,7 @@
 // object's death either wins a counted reference or finds the object gone. Thread-safe.
 
 #include <memory>
+#include <type_traits>
 
 #include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
@@ -22,7 +23,7 @@ public:
 
 class PELMORA_EXPORT WeakLinkable : public virtual Object {
 public:
-   virtual void AttachWeakRef(Ref<WeakLink>& out) const = 0;
+   virtual void AttachWeakRef(Ref<WeakLink>& out) = 0;
    // True if `link` is this object's link; with no link, true only for null.
    virtual bool HasLink(const WeakLink* link) const = 0;
 };
@@ -60,13 +61,13 @@ public:
       _weak.Init(this);
    }
 
-   void AttachWeakRef(Ref<WeakLink>& out) const override { _weak.GetLink(out); }
+   void AttachWeakRef(Ref<WeakLink>& out) override { _weak.GetLink(out); }
    bool HasLink(const WeakLink* link) const override { return _weak.HasLink(link); }
 
    int DecRef() const override {
       int32_t before = 0;
       if (!_weak.WeakDecRef(this->_refCount, &before)) return before;
-      this->FinalDecRef(typeid(*this));
+      const_cast<WeakLinkableImpl*>(this)->FinalDecRef(typeid(*this));
       delete this;
       return before;
    }
@@ -107,7 +108,8 @@ private:
    void Assign(T* object) {
       Reset();
       if (!object) return;
-      dynamic_cast<const WeakLinkable&>(*object).AttachWeakRef(_link);
+      // Handing out the link does not change the object.
+      dynamic_cast<WeakLinkable&>(const_cast<std::remove_const_t<T>&>(*object)).AttachWeakRef(_link);
       _object = object;
    }
 

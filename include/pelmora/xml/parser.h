@@ -62,7 +62,7 @@ class PELMORA_EXPORT XMLParser : public virtual Object {
 public:
    // The parser holds a reference to `handler`; null is a panic.
    virtual void SetXMLHandler(XMLHandler* handler) = 0;
-   virtual XMLHandler* GetXMLHandler() const = 0;
+   virtual XMLHandler* GetXMLHandler() = 0;
    // Reads to the end of `reader` and hands over the handler's result (the Document, with
    // the standard handler). XMLParseException for bad or refused input; exceptions of the
    // reader pass through unchanged. The parser is ready for the next document either way.
