@@ -3,11 +3,14 @@
 // Everything that needs the allocator or the dynamic loader (formatting, resolving the
 // backtrace) happens before the fork; the child is made with the C library's fork so
 // that the allocator is usable in it. Logging locks that other threads held at fork time
-// stay held in the child, so a watchdog there writes the prepared report to standard
-// error, without locks or allocation, when logging does not finish in time.
+// stay held in the child, so the dying process waits for the child a bounded time; past
+// it, it kills the child and writes the prepared report to standard error itself,
+// without locks or allocation, before it dumps core.
 
 #include <signal.h>
-#include <sys/time.h>
+#include <sys/mman.h>
+#include <sys/wait.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -32,10 +35,8 @@ std::atomic<long> g_reportChildMs{30000};
 std::atomic<bool> g_mayFork{true};
 thread_local bool t_panicking = false;
 
-// The report as prepared before the fork, for the child's watchdog.
-const char* volatile g_reportText = nullptr;
-volatile size_t g_reportSize = 0;
-volatile sig_atomic_t g_reportLogged = 0;
+// Set by the report child once the first line is logged; shared with the dying process.
+volatile sig_atomic_t* g_reportLogged = nullptr;
 
 void WriteRaw(const char* text, size_t size) {
    while (size > 0) {
@@ -49,36 +50,36 @@ void WriteRaw(const char* text, size_t size) {
 
 void WriteRaw(const char* text) { WriteRaw(text, strlen(text)); }
 
-void OnReportTimeout(int) {
-   if (!g_reportLogged && g_reportText) {
-      WriteRaw(g_reportText, g_reportSize);
+long long NowMs() {
+   timespec now;
+   clock_gettime(CLOCK_MONOTONIC, &now);
+   return now.tv_sec * 1000LL + now.tv_nsec / 1000000;
+}
+
+// Waits for the report child; past the time-out, kills it and writes what it could not.
+void AwaitReportChild(pid_t child, const std::string& text, bool wanted) {
+   long long deadline = NowMs() + g_reportChildMs.load(std::memory_order_relaxed);
+   for (;;) {
+      pid_t done = waitpid(child, nullptr, WNOHANG);
+      if (done == child || (done < 0 && errno != EINTR)) return;
+      if (NowMs() >= deadline) break;
+      timespec pause{0, 1000000};
+      nanosleep(&pause, nullptr);
+   }
+   kill(child, SIGKILL);
+   while (waitpid(child, nullptr, 0) < 0 && errno == EINTR) {
+   }
+   if (wanted && !(g_reportLogged && *g_reportLogged)) {
+      WriteRaw(text.data(), text.size());
       WriteRaw("\n");
    }
    WriteRaw("Panic report cut short: logging did not finish in time\n");
-   _exit(-1);
-}
-
-void ArmReportWatchdog() {
-   struct sigaction action;
-   memset(&action, 0, sizeof(action));
-   action.sa_handler = OnReportTimeout;
-   sigemptyset(&action.sa_mask);
-   sigaction(SIGALRM, &action, nullptr);
-   sigset_t alarmOnly;
-   sigemptyset(&alarmOnly);
-   sigaddset(&alarmOnly, SIGALRM);
-   pthread_sigmask(SIG_UNBLOCK, &alarmOnly, nullptr);
-   long ms = g_reportChildMs.load(std::memory_order_relaxed);
-   itimerval timer{};
-   timer.it_value.tv_sec = ms / 1000;
-   timer.it_value.tv_usec = (ms % 1000) * 1000;
-   setitimer(ITIMER_REAL, &timer, nullptr);
 }
 
 void WriteReport(const std::string& text, bool wanted, const char* message) {
    Internal::ReportSink& sink = Internal::GetReportSink();
    if (wanted) sink.Log(Internal::kReportPanicLevel, text);
-   g_reportLogged = 1;
+   if (g_reportLogged) *g_reportLogged = 1;
    sink.LogMemoryBuffer(Internal::kReportPanicLevel, message, true);
    sink.Flush();
 }
@@ -97,17 +98,16 @@ void WriteReport(const std::string& text, bool wanted, const char* message) {
    bool wanted = Internal::GetReportSink().IsLevelEnabled(Internal::kReportPanicLevel);
    bool reported = false;
    if (PanicMayFork()) {
-      if (wanted) {
-         g_reportText = text.c_str();
-         g_reportSize = text.size();
-      }
+      void* shared = mmap(nullptr, sizeof(sig_atomic_t), PROT_READ | PROT_WRITE,
+                          MAP_SHARED | MAP_ANONYMOUS, -1, 0);
+      if (shared != MAP_FAILED) g_reportLogged = static_cast<volatile sig_atomic_t*>(shared);
       pid_t child = fork();
       if (child == 0) {
-         ArmReportWatchdog();
          WriteReport(text, wanted, message);
          _exit(-1);
       }
       reported = child > 0;
+      if (reported) AwaitReportChild(child, text, wanted);
    }
    if (!reported) WriteReport(text, wanted, message);
    fflush(nullptr);

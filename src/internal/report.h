@@ -31,8 +31,8 @@ void SetReportSink(ReportSink* sink);
 bool SetReportSinkIfUnset(ReportSink* sink);
 ReportSink& GetReportSink();
 
-// How long a panic's report child may take to log before its watchdog writes the report
-// to standard error without locks and ends it. 30 s unless changed.
+// How long a panicking process waits for its report child to log before it kills the
+// child and writes the report to standard error itself. 30 s unless changed.
 void SetPanicReportTimeout(std::chrono::milliseconds limit);
 
 }  // namespace Pelmora::Internal

@@ -1,6 +1,7 @@
 #pragma once
 // Panics end the process for broken invariants: a report (first line, backtrace and the
-// in-memory log) is written by a forked child while the panicking process dumps core.
+// in-memory log) is written by a forked child, which the panicking process waits for a
+// bounded time before it dumps core.
 // None of these returns. Callable from any thread.
 
 #include <cstdarg>
