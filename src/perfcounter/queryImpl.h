@@ -26,6 +26,7 @@ public:
    void Execute(QueryResults& results) override;
    void Clear() override;
    void Uninitialize() override;
+   using ObjectImpl::ToString;
    std::string ToString() const override;
 
    // Joins the registry and compiles. The caller must not hold the registry's write lock.

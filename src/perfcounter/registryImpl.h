@@ -116,6 +116,7 @@ public:
    void EnumeratePath(const std::string& path, std::vector<std::string>& out) override;
    void CollectAll(QueryResults& results) override;
    int GetCounterCount() override;
+   using ObjectImpl::ToString;
    std::string ToString() const override;
 
    // Removes a group's counters; nothing when it is no longer registered here.
