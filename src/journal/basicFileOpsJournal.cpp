@@ -220,10 +220,10 @@ public:
       if (exists) {
          // The old content is kept under a second name (a hard link: no copy, and atomic)
          // before anything may replace it.
-         std::string backup = BackupName(path);
+         std::string backup = BackupName();
          FileOp(false, path, backup);
          if (::link(path.c_str(), backup.c_str()) != 0) ThrowErrno("Failed to keep", path);
-         SyncDir(Parent(path));
+         SyncDir(Parent(backup));
       }
       FileOp(true, path, std::string());
       std::string temp = TempName(path);
@@ -251,9 +251,10 @@ public:
    void RemoveFile(const std::string& path) override {
       RequireChange();
       if (!Exists(path)) throw NotFoundException("No such file: " + path);
-      std::string backup = BackupName(path);
+      std::string backup = BackupName();
       FileOp(false, path, backup);
       if (::rename(path.c_str(), backup.c_str()) != 0) ThrowErrno("Failed to remove", path);
+      SyncDir(Parent(backup));
       SyncDir(Parent(path));
    }
 
@@ -291,9 +292,9 @@ private:
       if (!_inChange) throw InvalidStateException("No journaled change is open");
    }
 
-   std::string BackupName(const std::string& path) {
-      return Parent(path) + "/." + BaseName(path) + ".jrnl-bak-" + std::to_string(_records);
-   }
+   // Beside the journal, not beside the file: a directory emptied in the same change must
+   // be removable.
+   std::string BackupName() { return _provider->GetPath() + ".bak-" + std::to_string(_records); }
 
    void JrnlRegisterEntryCreators() {
       RegisterEntryCreator(kJrnlOpDir, &JrnlDirEntry::CreateObject);
@@ -394,6 +395,7 @@ private:
          } else if (::rename(step.backup.c_str(), path.c_str()) != 0) {
             ThrowErrno("Failed to restore", path);
          }
+         SyncDir(Parent(step.backup));
       }
       SyncDir(Parent(path));
    }

@@ -119,7 +119,7 @@ TEST_F(FileOpsJournalTest, JournalFileHoldsEachStepBeforeItsEnd) {
    uint32_t headerLength = static_cast<uint8_t>(bytes[23]);
    std::string expected = "NORVEX.JOURNAL.VER.1.0." + bytes.substr(23, 4 + headerLength) +
                           Record(U32(1)) + Record(U32(4) + "\1" + Str(_root + "/d")) +
-                          Record(U32(7) + Str("backup") + Str(_root + "/.old.jrnl-bak-3")) +
+                          Record(U32(7) + Str("backup") + Str(_journal + ".bak-3")) +
                           Record(U32(5) + std::string(1, '\0') + U32(1) + Str(_root + "/old")) +
                           Record(U32(5) + "\1" + U32(1) + Str(_root + "/old")) +
                           Record(U32(4) + std::string(1, '\0') + Str(_root + "/d")) + Record(U32(2) + "\1");
@@ -131,7 +131,7 @@ TEST_F(FileOpsJournalTest, JournalFileHoldsEachStepBeforeItsEnd) {
    std::vector<Ref<BaseJrnlEntry>> entries;
    journal->GetLogEntries(entries);
    ASSERT_EQ(entries.size(), 7u);
-   EXPECT_EQ(entries[2]->PrintEntry(), "StringField \"backup\" = \"" + _root + "/.old.jrnl-bak-3\"");
+   EXPECT_EQ(entries[2]->PrintEntry(), "StringField \"backup\" = \"" + _journal + ".bak-3\"");
 }
 
 TEST_F(FileOpsJournalTest, AbortAndRecoverPutTheTreeBack) {
@@ -180,10 +180,27 @@ TEST_F(FileOpsJournalTest, RecoveryRunTwiceAfterAnInterruptedUndoKeepsTheOldCont
       journal->WriteFile(_root + "/f", "new");
    }
    // The undo got as far as putting the old file back, then died before its End.
-   ASSERT_EQ(::rename((_root + "/.f.jrnl-bak-2").c_str(), (_root + "/f").c_str()), 0);
+   ASSERT_EQ(::rename((_journal + ".bak-2").c_str(), (_root + "/f").c_str()), 0);
    auto journal = Open(false);
    EXPECT_TRUE(journal->Recover());
    EXPECT_EQ(Snapshot(_root), (Tree{{"/f", "old"}}));
+}
+
+// Kept copies of removed files must not sit in the directory being emptied.
+TEST_F(FileOpsJournalTest, ADirectoryEmptiedInTheSameChangeCanBeRemoved) {
+   ::mkdir((_root + "/d").c_str(), 0755);
+   WriteAll(_root + "/d/f", "x");
+   auto journal = Open(true);
+   journal->Begin();
+   journal->RemoveFile(_root + "/d/f");
+   journal->RemoveDirectory(_root + "/d");
+   journal->Abort();
+   EXPECT_EQ(Snapshot(_root), (Tree{{"/d", "/"}, {"/d/f", "x"}}));
+   journal->Begin();
+   journal->RemoveFile(_root + "/d/f");
+   journal->RemoveDirectory(_root + "/d");
+   journal->End();
+   EXPECT_EQ(Snapshot(_root), Tree{});
 }
 
 TEST_F(FileOpsJournalTest, MisuseIsRefused) {
@@ -259,8 +276,10 @@ void Apply(const std::vector<Op>& ops, Tree& model) {
    }
 }
 
+// `stopAfterEnd`: dies right after the first change completes, the moment its End is on
+// disk and its kept copies are gone, so that recovery meets a finished change too.
 [[noreturn]] void RunChanges(const std::string& journalPath, const std::string& root, int first, Tree model,
-                             int ready) {
+                             int ready, bool stopAfterEnd) {
    Ref<BasicFileOpsJournal> journal;
    CreateBasicFileOpsJournal(journalPath, true, "crash", journal);
    (void)!::write(ready, "r", 1);
@@ -277,6 +296,7 @@ void Apply(const std::vector<Op>& ops, Tree& model) {
          }
       }
       journal->End();
+      if (stopAfterEnd) ::raise(SIGKILL);
       Apply(ops, model);
    }
    ::_exit(0);
@@ -297,16 +317,27 @@ TEST_F(FileOpsJournalTest, CrashAtAnyMomentLeavesNoChangeHalfDone) {
       ASSERT_EQ(::pipe(ready), 0);
       pid_t child = ::fork();
       ASSERT_GE(child, 0);
-      if (child == 0) RunChanges(_journal, _root, next, model, ready[1]);
+      if (child == 0) {
+         // Nothing may unwind into the test framework in the child.
+         try {
+            RunChanges(_journal, _root, next, model, ready[1], trials % 4 == 3);
+         } catch (const std::exception& e) {
+            std::fprintf(stderr, "child failed: %s\n", e.what());
+         }
+         ::_exit(3);
+      }
       ::close(ready[1]);
       // Some kills land while the journal itself is being created, most in the changes.
       char byte;
       if (trials % 8 != 0) (void)!::read(ready[0], &byte, 1);
       ::close(ready[0]);
-      ::usleep(rng() % kMaxKillDelayUs);
-      ::kill(child, SIGKILL);
+      if (trials % 4 != 3) {
+         ::usleep(rng() % kMaxKillDelayUs);
+         ::kill(child, SIGKILL);
+      }
       int status = 0;
       ASSERT_EQ(::waitpid(child, &status, 0), child);
+      ASSERT_FALSE(WIFEXITED(status)) << "the child failed before it was killed";
       int finished = 0;
       if (GetJrnlFileHeader(_journal).size() == kJrnlFileHeaderLength) {
          Ref<BasicFileOpsJournal> journal;
@@ -328,12 +359,15 @@ TEST_F(FileOpsJournalTest, CrashAtAnyMomentLeavesNoChangeHalfDone) {
       for (int i = 0; i < finished; ++i, ++next) Apply(PlanChange(next, model), model);
       completed += finished;
       ASSERT_EQ(Snapshot(_root), model) << "trial " << trials << " after change " << next;
+      // No kept copy outlives recovery.
+      EXPECT_EQ(Snapshot(_dir).size(), model.size() + 1) << "trial " << trials;
    }
    std::printf("crash trials: %d (%d unfinished changes undone, %d changes completed)\n", trials, undone,
                completed);
    RecordProperty("crash_trials", trials);
    EXPECT_GE(trials, 20);
    EXPECT_GT(undone, 0);
+   EXPECT_GT(completed, 0);
 }
 
 }  // namespace

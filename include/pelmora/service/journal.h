@@ -303,9 +303,11 @@ public:
 };
 
 // Makes changes to files and directories and journals each step before it is made:
-// Begin, then any number of steps, then End. Removed and overwritten files are kept in
-// their own directory (".name.jrnl-bak-N", on the same file system) until End; new
-// content is written to ".name.jrnl-tmp", synced, then renamed into place. After a crash, Recover undoes the
+// Begin, then any number of steps, then End. Removed and overwritten files are kept beside
+// the journal (journal path + ".bak-N") until End, so the journal must live on the file
+// system of the files it changes (else the step fails with SystemException, undone).
+// New content is written to ".name.jrnl-tmp" in the file's directory, synced, then
+// renamed into place. After a crash, Recover undoes the
 // unfinished change in reverse order and leaves finished ones alone; it is idempotent.
 // Paths should be absolute: they are replayed as written.
 class PELMORA_EXPORT BasicFileOpsJournal : public virtual BaseJournal {
