@@ -25,7 +25,6 @@
 // the file, or a tail of zero bytes) is ignored and cut off before anything is appended.
 
 #include <cstdint>
-#include <map>
 #include <string>
 #include <vector>
 
