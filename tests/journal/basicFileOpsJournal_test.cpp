@@ -186,6 +186,26 @@ TEST_F(FileOpsJournalTest, RecoveryRunTwiceAfterAnInterruptedUndoKeepsTheOldCont
    EXPECT_EQ(Snapshot(_root), (Tree{{"/f", "old"}}));
 }
 
+// Power loss in the middle of a record: the torn bytes are neither read nor kept.
+TEST_F(FileOpsJournalTest, RecoveryIgnoresATornLastRecord) {
+   {
+      auto journal = Open(true);
+      journal->Begin();
+      journal->CreateDirectory(_root + "/d");
+   }
+   const std::string whole = ReadAll(_journal);
+   WriteAll(_journal, whole + U32(40) + std::string("\5\0\0\0\1", 5));
+   auto journal = Open(false);
+   EXPECT_TRUE(journal->Recover());
+   EXPECT_EQ(Snapshot(_root), Tree{});
+   EXPECT_EQ(ReadAll(_journal).substr(0, whole.size() + 4), whole + U32(8));  // UndoFormer follows
+   std::vector<Ref<BaseJrnlEntry>> entries;
+   journal->GetLogEntries(entries);
+   ASSERT_EQ(entries.size(), 4u);
+   EXPECT_EQ(entries[2]->PrintEntry(), "UndoFormer record 1");
+   EXPECT_EQ(entries[3]->PrintEntry(), "End undone");
+}
+
 // Kept copies of removed files must not sit in the directory being emptied.
 TEST_F(FileOpsJournalTest, ADirectoryEmptiedInTheSameChangeCanBeRemoved) {
    ::mkdir((_root + "/d").c_str(), 0755);
