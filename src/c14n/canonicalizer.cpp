@@ -127,6 +127,8 @@ protected:
 private:
    struct Frame {
       NodeFilterIterator position;
+      // Null for a document; kept to spare a cast at the end tag.
+      ElementNode* element;
       size_t scopeMark;
       size_t writtenMark;
    };
@@ -293,8 +295,8 @@ void C14NCanonicalizer::Canonicalize(NodeFilterIterator position, Writer& writer
    // The document's elements are apexes too: nothing above them is written.
    auto enter = [&](const NodeFilterIterator& at) {
       auto* element = dynamic_cast<ElementNode*>(at.GetChild());
-      bool apex = stack.empty() || stack.back().position.GetChild()->GetNodeType() == kDocumentNode;
-      Frame frame{at, scope.Mark(), written.Mark()};
+      bool apex = stack.empty() || stack.back().element == nullptr;
+      Frame frame{at, element, scope.Mark(), written.Mark()};
       ElementCanonicalize(element, apex, scope, written, state, out);
       state.inherited.clear();
       stack.push_back(frame);
@@ -302,7 +304,7 @@ void C14NCanonicalizer::Canonicalize(NodeFilterIterator position, Writer& writer
    if (type == kElementNode) {
       enter(position);
    } else {
-      stack.push_back({position, scope.Mark(), written.Mark()});
+      stack.push_back({position, nullptr, scope.Mark(), written.Mark()});
    }
    NodeFilterIterator cursor = position;
    bool haveNext = cursor.MoveToChild();
@@ -326,15 +328,14 @@ void C14NCanonicalizer::Canonicalize(NodeFilterIterator position, Writer& writer
          haveNext = cursor.MoveToSibling();
          continue;
       }
-      Frame frame = stack.back();
+      Frame frame = std::move(stack.back());
       stack.pop_back();
-      Node* node = frame.position.GetChild();
-      if (node->GetNodeType() == kElementNode) WriteEndTag(dynamic_cast<ElementNode*>(node), out);
+      if (frame.element != nullptr) WriteEndTag(frame.element, out);
       scope.Release(frame.scopeMark);
       written.Release(frame.writtenMark);
       output.MaybeFlush();
       if (stack.empty()) break;
-      cursor = frame.position;
+      cursor = std::move(frame.position);
       haveNext = cursor.MoveToSibling();
    }
    output.Flush();
