@@ -58,7 +58,7 @@ void PriorityInfo::Insert(WorkQueueImpl* queue) {
    ++_queueCount;
 }
 
-PriorityInfo::GetItemResult PriorityInfo::GetItem(Ref<WorkItem>& item, Ref<WorkQueueImpl>& queue) {
+PriorityInfo::GetItemResult PriorityInfo::GetItem(WorkItem& item, Ref<WorkQueueImpl>& queue) {
    Synchronized lock(this);
    if (_queues.empty()) return NO_ITEM;
    if (!ReserveSlot()) return NO_SLOT;

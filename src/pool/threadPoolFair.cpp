@@ -285,7 +285,7 @@ void ThreadPoolFair::HandleWork() {
    }
    bool starved = false;
    for (;;) {
-      Ref<WorkItem> item;
+      WorkItem item;
       Ref<WorkQueueImpl> queue;
       if (!GetNextItem(starved, item, queue)) break;
       starved = true;
@@ -295,7 +295,7 @@ void ThreadPoolFair::HandleWork() {
       long long start = NowMicroseconds();
       {
          PerfCounter::TlsScope scope;
-         item->Run();
+         item.Run();
       }
       item.Reset();
       long long elapsed = NowMicroseconds() - start;
@@ -311,7 +311,7 @@ void ThreadPoolFair::HandleWork() {
    }
 }
 
-bool ThreadPoolFair::GetNextItem(bool starved, Ref<WorkItem>& item, Ref<WorkQueueImpl>& queue) {
+bool ThreadPoolFair::GetNextItem(bool starved, WorkItem& item, Ref<WorkQueueImpl>& queue) {
    bool found = false;
    bool grow = false;
    {
@@ -532,7 +532,7 @@ void ThreadPoolFair::MainThreadRun() {
    TlsInfo* info = AttachThisThread(false);
    _runnerCount.ReadInc();
    for (;;) {
-      Ref<WorkItem> item;
+      WorkItem item;
       {
          Synchronized lock(_exitMutex.Get());
          while (!IsShuttingDown() && _mainThreadQueue->GetQueueSize() == 0) {
@@ -543,7 +543,7 @@ void ThreadPoolFair::MainThreadRun() {
       }
       info->_queue = _mainThreadQueue.Get();
       long long start = NowMicroseconds();
-      item->Run();
+      item.Run();
       item.Reset();
       info->_queue = nullptr;
       _mainThreadQueue->ItemCompleted(NowMicroseconds() - start);

@@ -26,9 +26,17 @@ std::atomic<bool> sCatchWorkItemExceptions{false};
 void SetCatchWorkItemExceptions(bool catchThem) { sCatchWorkItemExceptions.store(catchThem); }
 bool GetCatchWorkItemExceptions() { return sCatchWorkItemExceptions.load(); }
 
-void WorkItemImplCatchEx::Run() {
-   try {
+void WorkItem::Run() {
+   if (_catchExceptions) {
+      WorkItemImplCatchEx::Run(_function);
+   } else {
       _function();
+   }
+}
+
+void WorkItemImplCatchEx::Run(const Functor<>& function) {
+   try {
+      function();
    } catch (const Throwable& e) {
       PELMORA_LOG_PANIC(GetPoolLogger(), "Worker: Unhandled exception:\n%1",
                         e.GetMessage() + "\n" + e.Where());
@@ -40,12 +48,8 @@ void WorkItemImplCatchEx::Run() {
    }
 }
 
-void CreateWorkItem(const Functor<>& function, Ref<WorkItem>& out) {
-   if (sCatchWorkItemExceptions.load(std::memory_order_relaxed)) {
-      out = new WorkItemImplCatchEx(function);
-   } else {
-      out = new WorkItem(function);
-   }
+WorkItem CreateWorkItem(const Functor<>& function) {
+   return WorkItem(function, sCatchWorkItemExceptions.load(std::memory_order_relaxed));
 }
 
 Atomic<long long> WorkQueueImpl::enqCount;
@@ -56,13 +60,9 @@ WorkQueueImpl::WorkQueueImpl(const WorkQueueSpec& spec, Kind kind, ThreadPoolFai
     : _id(spec.id), _kind(kind), _itemWeight(spec.itemWeight), _priority(spec.priority),
       _pool(pool), _keepPool(pool), _level(level) {}
 
-void WorkQueueImpl::Enqueue(const Functor<>& item) {
-   Ref<WorkItem> workItem;
-   CreateWorkItem(item, workItem);
-   EnqueueItem(workItem.Get());
-}
+void WorkQueueImpl::Enqueue(const Functor<>& item) { EnqueueItem(CreateWorkItem(item)); }
 
-void WorkQueueImpl::EnqueueItem(WorkItem* item) {
+void WorkQueueImpl::EnqueueItem(WorkItem&& item) {
    // A closed queue may have outlived its pool: it looks no further.
    if (_closed.load(std::memory_order_acquire) || _pool->IsShuttingDown()) return;
    bool first;
@@ -70,7 +70,7 @@ void WorkQueueImpl::EnqueueItem(WorkItem* item) {
    {
       Synchronized lock(this);
       enqCount.ReadInc();
-      _items.emplace_back(item);
+      _items.push_back(std::move(item));
       first = _items.size() == 1;
       if (first) _dispatched = 0;
       // A serial queue with its item running re-enters its level on completion.
@@ -97,7 +97,7 @@ int WorkQueueImpl::GetWeigth() {
    return _executing * _itemWeight;
 }
 
-int WorkQueueImpl::PopItem(Ref<WorkItem>& item) {
+int WorkQueueImpl::PopItem(WorkItem& item) {
    Synchronized lock(this);
    popCount.ReadInc();
    PELMORA_VERIFY(!_items.empty());
@@ -121,7 +121,7 @@ void WorkQueueImpl::ItemCompleted(long long elapsedMicroseconds) {
 }
 
 void WorkQueueImpl::Close(Ref<ThreadPoolFair>& pool) {
-   std::deque<Ref<WorkItem>> dropped;
+   std::deque<WorkItem> dropped;
    Ref<PerfCounter::RegistryItem> stats;
    {
       Synchronized lock(this);

@@ -4,6 +4,7 @@
 // first item or of a completion.
 
 #include <atomic>
+#include <cstddef>
 #include <cstdint>
 #include <deque>
 #include <string>
@@ -23,24 +24,33 @@ namespace Pelmora::System {
 class PriorityInfo;
 class ThreadPoolFair;
 
-class WorkItem : public ObjectImpl {
+// One pending item, held by value in its queue: items are too many and too short-lived to
+// be reference-counted objects of their own.
+class WorkItem {
 public:
-   explicit WorkItem(Functor<> function) : _function(std::move(function)) {}
-   virtual void Run() { _function(); }
+   WorkItem() = default;
+   // `catchExceptions` selects the form that logs what escapes the item (see below).
+   WorkItem(const Functor<>& function, bool catchExceptions)
+       : _function(function), _catchExceptions(catchExceptions) {}
 
-protected:
+   void Run();
+   explicit operator bool() const noexcept { return static_cast<bool>(_function); }
+   bool operator!=(std::nullptr_t) const noexcept { return static_cast<bool>(_function); }
+   // Drops the functor (and what it holds) at once.
+   void Reset() noexcept { _function.Reset(); }
+
+private:
    Functor<> _function;
+   bool _catchExceptions = false;
 };
 
-// Logs what escapes the item at panic level and carries on.
-class WorkItemImplCatchEx : public WorkItem {
-public:
-   using WorkItem::WorkItem;
-   void Run() override;
+// The catching form of a work item: logs what escapes at panic level and carries on.
+struct WorkItemImplCatchEx {
+   static void Run(const Functor<>& function);
 };
 
 // A work item of the form the process-wide switch selects.
-void CreateWorkItem(const Functor<>& function, Ref<WorkItem>& out);
+WorkItem CreateWorkItem(const Functor<>& function);
 
 class WorkQueueImpl : public virtual WorkQueue, public LockableObjectImpl {
 public:
@@ -57,11 +67,11 @@ public:
    void GetCompletionQueue(Ref<WorkQueue>& out) override { out = this; }
    std::string ToString() const override;
 
-   void EnqueueItem(WorkItem* item);
+   void EnqueueItem(WorkItem&& item);
    // The fairness key among the queues of one level.
    int GetWeigth();
    // Takes the first item; answers the items left (0 for a serial queue).
-   int PopItem(Ref<WorkItem>& item);
+   int PopItem(WorkItem& item);
    // Its level is told after the queue lock is released.
    void ItemCompleted(long long elapsedMicroseconds);
    // Shutdown: drops every pending item and every later one, and hands over the
@@ -88,7 +98,7 @@ private:
    ThreadPoolFair* const _pool;
    Ref<ThreadPoolFair> _keepPool;  // until Close: a queue in use keeps its pool
    std::atomic<bool> _closed{false};
-   std::deque<Ref<WorkItem>> _items;
+   std::deque<WorkItem> _items;
    Ref<PerfCounter::RegistryItem> _statsItem;  // registered counters, until Close
    PriorityInfo* const _level;
    int32_t _executing = 0;

@@ -32,7 +32,7 @@ protected:
    }
    // The queue GetNextItem serves next, null when it refuses.
    WorkQueueImpl* Next(bool starved = false) {
-      Ref<WorkItem> item;
+      WorkItem item;
       Ref<WorkQueueImpl> queue;
       if (!pool->GetNextItem(starved, item, queue)) return nullptr;
       taken.push_back(queue);
