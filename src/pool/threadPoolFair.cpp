@@ -312,11 +312,16 @@ void ThreadPoolFair::HandleWork() {
 }
 
 bool ThreadPoolFair::GetNextItem(bool starved, WorkItem& item, Ref<WorkQueueImpl>& queue) {
+   // Most handlers find no level refused and leave without the pool lock. A refusal is
+   // counted before its slot is tried (below) and a completion frees its slot before it
+   // gets here; both go through the busy count, so either the refusal sees the freed
+   // slot or this read sees the refusal.
+   if (starved && _starvedCount.load() == 0) return false;
    bool found = false;
    bool grow = false;
    {
       Synchronized lock(this);
-      if (starved && _starvedCount == 0) return false;
+      if (starved && _starvedCount.load(std::memory_order_relaxed) == 0) return false;
       size_t level = _runnable._Find_first();
       if (level >= kLevels) {
          if (!starved) {
@@ -327,7 +332,10 @@ bool ThreadPoolFair::GetNextItem(bool starved, WorkItem& item, Ref<WorkQueueImpl
          }
          return false;
       }
-      if (starved) --_starvedCount;
+      // Counted as refused while the slot is tried (a starved pass is counted already);
+      // the count drops again unless the level is refused.
+      int refusedBefore = starved ? _starvedCount.load(std::memory_order_relaxed) : _starvedCount.fetch_add(1);
+      bool refused = false;
       for (;;) {
          PriorityInfo::GetItemResult result = _priorities[level]->GetItem(item, queue);
          if (result == PriorityInfo::NO_ITEM) {
@@ -338,8 +346,8 @@ bool ThreadPoolFair::GetNextItem(bool starved, WorkItem& item, Ref<WorkQueueImpl
             continue;
          }
          if (result == PriorityInfo::NO_SLOT) {
-            ++_starvedCount;
-            LogUsage();
+            refused = true;
+            LogUsage(refusedBefore);
          } else {
             found = true;
             if (result == PriorityInfo::ITEM_LEVEL_EMPTY) {
@@ -349,6 +357,7 @@ bool ThreadPoolFair::GetNextItem(bool starved, WorkItem& item, Ref<WorkQueueImpl
          }
          break;
       }
+      if (!refused) _starvedCount.fetch_sub(1);
       int threads = _threadCount.Read();
       if (threads < _limits.maxThreads.load(std::memory_order_relaxed) &&
           _limits.busyCount.Read() > threads / 2 + threads / 4) {
@@ -360,12 +369,15 @@ bool ThreadPoolFair::GetNextItem(bool starved, WorkItem& item, Ref<WorkQueueImpl
    return found;
 }
 
-void ThreadPoolFair::LogUsage() {
+void ThreadPoolFair::LogUsage(int refusedBefore) {
+   // Once per stretch of refusals, not per refused handler: a pool at its limit refuses
+   // often, and the line says the same every time.
+   if (refusedBefore > 0) return;
    int busy = _limits.busyCount.Read();
    int maxThreads = _limits.maxThreads.load(std::memory_order_relaxed);
    if (maxThreads - busy <= _threadCountWarningThreshold) {
       PELMORA_LOG_VERBOSE(_logger, "Thread pool usage: threads %1, busy %2, max threads %3, starved %4",
-                          _threadCount.Read(), busy, maxThreads, _starvedCount);
+                          _threadCount.Read(), busy, maxThreads, _starvedCount.load(std::memory_order_relaxed));
    }
 }
 

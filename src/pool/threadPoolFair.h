@@ -108,7 +108,7 @@ public:
    PoolLimits& GetLimits() { return _limits; }
    int GetThreadCount() const { return _threadCount.Read(); }
    int GetShrinkTicks() const { return _shrinkTicks.Read(); }
-   int GetStarvedCount() const { return _starvedCount; }
+   int GetStarvedCount() const { return _starvedCount.load(); }
    PriorityInfo* GetPriorityInfo(int level) { return _priorities[level].get(); }
    bool IsLevelRunnable(int level) const { return _runnable.test(level); }
    int GetMostUrgentLevel() const { return _mostUrgent; }
@@ -129,7 +129,8 @@ private:
    TlsInfo* GetTlsInfo();
    TlsInfo* AttachThisThread(bool worker);
    void ThreadLeft(Atomic<int32_t>& counter);
-   void LogUsage();
+   // A level was refused a slot; `refusedBefore` is how many were refused already.
+   void LogUsage(int refusedBefore);
    void ScheduleShrinkTimer();
    void TimerDone(TimerItem* timer);
    // After every thread left: drops queued items and breaks the references back to the pool.
@@ -157,7 +158,7 @@ private:
    std::unique_ptr<PriorityInfo> _priorities[kLevels];
    int _mostUrgent = kLevels;
    std::bitset<kLevels> _runnable;
-   int _starvedCount = 0;
+   std::atomic<int> _starvedCount{0};  // changed under the pool lock, read without it
    std::map<std::string, Ref<WorkQueueImpl>> _queues;
    Ref<WorkQueueImpl> _defaultIOQueue;
    Ref<WorkQueueImpl> _defaultLongTaskQueue;

@@ -85,6 +85,37 @@ TEST_F(PriorityInfoTest, ReservationLeavesSlotsForMoreUrgentLevels) {
    EXPECT_EQ(nullptr, Next());
 }
 
+// A pool at its limit refuses handler after handler; the usage line is written when the
+// refusals start, not for each one, and again only after the refused levels were served.
+TEST_F(PriorityInfoTest, RefusalsLogTheUsageOncePerStretch) {
+   PoolLogCapture log;
+   auto usageLines = [&log] {
+      std::string text = log.Text();
+      int count = 0;
+      for (size_t at = text.find("Thread pool usage"); at != std::string::npos;
+           at = text.find("Thread pool usage", at + 1))
+         ++count;
+      return count;
+   };
+   Ref<WorkQueueImpl> urgent = Fair("urgent", 0);
+   Fill(urgent.Get(), 3);
+   SetBusy(199);
+   for (int i = 0; i < 3; ++i) EXPECT_EQ(nullptr, Next());
+   EXPECT_EQ(3, pool->GetStarvedCount());
+   EXPECT_EQ(nullptr, Next(true)) << "a starved pass refused again";
+   EXPECT_EQ(3, pool->GetStarvedCount());
+   EXPECT_EQ(1, usageLines());
+
+   SetBusy(0);
+   for (int i = 0; i < 3; ++i) EXPECT_EQ(urgent.Get(), Next(true));
+   EXPECT_EQ(0, pool->GetStarvedCount());
+   EXPECT_EQ(nullptr, Next(true)) << "nothing refused is left to serve";
+   Fill(urgent.Get(), 1);
+   SetBusy(199);
+   EXPECT_EQ(nullptr, Next());
+   EXPECT_EQ(2, usageLines());
+}
+
 // A change of a level's running count reaches the cached reservations of the levels below.
 TEST_F(PriorityInfoTest, CachedReservationsFollowTheLevelsAbove) {
    Ref<WorkQueueImpl> top = Fair("top", 0);
