@@ -54,7 +54,11 @@ bool PriorityInfo::ReserveSlot() {
 
 void PriorityInfo::Insert(WorkQueueImpl* queue) {
    if (_queues.get<byPtr>().count(queue)) return;
-   _queues.insert(Entry{queue->GetWeigth(), queue});
+   InsertNew(queue, queue->GetWeigth());
+}
+
+void PriorityInfo::InsertNew(WorkQueueImpl* queue, int weight) {
+   _queues.insert(Entry{weight, queue});
    ++_queueCount;
 }
 
@@ -69,11 +73,12 @@ PriorityInfo::GetItemResult PriorityInfo::GetItem(WorkItem& item, Ref<WorkQueueI
    PELMORA_VERIFY(queue != NULL);
    weightIdx.erase(it);
    --_queueCount;
-   int left = queue->PopItem(item);
+   int weight;
+   int left = queue->PopItem(item, &weight);
    ++_executing;
    UpdateLocalReservation();
    // Behind the queues of equal weight, so equal queues take turns.
-   if (left > 0) Insert(queue.Get());
+   if (left > 0) InsertNew(queue.Get(), weight);
    if (!_queues.empty()) return ITEM;
    return _memberQueueCount > 0 ? ITEM_LEVEL_EMPTY : ITEM_LEVEL_GONE;
 }

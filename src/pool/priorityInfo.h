@@ -82,6 +82,8 @@ private:
    void UpdateLocalReservation();
    // Entered at the back of the queues of equal weight.
    void Insert(WorkQueueImpl* queue);
+   // The same for a queue known to be out of the index, with its weight taken already.
+   void InsertNew(WorkQueueImpl* queue, int weight);
 
    const int _level;
    const int _reservationRatio;

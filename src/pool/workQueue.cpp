@@ -92,12 +92,16 @@ int WorkQueueImpl::GetQueueSize() {
 
 int WorkQueueImpl::GetWeigth() {
    Synchronized lock(this);
+   return GetWeigthLocked();
+}
+
+int WorkQueueImpl::GetWeigthLocked() const {
    // A queue that just received work goes ahead of those already being served.
    if (_executing == 0) return _dispatched == 0 ? -1 : 0;
    return _executing * _itemWeight;
 }
 
-int WorkQueueImpl::PopItem(WorkItem& item) {
+int WorkQueueImpl::PopItem(WorkItem& item, int* weight) {
    Synchronized lock(this);
    popCount.ReadInc();
    PELMORA_VERIFY(!_items.empty());
@@ -105,6 +109,7 @@ int WorkQueueImpl::PopItem(WorkItem& item) {
    _items.pop_front();
    ++_executing;
    ++_dispatched;
+   if (weight) *weight = GetWeigthLocked();
    return _kind == KIND_SERIAL ? 0 : static_cast<int>(_items.size());
 }
 

@@ -70,8 +70,10 @@ public:
    void EnqueueItem(WorkItem&& item);
    // The fairness key among the queues of one level.
    int GetWeigth();
-   // Takes the first item; answers the items left (0 for a serial queue).
-   int PopItem(WorkItem& item);
+   int GetWeigthLocked() const;
+   // Takes the first item; answers the items left (0 for a serial queue) and, when
+   // `weight` is given, the queue's weight after the pop.
+   int PopItem(WorkItem& item, int* weight = nullptr);
    // Its level is told after the queue lock is released.
    void ItemCompleted(long long elapsedMicroseconds);
    // Shutdown: drops every pending item and every later one, and hands over the
