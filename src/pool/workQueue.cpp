@@ -97,8 +97,9 @@ int WorkQueueImpl::GetWeigth() {
 
 int WorkQueueImpl::GetWeigthLocked() const {
    // A queue that just received work goes ahead of those already being served.
-   if (_executing == 0) return _dispatched == 0 ? -1 : 0;
-   return _executing * _itemWeight;
+   int executing = _executing.load(std::memory_order_relaxed);
+   if (executing == 0) return _dispatched == 0 ? -1 : 0;
+   return executing * _itemWeight;
 }
 
 int WorkQueueImpl::PopItem(WorkItem& item, int* weight) {
@@ -107,20 +108,26 @@ int WorkQueueImpl::PopItem(WorkItem& item, int* weight) {
    PELMORA_VERIFY(!_items.empty());
    item = std::move(_items.front());
    _items.pop_front();
-   ++_executing;
+   _executing.fetch_add(1, std::memory_order_relaxed);
    ++_dispatched;
    if (weight) *weight = GetWeigthLocked();
    return _kind == KIND_SERIAL ? 0 : static_cast<int>(_items.size());
 }
 
 void WorkQueueImpl::ItemCompleted(long long elapsedMicroseconds) {
-   bool reenter;
-   {
+   auto count = [this, elapsedMicroseconds] {
+      _executing.fetch_sub(1, std::memory_order_relaxed);
+      _completed.fetch_add(1, std::memory_order_relaxed);
+      _executionMicroseconds.fetch_add(elapsedMicroseconds, std::memory_order_relaxed);
+   };
+   bool reenter = false;
+   if (_kind == KIND_SERIAL) {
+      // Enqueue decides under the lock whether completion re-announces the queue.
       Synchronized lock(this);
-      --_executing;
-      ++_completed;
-      _executionMicroseconds += elapsedMicroseconds;
-      reenter = _kind == KIND_SERIAL && !_items.empty();
+      count();
+      reenter = !_items.empty();
+   } else {
+      count();
    }
    if (_level) _level->ItemCompleted(this, reenter);
 }

@@ -103,10 +103,11 @@ private:
    std::deque<WorkItem> _items;
    Ref<PerfCounter::RegistryItem> _statsItem;  // registered counters, until Close
    PriorityInfo* const _level;
-   int32_t _executing = 0;
+   // Atomic, so that a fair queue counts a completion without its lock.
+   std::atomic<int32_t> _executing{0};
    int32_t _dispatched = 0;  // since the queue last became non-empty
-   int64_t _completed = 0;
-   int64_t _executionMicroseconds = 0;
+   std::atomic<int64_t> _completed{0};
+   std::atomic<int64_t> _executionMicroseconds{0};
 };
 
 }  // namespace Pelmora::System
