@@ -62,7 +62,7 @@ void PriorityInfo::InsertNew(WorkQueueImpl* queue, int weight) {
    ++_queueCount;
 }
 
-PriorityInfo::GetItemResult PriorityInfo::GetItem(WorkItem& item, Ref<WorkQueueImpl>& queue) {
+PriorityInfo::GetItemResult PriorityInfo::GetItem(WorkItem& item, WorkQueueImpl*& queue) {
    Synchronized lock(this);
    if (_queues.empty()) return NO_ITEM;
    if (!ReserveSlot()) return NO_SLOT;
@@ -78,7 +78,7 @@ PriorityInfo::GetItemResult PriorityInfo::GetItem(WorkItem& item, Ref<WorkQueueI
    ++_executing;
    UpdateLocalReservation();
    // Behind the queues of equal weight, so equal queues take turns.
-   if (left > 0) InsertNew(queue.Get(), weight);
+   if (left > 0) InsertNew(queue, weight);
    if (!_queues.empty()) return ITEM;
    return _memberQueueCount > 0 ? ITEM_LEVEL_EMPTY : ITEM_LEVEL_GONE;
 }

@@ -43,7 +43,7 @@ public:
 
    int GetLevel() const { return _level; }
    // Under the pool lock: takes a slot and the first item of the lightest queue.
-   GetItemResult GetItem(WorkItem& item, Ref<WorkQueueImpl>& queue);
+   GetItemResult GetItem(WorkItem& item, WorkQueueImpl*& queue);
    // `queue` got its first item (no lock held): enters the weight index, posts a handler.
    void QueueNonEmpty(WorkQueueImpl* queue);
    // An item of `queue` ended (no lock held); a serial queue with items re-enters.

@@ -286,12 +286,12 @@ void ThreadPoolFair::HandleWork() {
    bool starved = false;
    for (;;) {
       WorkItem item;
-      Ref<WorkQueueImpl> queue;
+      WorkQueueImpl* queue = nullptr;  // the pool's map keeps it until every thread left
       if (!GetNextItem(starved, item, queue)) break;
       starved = true;
       PELMORA_VERIFY(item != NULL);
       PELMORA_VERIFY(_tlsInfo->_queue == NULL);
-      _tlsInfo->_queue = queue.Get();
+      _tlsInfo->_queue = queue;
       long long start = NowMicroseconds();
       {
          PerfCounter::TlsScope scope;
@@ -311,7 +311,7 @@ void ThreadPoolFair::HandleWork() {
    }
 }
 
-bool ThreadPoolFair::GetNextItem(bool starved, WorkItem& item, Ref<WorkQueueImpl>& queue) {
+bool ThreadPoolFair::GetNextItem(bool starved, WorkItem& item, WorkQueueImpl*& queue) {
    // Most handlers find no level refused and leave without the pool lock. A refusal is
    // counted before its slot is tried (below) and a completion frees its slot before it
    // gets here; both go through the busy count, so either the refusal sees the freed

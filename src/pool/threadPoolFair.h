@@ -102,7 +102,7 @@ public:
    // One handler: at most one item, then the levels refused a slot.
    void HandleWork();
    // Under the pool lock; `starved` when serving levels refused earlier.
-   bool GetNextItem(bool starved, WorkItem& item, Ref<WorkQueueImpl>& queue);
+   bool GetNextItem(bool starved, WorkItem& item, WorkQueueImpl*& queue);
    void HandleShrinkTimerTick();
 
    PoolLimits& GetLimits() { return _limits; }

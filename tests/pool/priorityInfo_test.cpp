@@ -33,10 +33,10 @@ protected:
    // The queue GetNextItem serves next, null when it refuses.
    WorkQueueImpl* Next(bool starved = false) {
       WorkItem item;
-      Ref<WorkQueueImpl> queue;
+      WorkQueueImpl* queue = nullptr;
       if (!pool->GetNextItem(starved, item, queue)) return nullptr;
       taken.push_back(queue);
-      return queue.Get();
+      return queue;
    }
    int Reservation(int level) {
       PriorityInfo* info = pool->GetPriorityInfo(level);
