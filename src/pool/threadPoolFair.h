@@ -88,6 +88,7 @@ public:
    void GetConfig(ThreadPoolConfig& out) override;
    void SetConfig(const ThreadPoolConfig& config) override;
    void GetStats(PerfCounter::LwStatsBuilder& builder) override;
+   using ObjectImpl::ToString;
    std::string ToString() const override;
 
    // ThreadPoolWorkBinder

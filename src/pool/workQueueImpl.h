@@ -65,6 +65,7 @@ public:
    void Enqueue(const Functor<>& item) override;
    int GetQueueSize() override;
    void GetCompletionQueue(Ref<WorkQueue>& out) override { out = this; }
+   using ObjectImpl::ToString;
    std::string ToString() const override;
 
    void EnqueueItem(WorkItem&& item);
