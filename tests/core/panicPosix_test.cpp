@@ -40,33 +40,6 @@ TEST(PanicDeathTest, VerifyNamesTheExpandedExpressionAndTheRepositoryPath) {
    EXPECT_DEATH(PELMORA_NOT_REACHED(), "Panic: Not Reached: @ tests/core/panicPosix_test.cpp:[0-9]+\n");
 }
 
-TEST(PanicTest, AForkedChildWritesTheReportAndTheProcessDumpsCore) {
-   int pipeFds[2];
-   ASSERT_EQ(0, pipe(pipeFds));
-   pid_t pid = fork();
-   ASSERT_GE(pid, 0);
-   if (pid == 0) {
-      dup2(pipeFds[1], STDERR_FILENO);
-      close(pipeFds[0]);
-      close(pipeFds[1]);
-      SetPanicMayFork(true);
-      PanicVerify("forked", "a/b", 9);
-   }
-   close(pipeFds[1]);
-   // The report child holds the pipe too: reading to its end waits for the report.
-   std::string report;
-   char buffer[4096];
-   ssize_t n;
-   while ((n = read(pipeFds[0], buffer, sizeof(buffer))) > 0) report.append(buffer, n);
-   close(pipeFds[0]);
-   int status = 0;
-   ASSERT_EQ(pid, waitpid(pid, &status, 0));
-   EXPECT_TRUE(WIFSIGNALED(status));
-   EXPECT_EQ(SIGABRT, WTERMSIG(status));
-   EXPECT_EQ(0u, report.find("\n\nPanic: Assert Failed: \"forked\" @ a/b:9\nBacktrace:\n#0 "))
-      << report;
-}
-
 // Everything the process at `pid` and its report child write to `fd`, until both close it
 // or `deadline` passes (then the process is killed and `timedOut` set).
 std::string ReadUntilClosed(int fd, pid_t pid, std::chrono::steady_clock::time_point deadline,
@@ -90,21 +63,53 @@ std::string ReadUntilClosed(int fd, pid_t pid, std::chrono::steady_clock::time_p
    return text;
 }
 
+struct ChildPanic {
+   std::string report;  // what the process and its report child wrote to standard error
+   int status = 0;
+   bool timedOut = false;
+};
+
+// Runs `panic` (which must not return) in a forked process that may fork its report child,
+// and collects the report; the report child holds the pipe too, so reading to its end
+// waits for the report.
+template <class F>
+ChildPanic PanicInChild(F panic, std::chrono::steady_clock::time_point deadline) {
+   ChildPanic result;
+   int pipeFds[2];
+   if (pipe(pipeFds) != 0) return result;
+   pid_t pid = fork();
+   if (pid == 0) {
+      dup2(pipeFds[1], STDERR_FILENO);
+      close(pipeFds[0]);
+      close(pipeFds[1]);
+      SetPanicMayFork(true);
+      panic();
+      _exit(0);
+   }
+   close(pipeFds[1]);
+   result.report = ReadUntilClosed(pipeFds[0], pid, deadline, result.timedOut);
+   close(pipeFds[0]);
+   waitpid(pid, &result.status, 0);
+   return result;
+}
+
+TEST(PanicTest, AForkedChildWritesTheReportAndTheProcessDumpsCore) {
+   ChildPanic child = PanicInChild([] { PanicVerify("forked", "a/b", 9); },
+                                   std::chrono::steady_clock::now() + std::chrono::seconds(20));
+   ASSERT_FALSE(child.timedOut);
+   EXPECT_TRUE(WIFSIGNALED(child.status));
+   EXPECT_EQ(SIGABRT, WTERMSIG(child.status));
+   EXPECT_EQ(0u, child.report.find("\n\nPanic: Assert Failed: \"forked\" @ a/b:9\nBacktrace:\n#0 "))
+      << child.report;
+}
+
 // Other threads hold the allocator's and the logger's locks at any moment; the report child
 // must get its report out regardless, each time.
 TEST(PanicTest, TheReportArrivesWhileOtherThreadsLogAndAllocate) {
    constexpr int kRounds = 12;
    auto end = std::chrono::steady_clock::now() + std::chrono::seconds(20);
    for (int round = 0; round < kRounds; ++round) {
-      int pipeFds[2];
-      ASSERT_EQ(0, pipe(pipeFds));
-      pid_t pid = fork();
-      ASSERT_GE(pid, 0);
-      if (pid == 0) {
-         dup2(pipeFds[1], STDERR_FILENO);
-         close(pipeFds[0]);
-         close(pipeFds[1]);
-         SetPanicMayFork(true);
+      ChildPanic child = PanicInChild([round] {
          Internal::SetPanicReportTimeout(std::chrono::milliseconds(200));
          Service::Logger* logger = Service::GetDefaultLogger();
          std::atomic<int> busy{0};
@@ -128,18 +133,12 @@ TEST(PanicTest, TheReportArrivesWhileOtherThreadsLogAndAllocate) {
          }
          while (busy.load() < 3) std::this_thread::yield();
          PanicVerify("hammered", "a/b", round);
-      }
-      close(pipeFds[1]);
-      bool timedOut = false;
-      std::string report = ReadUntilClosed(pipeFds[0], pid, end, timedOut);
-      close(pipeFds[0]);
-      int status = 0;
-      ASSERT_EQ(pid, waitpid(pid, &status, 0));
-      ASSERT_FALSE(timedOut) << "round " << round << " never finished its report";
-      EXPECT_TRUE(WIFSIGNALED(status));
+      }, end);
+      ASSERT_FALSE(child.timedOut) << "round " << round << " never finished its report";
+      EXPECT_TRUE(WIFSIGNALED(child.status));
       std::string first = "Panic: Assert Failed: \"hammered\" @ a/b:" + std::to_string(round) +
                           "\nBacktrace:\n#0 ";
-      ASSERT_NE(std::string::npos, report.find(first)) << "round " << round;
+      ASSERT_NE(std::string::npos, child.report.find(first)) << "round " << round;
    }
 }
 
