@@ -16,23 +16,15 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/journal.h"
+#include "tests/support/journalBytes.h"
 
 namespace Pelmora::Service {
 namespace {
 
+using namespace Pelmora::TestSupport;
+
 // A tree as a map from relative path to content; directories map to "/".
 using Tree = std::map<std::string, std::string>;
-
-std::string ReadAll(const std::string& path) {
-   std::ifstream in(path, std::ios::binary);
-   std::stringstream s;
-   s << in.rdbuf();
-   return s.str();
-}
-
-void WriteAll(const std::string& path, const std::string& bytes) {
-   std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
-}
 
 // Everything under `root`, hidden files included: a leftover temporary or kept copy counts.
 void Scan(const std::string& root, const std::string& rel, Tree& out) {
@@ -98,11 +90,6 @@ protected:
    std::string _dir, _root, _journal;
 };
 
-std::string U32(uint32_t v) {
-   std::string out(4, '\0');
-   for (int i = 0; i < 4; ++i) out[i] = static_cast<char>(v >> (8 * i));
-   return out;
-}
 std::string Str(const std::string& s) { return U32(uint32_t(s.size() + 1)) + s + std::string(1, '\0'); }
 std::string Record(const std::string& body) { return U32(uint32_t(body.size())) + body; }
 

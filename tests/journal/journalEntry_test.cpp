@@ -7,15 +7,13 @@
 #include "pelmora/exception/panic.h"
 #include "pelmora/io/writers.h"
 #include "pelmora/service/journal.h"
+#include "tests/support/journalBytes.h"
 
 namespace Pelmora::Service {
 namespace {
 
-std::string U32(uint32_t v) {
-   std::string out(4, '\0');
-   for (int i = 0; i < 4; ++i) out[i] = static_cast<char>(v >> (8 * i));
-   return out;
-}
+using namespace Pelmora::TestSupport;
+
 std::string Str(const std::string& s) { return U32(uint32_t(s.size() + 1)) + s + std::string(1, '\0'); }
 
 std::string Bytes(BaseJrnlEntry& entry) {

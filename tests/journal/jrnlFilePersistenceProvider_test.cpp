@@ -8,26 +8,12 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/journal.h"
+#include "tests/support/journalBytes.h"
 
 namespace Pelmora::Service {
 namespace {
 
-std::string U32(uint32_t v) {
-   std::string out(4, '\0');
-   for (int i = 0; i < 4; ++i) out[i] = static_cast<char>(v >> (8 * i));
-   return out;
-}
-
-std::string ReadAll(const std::string& path) {
-   std::ifstream in(path, std::ios::binary);
-   std::stringstream s;
-   s << in.rdbuf();
-   return s.str();
-}
-
-void WriteAll(const std::string& path, const std::string& bytes) {
-   std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
-}
+using namespace Pelmora::TestSupport;
 
 class JrnlFileProviderTest : public testing::Test {
 protected:
