@@ -12,22 +12,12 @@
 
 #include "pelmora/exception.h"
 #include "pelmora/formatter.h"
+#include "tests/support/pieceWriter.h"
 
 namespace Pelmora {
 namespace {
 
-// Keeps every Write as its own piece, so tests see how the text was cut.
-class RecordingWriter final : public ObjectImpl, public virtual Writer {
-public:
-   void Write(const char* data, int length) override { pieces.emplace_back(data, length); }
-   void Close() override {}
-   std::string Text() const {
-      std::string text;
-      for (const std::string& piece : pieces) text += piece;
-      return text;
-   }
-   std::vector<std::string> pieces;
-};
+using TestSupport::PieceWriter;
 
 class ThrowingObject final : public ObjectImpl {
 public:
@@ -75,14 +65,14 @@ TEST(MessageFormatterTest, WalksPlaceholdersPercentSignsAndOtherText) {
 }
 
 TEST(MessageFormatterTest, WritesEachLiteralRunInOneCall) {
-   RecordingWriter writer;
+   PieceWriter writer;
    MessageFormatter::Print(&writer, "abc %1 def%%ghi%2", 5, true);
    std::vector<std::string> expected = {"abc ", "5", " def", "%", "ghi", "true"};
    EXPECT_EQ(expected, writer.pieces);
 }
 
 TEST(MessageFormatterTest, ErrorsPropagateAndKeepWhatWasWritten) {
-   RecordingWriter writer;
+   PieceWriter writer;
    try {
       MessageFormatter::Print(&writer, "one %1 then %2", 1);
       ADD_FAILURE() << "a placeholder beyond the arguments must throw";
@@ -91,7 +81,7 @@ TEST(MessageFormatterTest, ErrorsPropagateAndKeepWhatWasWritten) {
    }
    EXPECT_EQ("one 1 then ", writer.Text());
 
-   RecordingWriter second;
+   PieceWriter second;
    ThrowingObject object;
    EXPECT_THROW(MessageFormatter::Print(&second, "before %1 after", &object),
                 InvalidStateException);
@@ -212,7 +202,7 @@ TEST(PrintFormatterTest, ExceptionsPrintTypeAndMessage) {
    const Exception& asBase = own;
    EXPECT_EQ(Format(own), Format(asBase));
 
-   RecordingWriter writer;
+   PieceWriter writer;
    PrintFormatter::FormatException(&writer, {.exception = nullptr}, nullptr);
    PrintFormatter::FormatThrowable(&writer, {.throwable = nullptr}, nullptr);
    EXPECT_EQ("(null)(null)", writer.Text());

@@ -14,6 +14,7 @@
 #include "pelmora/io/writers.h"
 #include "pelmora/object/ref.h"
 #include "pelmora/service.h"
+#include "tests/support/pieceWriter.h"
 #include "tests/support/watchdog.h"
 extern "C" void __cxa_finalize(void* dso);
 
@@ -21,19 +22,6 @@ namespace Pelmora::TestSupport {
 
 using namespace Pelmora;
 using namespace Pelmora::Service;
-
-// Keeps every piece an output hands to it, in order.
-class PieceWriter : public virtual Writer, public ObjectImpl {
-public:
-   void Write(const char* data, int length) override { pieces.emplace_back(data, length); }
-   void Close() override {}
-   std::string Text() const {
-      std::string text;
-      for (const std::string& piece : pieces) text += piece;
-      return text;
-   }
-   std::vector<std::string> pieces;
-};
 
 // Counts how often it is formatted; may log while being formatted.
 class CountingObject : public ObjectImpl {
