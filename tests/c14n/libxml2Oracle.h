@@ -26,9 +26,8 @@ inline std::vector<std::string> SplitPath(const std::string& path) {
    return steps;
 }
 
-// Our side: parse with the standard handler and canonicalise the subtree at `path`.
-inline std::optional<std::string> OursCanonical(const std::string& text, const std::string& path, bool exclusive,
-                                                const std::vector<std::string>& prefixes) {
+// Our parse with the standard handler; null when the text does not parse.
+inline Ref<Document> ParseOurs(const std::string& text) {
    Ref<XMLHandler> handler;
    CreateXMLDocumentHandler(handler);
    Ref<XMLParser> parser;
@@ -37,9 +36,17 @@ inline std::optional<std::string> OursCanonical(const std::string& text, const s
    try {
       parser->Parse(text, result);
    } catch (const XMLParseException&) {
-      return std::nullopt;
+      return nullptr;
    }
-   auto* document = dynamic_cast<Document*>(result.Get());
+   return dynamic_cast<Document*>(result.Get());
+}
+
+// Our side: parse with the standard handler and canonicalise the subtree at `path`.
+inline std::optional<std::string> OursCanonical(const std::string& text, const std::string& path, bool exclusive,
+                                                const std::vector<std::string>& prefixes) {
+   Ref<Document> parsed = ParseOurs(text);
+   if (!parsed) return std::nullopt;
+   Document* document = parsed.Get();
    Node* apex = document;
    std::vector<std::string> steps = SplitPath(path);
    for (size_t i = 0; i < steps.size(); ++i) {
