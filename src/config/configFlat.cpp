@@ -173,9 +173,9 @@ protected:
       if (trimmed.empty() || trimmed[0] == '#') return false;
       size_t equals = FindKeyEnd(line);
       if (equals == std::string_view::npos) ThrowLine("Not a setting", lineNumber);
-      UnescapeKey(TrimValue(line.substr(0, equals)), key);
+      Unescape(TrimValue(line.substr(0, equals)), key, true);
       if (key.empty()) ThrowLine("Empty key", lineNumber);
-      Unescape(TrimValue(line.substr(equals + 1)), value);
+      Unescape(TrimValue(line.substr(equals + 1)), value, false);
       return true;
    }
 
@@ -241,32 +241,6 @@ private:
       return std::string_view::npos;
    }
 
-   static void UnescapeKey(std::string_view text, std::string& out) {
-      out.clear();
-      for (size_t i = 0; i < text.size(); ++i) {
-         char c = text[i];
-         if (c != '\\' || i + 1 == text.size()) {
-            out += c;
-            continue;
-         }
-         char next = text[++i];
-         switch (next) {
-            case 't': out += '\t'; break;
-            case 'f': out += '\f'; break;
-            case '\\':
-            case ' ':
-            case ':':
-            case '=':
-            case '#':
-            case '!': out += next; break;
-            default:
-               // As in values: a key written before keys were escaped reads as it did.
-               out += '\\';
-               out += next;
-         }
-      }
-   }
-
    // Trims like Trim, but keeps a white-space character that a backslash escapes.
    static std::string_view TrimValue(std::string_view text) {
       size_t begin = 0;
@@ -282,7 +256,10 @@ private:
       return text.substr(begin, end - begin);
    }
 
-   static void Unescape(std::string_view text, std::string& out) {
+   // Undoes the escapes of a key (`key`) or a value. Both read "\\", "\t" and "\ "; keys
+   // also "\f", ":", "=", "#" and "!", values "\n" and "\r". Unknown escapes stay as
+   // written, so files written before keys were escaped read as they did.
+   static void Unescape(std::string_view text, std::string& out, bool key) {
       out.clear();
       for (size_t i = 0; i < text.size(); ++i) {
          char c = text[i];
@@ -291,16 +268,20 @@ private:
             continue;
          }
          char next = text[++i];
+         char plain = 0;
          switch (next) {
-            case '\\': out += '\\'; break;
-            case 'n': out += '\n'; break;
-            case 'r': out += '\r'; break;
-            case 't': out += '\t'; break;
-            case ' ': out += ' '; break;
-            default:
-               // Unknown escapes stay as written.
-               out += '\\';
-               out += next;
+            case '\\': case ' ': plain = next; break;
+            case 't': plain = '\t'; break;
+            case 'f': plain = key ? '\f' : 0; break;
+            case ':': case '=': case '#': case '!': plain = key ? next : 0; break;
+            case 'n': plain = key ? 0 : '\n'; break;
+            case 'r': plain = key ? 0 : '\r'; break;
+         }
+         if (plain) {
+            out += plain;
+         } else {
+            out += '\\';
+            out += next;
          }
       }
    }
