@@ -101,8 +101,12 @@ void QueryImpl::Uninitialize() {
       System::NativeSynchronized lock(_mutex);
       if (_state == UNINITIALIZED) return;
    }
-   // The query list comes before the query's own mutex.
-   _registry->RemoveQuery(this);
+   // The query list comes before the query's own mutex. The registry may be gone by now:
+   // only the shared list is touched.
+   {
+      System::NativeSynchronized lock(_queryList->mutex);
+      _queryList->queries.erase(this);
+   }
    System::NativeSynchronized lock(_mutex);
    _selection.clear();
    _state = UNINITIALIZED;

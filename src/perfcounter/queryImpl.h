@@ -18,7 +18,8 @@ class QueryImpl : public virtual Query, public ObjectImpl {
 public:
    enum State { UNINITIALIZED, INITIALIZED, COMPILED };
 
-   explicit QueryImpl(RegistryImpl* registry) : _registry(registry) {}
+   explicit QueryImpl(RegistryImpl* registry)
+      : _registry(registry), _queryList(registry->GetQueryList()) {}
    ~QueryImpl() override;
 
    void SetQueryOption(QueryOption option, bool value) override;
@@ -47,7 +48,8 @@ protected:
    // Adds one counter node to the selection.
    void Select(CounterNode* node) PELMORA_REQUIRES(_mutex);
 
-   RegistryImpl* const _registry;
+   RegistryImpl* const _registry;  // valid while the query is in the list
+   const std::shared_ptr<QueryList> _queryList;
    // Guards the state and the selection; subclasses select under it.
    mutable System::NativeMutex _mutex;
 

@@ -80,16 +80,19 @@ void GroupImpl::CollectValues(std::vector<Value>& values) {
 RegistryImpl::RegistryImpl() : _root(std::make_unique<CounterNode>()) {}
 
 RegistryImpl::~RegistryImpl() {
-   std::set<QueryImpl*> queries;
+   // Detached under the list's mutex: a query being dropped right now either left the list
+   // already or waits for it, and is still alive while it hears of the loss.
+   int left;
    {
-      System::NativeSynchronized lock(_queriesMutex);
-      queries.swap(_queries);
+      System::NativeSynchronized lock(_queryList->mutex);
+      left = static_cast<int>(_queryList->queries.size());
+      for (QueryImpl* query : _queryList->queries) query->OnRegistryGone();
+      _queryList->queries.clear();
    }
-   if (!queries.empty()) {
+   if (left > 0) {
       Internal::LogText(Internal::kLogWarning,
                         MessageFormatter::ASPrint("Destruction: Queries are still registered -- %1 queries.",
-                                                  static_cast<int>(queries.size())));
-      for (QueryImpl* query : queries) query->OnRegistryGone();
+                                                  left));
    }
    if (_counterCount > 0) {
       Internal::LogText(Internal::kLogWarning,
@@ -125,8 +128,8 @@ void RegistryImpl::RegisterGroup(RefVector<Metadata>& metadata, GroupPublisher* 
    _groups.emplace(group->GetSequence(), std::make_pair(group, std::move(nodes)));
    _counterCount += static_cast<int>(metadata.size());
    {
-      System::NativeSynchronized lock(_queriesMutex);
-      for (QueryImpl* query : _queries) query->OnGroupAdded(group.Get());
+      System::NativeSynchronized lock(_queryList->mutex);
+      for (QueryImpl* query : _queryList->queries) query->OnGroupAdded(group.Get());
    }
    out = new RegistryItemImpl(group.Get());
 }
@@ -191,8 +194,8 @@ void RegistryImpl::UnregisterGroup(GroupImpl* group) {
    PELMORA_VERIFY(it != _groups.end());
    Ref<GroupImpl> keep = it->second.first;
    {
-      System::NativeSynchronized lock(_queriesMutex);
-      for (QueryImpl* query : _queries) query->OnGroupRemoved(group);
+      System::NativeSynchronized lock(_queryList->mutex);
+      for (QueryImpl* query : _queryList->queries) query->OnGroupRemoved(group);
    }
    for (CounterNode* node : it->second.second) {
       node->group = nullptr;
@@ -220,13 +223,8 @@ void RegistryImpl::ForEachCounter(const std::function<void(CounterNode*)>& visit
 }
 
 void RegistryImpl::AddQuery(QueryImpl* query) {
-   System::NativeSynchronized lock(_queriesMutex);
-   _queries.insert(query);
-}
-
-void RegistryImpl::RemoveQuery(QueryImpl* query) {
-   System::NativeSynchronized lock(_queriesMutex);
-   _queries.erase(query);
+   System::NativeSynchronized lock(_queryList->mutex);
+   _queryList->queries.insert(query);
 }
 
 void RegistryImpl::EnumeratePath(const std::string& path, std::vector<std::string>& out) {
@@ -273,8 +271,8 @@ std::string RegistryImpl::ToString() const {
       text += "\n   " + PathOf(node) + " => " + node->GetPublisher()->ToString();
    });
    text += " }\n Queries = { ";
-   System::NativeSynchronized lock(_queriesMutex);
-   for (QueryImpl* query : _queries) text += query->ToString() + " ";
+   System::NativeSynchronized lock(_queryList->mutex);
+   for (QueryImpl* query : _queryList->queries) text += query->ToString() + " ";
    text += "}";
    return text;
 }

@@ -100,6 +100,14 @@ private:
    const bool _held;
 };
 
+// The queries joined to a registry. Each query shares the list with its registry, so a
+// query dropped while its registry dies leaves through the list and never touches the
+// registry itself.
+struct QueryList {
+   System::NativeMutex mutex;
+   std::set<QueryImpl*> queries PELMORA_GUARDED_BY(mutex);
+};
+
 // Weakly linkable so that a registration can hold it while calling it (HoldRegistry).
 class RegistryImpl : public virtual Registry,
                      public WeakLinkableImpl<System::RWLockableObjectImpl> {
@@ -126,7 +134,7 @@ public:
    CounterNode* FindNode(std::string_view path) const;
    void ForEachCounter(const std::function<void(CounterNode*)>& visit) const;
    void AddQuery(QueryImpl* query);
-   void RemoveQuery(QueryImpl* query);
+   const std::shared_ptr<QueryList>& GetQueryList() const { return _queryList; }
 
    static bool IsValidCounterName(const std::string& name);
 
@@ -144,8 +152,7 @@ private:
 
    // Queries are added under the read lock, so the list has a mutex of its own; they are
    // told of changes under the write lock.
-   mutable System::NativeMutex _queriesMutex;
-   std::set<QueryImpl*> _queries PELMORA_GUARDED_BY(_queriesMutex);
+   const std::shared_ptr<QueryList> _queryList = std::make_shared<QueryList>();
 };
 
 }  // namespace Pelmora::PerfCounter

@@ -1,3 +1,4 @@
+#include <atomic>
 #include <chrono>
 #include <thread>
 
@@ -120,6 +121,28 @@ TEST(RegistryDestructionTest, UnregisteringHoldsAPrivateRegistryUntilDone) {
    Pelmora::Testing::Join(unregistering, "the unregistration");
    EXPECT_FALSE(item->IsRegistered());
    EXPECT_THAT(log.Lines(), testing::IsEmpty());  // it was empty when it went
+}
+
+// A query and its registry dropped at once from two threads: neither may reach the
+// other after it is freed (caught by the address and thread sanitizers).
+TEST(RegistryDestructionTest, AQueryAndItsRegistryDroppedTogetherDoNotRace) {
+   Pelmora::TestSupport::ScopedLogCapture log;
+   for (int round = 0; round < 300; ++round) {
+      Ref<Registry> registry;
+      CreateCounterRegistry(registry);
+      Ref<Query> query;
+      registry->CreateRegexQuery("x", true, query);
+      std::atomic<int> ready{0};
+      auto dropWhenBothReady = [&ready](auto& ref) {
+         ready.fetch_add(1);
+         while (ready.load() < 2) {
+         }
+         ref.Reset();
+      };
+      std::thread dropsQuery([&] { dropWhenBothReady(query); });
+      dropWhenBothReady(registry);
+      Pelmora::Testing::Join(dropsQuery, "dropping the query");
+   }
 }
 
 using RegistryDeathTest = RegistryFixture;
