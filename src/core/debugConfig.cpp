@@ -26,7 +26,17 @@ public:
       _referenceFrames = frames;
    }
 
+   bool GetPrefetchSymbols() const override { return _prefetchSymbols.load(); }
+   void SetPrefetchSymbols(bool on) override { _prefetchSymbols.store(on); }
+   bool GetPrefetchCoreDumpLibs() const override { return _prefetchCoreDumpLibs.load(); }
+   void SetPrefetchCoreDumpLibs(bool on) override { _prefetchCoreDumpLibs.store(on); }
+   bool GetResolveSymbols() const override { return _resolveSymbols.load(); }
+   void SetResolveSymbols(bool on) override { _resolveSymbols.store(on); }
+
 private:
+   std::atomic<bool> _prefetchSymbols{false};
+   std::atomic<bool> _prefetchCoreDumpLibs{false};
+   std::atomic<bool> _resolveSymbols{true};
    std::atomic<int> _exceptionBacktrace{0};
    mutable std::mutex _mutex;
    Ref<System::Backtrace> _referenceFrames;

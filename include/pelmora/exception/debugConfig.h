@@ -16,6 +16,14 @@ public:
    virtual void SetExceptionBacktrace(int maxFrames) = 0;
    virtual Ref<System::Backtrace> GetReferenceFrames() const = 0;
    virtual void SetReferenceFrames(const Ref<System::Backtrace>& frames) = 0;
+   // Start-up switches the application reads with the rest: load debug symbols early,
+   // make the libraries a core dump needs resident early, name frames by symbol.
+   virtual bool GetPrefetchSymbols() const = 0;
+   virtual void SetPrefetchSymbols(bool on) = 0;
+   virtual bool GetPrefetchCoreDumpLibs() const = 0;
+   virtual void SetPrefetchCoreDumpLibs(bool on) = 0;
+   virtual bool GetResolveSymbols() const = 0;
+   virtual void SetResolveSymbols(bool on) = 0;
 
 protected:
    ~DebugConfig() = default;

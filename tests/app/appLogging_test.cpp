@@ -1,0 +1,141 @@
+// Logging as the configuration sets it up: levels and their fallbacks, file, console and
+// memory writers, the fast path switch and per-subsystem levels.
+
+#include <gtest/gtest.h>
+
+#include "pelmora/service.h"
+#include "tests/support/appProcess.h"
+
+namespace Pelmora::Service {
+namespace {
+
+using Testing::Contains;
+using Testing::CountOf;
+using Testing::ReadText;
+using Testing::ScratchDir;
+using Testing::WriteText;
+
+std::string Config(const ScratchDir& dir, const std::string& log, const std::string& extra = "") {
+   std::string path = dir / "app.xml";
+   WriteText(path, "<config><log><directory>" + dir.Path() + "</directory><name>app.log</name>" +
+                       log + "</log><pelmora><daemon><handleSignals>false</handleSignals></daemon>"
+                       "</pelmora>" + extra + "</config>");
+   return path;
+}
+
+std::string LogOf(const ScratchDir& dir) {
+   GetDefaultLogManager()->Flush();
+   return ReadText(dir / "app.log");
+}
+
+TEST(AppLoggingDeathTest, UnknownLevelsFallBackWithOneComplaintEach) {
+   ScratchDir dir;
+   std::string config = Config(dir, "<level>loud</level><memoryLevel>all</memoryLevel>");
+   EXPECT_EXIT(
+       ([&] {
+          InitApp(config);
+          Logger* logger = GetDefaultLogger();
+          APP_CHILD_CHECK(logger->GetLevelByName() == "info");
+          APP_CHILD_CHECK(logger->GetMemLevelByName() == "verbose");
+          std::string log = LogOf(dir);
+          APP_CHILD_CHECK(CountOf(log, "Unrecognized log/level 'loud' using 'info'") == 1);
+          APP_CHILD_CHECK(CountOf(log, "Unrecognized log/memoryLevel 'all' using 'verbose'") == 1);
+          APP_CHILD_CHECK(Contains(log, "warning 'default'] Unrecognized log/level"));
+          // New loggers follow the fallbacks too.
+          Ref<Logger> child;
+          logger->CreateLogger("later", child);
+          APP_CHILD_CHECK(child->GetLevelByName() == "info");
+          _exit(0);
+       })(),
+       testing::ExitedWithCode(0), "");
+}
+
+TEST(AppLoggingDeathTest, LevelsFileModeFastPathAndSubsystemLevelsComeFromTheConfiguration) {
+   ScratchDir dir;
+   std::string config =
+       Config(dir,
+              "<level>warning</level><memoryLevel>info</memoryLevel><fileMode>0600</fileMode>"
+              "<useFastPath>false</useFastPath><outputToConsole>false</outputToConsole>",
+              "<level><a><logName>chatty</logName><logLevel>trivia</logLevel></a></level>");
+   EXPECT_EXIT(
+       ([&] {
+          InitApp(config);
+          Logger* logger = GetDefaultLogger();
+          APP_CHILD_CHECK(logger->GetLevelByName() == "warning");
+          APP_CHILD_CHECK(logger->GetMemLevelByName() == "info");
+          APP_CHILD_CHECK(!IsUsingLogFastPath());
+          Ref<Logger> chatty, quiet;
+          logger->CreateLogger("chatty", chatty);
+          logger->CreateLogger("other", quiet);
+          APP_CHILD_CHECK(chatty->GetLevelByName() == "trivia");
+          APP_CHILD_CHECK(quiet->GetLevelByName() == "warning");
+          PELMORA_LOG_VERBOSE(chatty.Get(), "wanted verbose line");
+          PELMORA_LOG_INFO(quiet.Get(), "unwanted info line");
+          Ref<LogOutput> output;
+          GetDefaultLogManager()->FindLogOutput(LogManager::kDefaultOutput, output);
+          Ref<LogWriter> console;
+          output->GetWriter("console", console);
+          APP_CHILD_CHECK(!console);
+          std::string log = LogOf(dir);
+          APP_CHILD_CHECK(Contains(log, "wanted verbose line"));
+          APP_CHILD_CHECK(!Contains(log, "unwanted info line"));
+          // Start-up's info lines stay out: the level is set before them.
+          APP_CHILD_CHECK(!Contains(log, "Logging uses fast path"));
+          struct stat info;
+          APP_CHILD_CHECK(stat((dir / "app.log").c_str(), &info) == 0);
+          APP_CHILD_CHECK((info.st_mode & 0777) == 0600);
+          _exit(0);
+       })(),
+       testing::ExitedWithCode(0), "");
+}
+
+TEST(AppLoggingDeathTest, TheMemoryRingIsSizedFromTheConfigurationAndServesDumps) {
+   ScratchDir dir;
+   std::string config = Config(dir, "<level>info</level><memoryLevel>trivia</memoryLevel>"
+                                    "<memoryLogSizeK>1</memoryLogSizeK>");
+   EXPECT_EXIT(
+       ([&] {
+          InitApp(config);
+          Logger* logger = GetDefaultLogger();
+          for (int i = 0; i < 100; ++i) PELMORA_LOG_TRIVIA(logger, "ring line %1", i);
+          LogMemoryBuffer(logger, Logger::LOG_ERROR, "dump");
+          std::string log = LogOf(dir);
+          // Trivia lines reach only the ring; the dump shows its last kilobyte.
+          APP_CHILD_CHECK(Contains(log, "ring line 99"));
+          APP_CHILD_CHECK(!Contains(log, "ring line 0\n"));
+          size_t start = log.find("----- Recent log lines (dump)");
+          size_t end = log.find("----- End of recent log lines");
+          APP_CHILD_CHECK(start != std::string::npos && end != std::string::npos);
+          APP_CHILD_CHECK(end - start < 1300);
+          _exit(0);
+       })(),
+       testing::ExitedWithCode(0), "");
+}
+
+TEST(AppLoggingDeathTest, BadLogSettingsAreReportedAndLogsGoToTheConsole) {
+   ScratchDir dir;
+   auto write = [&](const std::string& log) {
+      std::string path = dir / "app.xml";
+      WriteText(path, "<config><log>" + log + "</log><pelmora><daemon><handleSignals>false"
+                      "</handleSignals></daemon></pelmora></config>");
+      return path;
+   };
+   std::string malformed = write("<name>app.log</name><maxFileNum>x</maxFileNum>");
+   EXPECT_EXIT(
+       ([&] {
+          InitApp(malformed);
+          _exit(0);
+       })(),
+       testing::ExitedWithCode(0), "Encountered errors while reading log parameters: ");
+   std::string unopenable =
+       write("<directory>" + dir.Path() + "/missing</directory><name>app.log</name>");
+   EXPECT_EXIT(
+       ([&] {
+          InitApp(unopenable);
+          _exit(0);
+       })(),
+       testing::ExitedWithCode(0), "Failed to open log file .*missing/app.log(.|\n)*Logging uses fast path: true");
+}
+
+}  // namespace
+}  // namespace Pelmora::Service
