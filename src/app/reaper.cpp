@@ -37,15 +37,19 @@ public:
    }
 
    bool WaitStatus(int pid, int timeoutMs, int& status) override {
-      NotifyChildStarted();
       std::unique_lock<std::mutex> lock(_mutex);
+      // While someone waits, the loop looks every millisecond instead of every idle poll.
+      ++_waiters;
+      _wakeRequested = true;
+      _wake.notify_all();
       auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeoutMs);
-      while (!TakeLocked(pid, status)) {
-         if (_reaped.wait_until(lock, deadline) == std::cv_status::timeout) {
-            return TakeLocked(pid, status);
-         }
+      bool found = TakeLocked(pid, status);
+      while (!found && _reaped.wait_until(lock, deadline) != std::cv_status::timeout) {
+         found = TakeLocked(pid, status);
       }
-      return true;
+      if (!found) found = TakeLocked(pid, status);
+      --_waiters;
+      return found;
    }
 
    void Stop() override {
@@ -80,7 +84,8 @@ private:
             _reaped.notify_all();
             continue;  // others may have exited too
          }
-         _wake.wait_for(lock, _idlePoll, [this] { return _stopping || _wakeRequested; });
+         auto period = _waiters > 0 ? std::chrono::milliseconds(1) : _idlePoll;
+         _wake.wait_for(lock, period, [this] { return _stopping || _wakeRequested; });
          _wakeRequested = false;
       }
    }
@@ -91,6 +96,7 @@ private:
    std::condition_variable _reaped;
    bool _stopping = false;
    bool _wakeRequested = false;
+   int _waiters = 0;
    std::map<int, int> _statuses;
    std::thread _thread;
 };
