@@ -39,7 +39,7 @@ public:
    void StartPlugins() override;
 
    void SetInfo(AppInfo* info);
-   // SIGHUP: reopen the log files, reread the configuration and its log levels.
+   // SIGHUP: reread the configuration and apply its log levels, reopen the log files.
    void Reload();
 
 private:

@@ -88,16 +88,29 @@ void AppImpl::Reload() {
    Ref<LogManager> manager = GetAppLogManager();
    Ref<Logger> log = GetAppLogger();
    if (!config || !manager) return;
-   manager->Reopen();
-   PELMORA_LOG_INFO(log.Get(), "Reopened log files");
+   // The levels first, so that the lines below already follow them.
    try {
       if (config->Refresh()) {
+         Ref<Config::View> view;
+         config->GetMainView(view);
+         std::string level, memoryLevel = "verbose", levelComplaint, memoryComplaint;
+         view->Get("log/level", &level);
+         view->Get("log/memoryLevel", &memoryLevel);
+         level = ApplyLogLevel(log.Get(), "log/level", level, "info", false, levelComplaint);
+         memoryLevel = ApplyLogLevel(log.Get(), "log/memoryLevel", memoryLevel, "verbose", true,
+                                     memoryComplaint);
+         manager->SetDefaultLevels(level, memoryLevel);
          manager->LoadLogLevels(config.Get());
+         for (const std::string* complaint : {&levelComplaint, &memoryComplaint}) {
+            if (!complaint->empty()) PELMORA_LOG_WARNING(log.Get(), "%1", *complaint);
+         }
          PELMORA_LOG_INFO(log.Get(), "Configuration refreshed");
       }
    } catch (const Exception& e) {
       PELMORA_LOG_ERROR(log.Get(), "Failed to refresh the configuration: %1", e.GetMessage());
    }
+   manager->Reopen();
+   PELMORA_LOG_INFO(log.Get(), "Reopened log files");
 }
 
 }  // namespace Pelmora::Service

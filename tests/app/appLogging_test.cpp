@@ -1,7 +1,13 @@
 // Logging as the configuration sets it up: levels and their fallbacks, file, console and
 // memory writers, the fast path switch and per-subsystem levels.
 
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+
 #include <gtest/gtest.h>
+
+#include <cstring>
 
 #include "pelmora/service.h"
 #include "tests/support/appProcess.h"
@@ -110,6 +116,44 @@ TEST(AppLoggingDeathTest, TheMemoryRingIsSizedFromTheConfigurationAndServesDumps
           _exit(0);
        })(),
        testing::ExitedWithCode(0), "");
+}
+
+TEST(AppLoggingDeathTest, SyslogAndTheAlternateLogAreAddedWhenConfigured) {
+   ScratchDir dir;
+   std::string socketPath = dir / "syslog";
+   std::string config = Config(
+       dir, "<level>info</level><outputToSyslog>true</outputToSyslog><syslogSocket>" +
+                socketPath + "</syslogSocket><alternateLog><name>alt.log</name></alternateLog>");
+   EXPECT_EXIT(([&] {
+                  int fd = socket(AF_UNIX, SOCK_DGRAM, 0);
+                  sockaddr_un address = {};
+                  address.sun_family = AF_UNIX;
+                  strncpy(address.sun_path, socketPath.c_str(), sizeof(address.sun_path) - 1);
+                  unlink(socketPath.c_str());
+                  APP_CHILD_CHECK(bind(fd, reinterpret_cast<sockaddr*>(&address),
+                                       sizeof(address)) == 0);
+                  InitApp(config);
+                  PELMORA_LOG_WARNING(GetDefaultLogger(), "to syslog too");
+                  std::string got;
+                  for (int i = 0; i < 50 && !Contains(got, "to syslog too"); ++i) {
+                     pollfd p{fd, POLLIN, 0};
+                     APP_CHILD_CHECK(poll(&p, 1, 2000) == 1);
+                     char buffer[4096];
+                     ssize_t n = recv(fd, buffer, sizeof(buffer), 0);
+                     got.assign(buffer, n > 0 ? static_cast<size_t>(n) : 0);
+                  }
+                  // Warning in the daemon facility: 3 * 8 + 4.
+                  APP_CHILD_CHECK(got.rfind("<28>", 0) == 0);
+                  Ref<LogOutput> alternate;
+                  GetDefaultLogManager()->FindLogOutput("alternateLog", alternate);
+                  APP_CHILD_CHECK(alternate);
+                  const char line[] = "alternate line\n";
+                  alternate->WriteMessage(Logger::LOG_INFO, line, sizeof(line) - 1);
+                  alternate->Flush();
+                  APP_CHILD_CHECK(ReadText(dir / "alt.log") == line);
+                  _exit(0);
+               })(),
+               testing::ExitedWithCode(0), "");
 }
 
 TEST(AppLoggingDeathTest, BadLogSettingsAreReportedAndLogsGoToTheConsole) {

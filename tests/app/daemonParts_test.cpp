@@ -154,6 +154,26 @@ TEST_F(DaemonTest, SighupReopensARenamedLogFile) {
    EXPECT_TRUE(Contains(Log(), "Received signal 15"));
 }
 
+TEST_F(DaemonTest, SighupAppliesTheLevelsOfAChangedConfiguration) {
+   pid_t child = Start("", 0);
+   ASSERT_TRUE(_notify.ReceiveUntil("READY=1", _seen));
+   std::string config = ReadText(_dir / "daemon.xml");
+   size_t at = config.find("<level>info</level>");
+   ASSERT_NE(at, std::string::npos);
+   // The unknown memory level is complained about at warning: a sign the reload happened.
+   config.replace(at, strlen("<level>info</level>"),
+                  "<level>warning</level><memoryLevel>bogus</memoryLevel>");
+   WriteText(_dir / "daemon.xml", config);
+   kill(child, SIGHUP);
+   ASSERT_TRUE(WaitUntil([&] { return Contains(Log(), "Unrecognized log/memoryLevel 'bogus'"); }));
+   kill(child, SIGTERM);
+   int status = WaitExit(child);
+   ASSERT_TRUE(WIFEXITED(status)) << status;
+   // Info lines from the reload on are no longer written.
+   EXPECT_FALSE(Contains(Log(), "Reopened log files")) << Log();
+   EXPECT_FALSE(Contains(Log(), "Received signal 15")) << Log();
+}
+
 TEST_F(DaemonTest, TheWatchdogIsFedAtHalfItsInterval) {
    pid_t child = Start("", 0, "return", "40000");  // 40 ms: fed every 20 ms
    ASSERT_TRUE(_notify.ReceiveUntil("READY=1", _seen));

@@ -62,7 +62,8 @@ public:
                                     Ref<ChannelReader>& out) = 0;
    virtual void CreateChannelWriter(const std::string& name, Ref<ChannelWriter>& out) = 0;
 
-   // The calling (main) thread runs the pool's main-thread queue until the pool shuts down.
+   // Starts the plug-ins (StartPlugins), tells the service manager the process is ready,
+   // then the calling (main) thread runs the pool's main-thread queue until it shuts down.
    virtual void Run() = 0;
    virtual void SetExitStatus(int status) = 0;
    virtual int GetExitStatus() = 0;
@@ -85,7 +86,7 @@ PELMORA_EXPORT void CreateApp();
 // The application object, or null before CreateApp and after Exit.
 PELMORA_EXPORT App* GetApp();
 
-// CreateApp, then Init with: a scratch configuration; the XML file `configFile`; `config`;
+// CreateApp, Init, LoadPlugins and InitPlugins, with: a scratch configuration; the XML file `configFile`; `config`;
 // the file's configuration with `defaults` behind it; a scratch configuration holding
 // "log/name" and "log/directory" behind the file's.
 PELMORA_EXPORT void InitApp();
