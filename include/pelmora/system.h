@@ -1,13 +1,15 @@
 #pragma once
 // System services: the system factory, backtraces, locks, conditions, threads, TLS and
-// the thread pool with its work queues.
+// the thread pool with its work queues, streams and their binding information.
 
 #include "pelmora/exception/backtrace.h"
 #include "pelmora/system/condition.h"
 #include "pelmora/system/functor.h"
 #include "pelmora/system/lockable.h"
+#include "pelmora/system/address.h"
 #include "pelmora/system/multiSynchronized.h"
 #include "pelmora/system/rwLock.h"
+#include "pelmora/system/stream.h"
 #include "pelmora/system/systemFactory.h"
 #include "pelmora/system/thread.h"
 #include "pelmora/system/threadPool.h"
