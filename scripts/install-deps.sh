@@ -12,6 +12,7 @@ packages=(
   libsqlite3-dev  # the authorisation store
   prometheus  # promtool checks the metrics export in the tests
   clang libclang-rt-14-dev clang-format
+  openssl  # the TLS stream tests make throw-away certificates
 )
 
 missing=()

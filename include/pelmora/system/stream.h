@@ -62,4 +62,15 @@ public:
    virtual void Close() = 0;
 };
 
+// The length of one time-out tick: 5 seconds, unless shortened (tests do). Applies to
+// time-outs armed after the change and to the ticker's next period.
+constexpr long long kStreamTimeoutTickMicroseconds = 5000000;
+PELMORA_EXPORT void SetStreamTimeoutTick(long long microseconds);
+PELMORA_EXPORT long long GetStreamTimeoutTick();
+
+// Two connected streams over a Unix-domain socket pair, completing on the process's
+// thread pool (GetThreadPool); for tests and in-process pipes. SystemException when the
+// system refuses, InvalidStateException without a pool.
+PELMORA_EXPORT void CreateStreamPair(Ref<Stream>& first, Ref<Stream>& second);
+
 }  // namespace Pelmora::System

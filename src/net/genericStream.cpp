@@ -1,0 +1,44 @@
+// The pool's I/O service for streams, asio errors as the library's exceptions, and
+// stream pairs over a Unix-domain socket pair.
+
+#include "src/net/genericStream.h"
+
+#include <boost/asio/error.hpp>
+#include <boost/asio/local/connect_pair.hpp>
+#include <boost/asio/local/stream_protocol.hpp>
+
+#include "pelmora/system/threadPool.h"
+#include "pelmora/system/threadPoolWorkBinder.h"
+
+namespace Pelmora::System {
+
+boost::asio::io_context& GetPoolIoContext() {
+   auto* binder = dynamic_cast<ThreadPoolWorkBinder*>(GetThreadPool());
+   if (binder == nullptr) throw InvalidStateException("No thread pool for streams");
+   return binder->GetIoService();
+}
+
+bool IsEndOfStream(const boost::system::error_code& error) {
+   return error == boost::asio::error::eof;
+}
+
+Exception* MakeStreamException(const boost::system::error_code& error) {
+   if (error == boost::asio::error::operation_aborted) return new CanceledException();
+   return new SystemException(error.value(), error.message());
+}
+
+void CreateStreamPair(Ref<Stream>& first, Ref<Stream>& second) {
+   using Socket = boost::asio::local::stream_protocol::socket;
+   boost::asio::io_context& io = GetPoolIoContext();
+   Socket a(io);
+   Socket b(io);
+   boost::system::error_code error;
+   boost::asio::local::connect_pair(a, b, error);
+   if (error) throw SystemException(error.value(), error.message());
+   std::string name = "pair " + std::to_string(a.native_handle()) + "<->" +
+                      std::to_string(b.native_handle());
+   first = new GenericStream<Socket>(std::move(a), nullptr, name);
+   second = new GenericStream<Socket>(std::move(b), nullptr, name);
+}
+
+}  // namespace Pelmora::System

@@ -1,0 +1,86 @@
+#pragma once
+// GenericStream moves a StreamBase's bytes over one Boost.Asio I/O object (a socket, a
+// descriptor, a TLS stream). Reads take what is there; writes send everything. Its
+// completions run on the pool thread that served the I/O, or, when the stream was given a
+// work queue, on that queue. The asio object is touched only under the stream's lock.
+
+#include <cstddef>
+#include <string>
+#include <utility>
+
+#include <boost/asio/io_context.hpp>
+#include <boost/asio/write.hpp>
+
+#include "pelmora/system/workQueue.h"
+#include "src/net/streamBase.h"
+
+namespace Pelmora::System {
+
+// The process's pool's I/O service; InvalidStateException when no pool is set.
+boost::asio::io_context& GetPoolIoContext();
+// The library's exception for a failed asio operation: SslException for TLS failures,
+// CanceledException for an aborted operation, SystemException otherwise.
+Exception* MakeStreamException(const boost::system::error_code& error);
+// Whether a read error means the peer ended the stream.
+bool IsEndOfStream(const boost::system::error_code& error);
+
+template <class Io>
+class GenericStream : public StreamBase {
+public:
+   GenericStream(Io&& io, WorkQueue* queue, std::string description)
+       : StreamBase(std::move(description)), _io(std::move(io)), _queue(queue) {}
+
+   Io& GetIo() { return _io; }
+   using StreamBase::SetBindings;
+
+protected:
+   void StartRead(char* buffer, int length) override {
+      Ref<GenericStream> self(this);
+      _io.async_read_some(boost::asio::buffer(buffer, static_cast<std::size_t>(length)),
+                          [self](const boost::system::error_code& error, std::size_t bytes) {
+                             self->Finish(false, error, bytes);
+                          });
+   }
+
+   void StartWrite(const char* buffer, int length) override {
+      Ref<GenericStream> self(this);
+      boost::asio::async_write(_io, boost::asio::buffer(buffer, static_cast<std::size_t>(length)),
+                               [self](const boost::system::error_code& error, std::size_t bytes) {
+                                  self->Finish(true, error, bytes);
+                               });
+   }
+
+   void CloseIo() override {
+      boost::system::error_code ignored;
+      if constexpr (requires { _io.close(ignored); }) {
+         _io.close(ignored);
+      } else {
+         _io.lowest_layer().close(ignored);
+      }
+   }
+
+   void Finish(bool isWrite, const boost::system::error_code& error, std::size_t bytes) {
+      if (_queue) {
+         Ref<GenericStream> self(this);
+         _queue->Enqueue([self, isWrite, error, bytes] { self->Deliver(isWrite, error, bytes); });
+      } else {
+         Deliver(isWrite, error, bytes);
+      }
+   }
+
+   void Deliver(bool isWrite, const boost::system::error_code& error, std::size_t bytes) {
+      if (!error) {
+         CompleteIO(isWrite, nullptr, static_cast<int>(bytes));
+      } else if (!isWrite && IsEndOfStream(error)) {
+         CompleteIO(isWrite, nullptr, 0);
+      } else {
+         std::unique_ptr<Exception> failure(MakeStreamException(error));
+         CompleteIO(isWrite, failure.get(), static_cast<int>(bytes));
+      }
+   }
+
+   Io _io;
+   Ref<WorkQueue> _queue;
+};
+
+}  // namespace Pelmora::System
