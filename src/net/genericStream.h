@@ -3,12 +3,17 @@
 // descriptor, a TLS stream). Reads take what is there; writes send everything. Its
 // completions run on the pool thread that served the I/O, or, when the stream was given a
 // work queue, on that queue. The asio object is touched only under the stream's lock.
+// A serialized stream (TLS: its engine serves both directions) keeps its I/O object on a
+// strand: operations start and close inside it, and completions leave it, so a callback
+// may wait for the other direction.
 
 #include <cstddef>
 #include <string>
 #include <utility>
 
+#include <boost/asio/dispatch.hpp>
 #include <boost/asio/io_context.hpp>
+#include <boost/asio/post.hpp>
 #include <boost/asio/write.hpp>
 
 #include "pelmora/system/workQueue.h"
@@ -24,7 +29,7 @@ Exception* MakeStreamException(const boost::system::error_code& error);
 // Whether a read error means the peer ended the stream.
 bool IsEndOfStream(const boost::system::error_code& error);
 
-template <class Io>
+template <class Io, bool kSerialized = false>
 class GenericStream : public StreamBase {
 public:
    GenericStream(Io&& io, WorkQueue* queue, std::string description)
@@ -36,13 +41,40 @@ public:
 protected:
    void StartRead(char* buffer, int length) override {
       Ref<GenericStream> self(this);
+      if constexpr (kSerialized) {
+         boost::asio::dispatch(_io.get_executor(), [self, buffer, length] { self->ReadNow(buffer, length); });
+      } else {
+         ReadNow(buffer, length);
+      }
+   }
+
+   void StartWrite(const char* buffer, int length) override {
+      Ref<GenericStream> self(this);
+      if constexpr (kSerialized) {
+         boost::asio::dispatch(_io.get_executor(), [self, buffer, length] { self->WriteNow(buffer, length); });
+      } else {
+         WriteNow(buffer, length);
+      }
+   }
+
+   void CloseIo() override {
+      if constexpr (kSerialized) {
+         Ref<GenericStream> self(this);
+         boost::asio::dispatch(_io.get_executor(), [self] { self->CloseNow(); });
+      } else {
+         CloseNow();
+      }
+   }
+
+   void ReadNow(char* buffer, int length) {
+      Ref<GenericStream> self(this);
       _io.async_read_some(boost::asio::buffer(buffer, static_cast<std::size_t>(length)),
                           [self](const boost::system::error_code& error, std::size_t bytes) {
                              self->Finish(false, error, bytes);
                           });
    }
 
-   void StartWrite(const char* buffer, int length) override {
+   void WriteNow(const char* buffer, int length) {
       Ref<GenericStream> self(this);
       boost::asio::async_write(_io, boost::asio::buffer(buffer, static_cast<std::size_t>(length)),
                                [self](const boost::system::error_code& error, std::size_t bytes) {
@@ -50,7 +82,7 @@ protected:
                                });
    }
 
-   void CloseIo() override {
+   void CloseNow() {
       boost::system::error_code ignored;
       if constexpr (requires { _io.close(ignored); }) {
          _io.close(ignored);
@@ -63,6 +95,11 @@ protected:
       if (_queue) {
          Ref<GenericStream> self(this);
          _queue->Enqueue([self, isWrite, error, bytes] { self->Deliver(isWrite, error, bytes); });
+      } else if constexpr (kSerialized) {
+         Ref<GenericStream> self(this);
+         boost::asio::post(GetPoolIoContext(), [self, isWrite, error, bytes] {
+            self->Deliver(isWrite, error, bytes);
+         });
       } else {
          Deliver(isWrite, error, bytes);
       }

@@ -1,10 +1,12 @@
 #pragma once
 // Binding information: where one end of a stream is bound. InetBindingInfo holds an IPv4
 // or IPv6 address and port, LocalBindingInfo a Unix-domain socket path. Streams hand
-// them out through Stream::GetBindingInfo; the HTTP server logs and checks them. The
+// them out through Stream::GetBindingInfo; the HTTP server logs and checks them;
+// ResolveAddress turns host names into them. The
 // objects are immutable once made, so they may be shared between threads.
 
 #include <string>
+#include <vector>
 
 #include "pelmora/object/export.h"
 #include "pelmora/object/ref.h"
@@ -48,5 +50,11 @@ public:
 private:
    std::string _path;
 };
+
+// The numeric addresses of `host` (a name or a numeric IPv4 or IPv6 address) with
+// `port`, in the resolver's order; `passive` for listening (empty host: every IPv4
+// address). NotFoundException with the resolver's text when there are none.
+PELMORA_EXPORT void ResolveAddress(const std::string& host, int port, bool passive,
+                                   std::vector<Ref<InetBindingInfo>>& out);
 
 }  // namespace Pelmora::System
