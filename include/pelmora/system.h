@@ -1,6 +1,6 @@
 #pragma once
 // System services: the system factory, backtraces, locks, conditions, threads, TLS and
-// the thread pool with its work queues, streams, sockets and their binding information.
+// the thread pool with its work queues, streams, sockets, TLS and binding information.
 
 #include "pelmora/exception/backtrace.h"
 #include "pelmora/system/condition.h"
@@ -10,6 +10,7 @@
 #include "pelmora/system/multiSynchronized.h"
 #include "pelmora/system/rwLock.h"
 #include "pelmora/system/socket.h"
+#include "pelmora/system/ssl.h"
 #include "pelmora/system/stream.h"
 #include "pelmora/system/systemFactory.h"
 #include "pelmora/system/thread.h"

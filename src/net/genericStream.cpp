@@ -6,7 +6,9 @@
 #include <boost/asio/error.hpp>
 #include <boost/asio/local/connect_pair.hpp>
 #include <boost/asio/local/stream_protocol.hpp>
+#include <boost/asio/ssl/error.hpp>
 
+#include "pelmora/system/ssl.h"
 #include "pelmora/system/threadPool.h"
 #include "pelmora/system/threadPoolWorkBinder.h"
 
@@ -19,11 +21,16 @@ boost::asio::io_context& GetPoolIoContext() {
 }
 
 bool IsEndOfStream(const boost::system::error_code& error) {
-   return error == boost::asio::error::eof;
+   // A TLS peer that closes without its close-notify ends the stream all the same.
+   return error == boost::asio::error::eof || error == boost::asio::ssl::error::stream_truncated;
 }
 
 Exception* MakeStreamException(const boost::system::error_code& error) {
    if (error == boost::asio::error::operation_aborted) return new CanceledException();
+   if (error.category() == boost::asio::error::get_ssl_category() ||
+       error.category() == boost::asio::ssl::error::get_stream_category()) {
+      return new SslException(error.message());
+   }
    return new SystemException(error.value(), error.message());
 }
 

@@ -23,6 +23,7 @@ std::atomic<long long> tickMicroseconds{kStreamTimeoutTickMicroseconds};
 void SetStreamTimeoutTick(long long microseconds) {
    PELMORA_VERIFY(microseconds > 0);
    tickMicroseconds.store(microseconds, std::memory_order_relaxed);
+   TimeoutTicker::GetInstance().Rearm();
 }
 
 long long GetStreamTimeoutTick() { return tickMicroseconds.load(std::memory_order_relaxed); }
@@ -355,6 +356,12 @@ void TimeoutTicker::ArmLocked() {
    _private->armed = true;
    _private->pool = pool;
    pool->ScheduleTimer([this] { Fire(); }, GetStreamTimeoutTick(), _private->timer);
+}
+
+void TimeoutTicker::Rearm() {
+   std::lock_guard<std::mutex> lock(_private->mutex);
+   if (_private->armed && _private->timer && _private->timer->Cancel()) _private->armed = false;
+   if (!_private->streams.empty()) ArmLocked();
 }
 
 void TimeoutTicker::Fire() {

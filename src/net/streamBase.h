@@ -117,6 +117,8 @@ public:
    static TimeoutTicker& GetInstance();
    void RegisterStream(StreamBase* stream);
    void UnregisterStream(StreamBase* stream);
+   // Restarts the timer with the current tick length.
+   void Rearm();
    // One tick now, on the calling thread.
    void Tick();
    int GetStreamCount();

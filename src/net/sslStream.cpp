@@ -1,0 +1,235 @@
+// TLS contexts, server sockets and connections over asio::ssl and OpenSSL. Each TLS
+// stream lives on its own strand: the OpenSSL engine serves both directions.
+
+#include <openssl/err.h>
+#include <openssl/ssl.h>
+#include <openssl/x509.h>
+
+#include <boost/asio/ssl/context.hpp>
+#include <boost/asio/ssl/host_name_verification.hpp>
+#include <boost/asio/ssl/stream.hpp>
+#include <boost/asio/steady_timer.hpp>
+#include <boost/asio/strand.hpp>
+
+#include "pelmora/system/ssl.h"
+#include "src/net/socketImpl.h"
+
+namespace Pelmora::System {
+
+namespace {
+
+using Tcp = boost::asio::ip::tcp;
+using SslSocket = boost::asio::ssl::stream<Tcp::socket>;
+using SslGenericStream = GenericStream<SslSocket, true>;
+
+class SslContextImpl : public virtual SslContext, public ObjectImpl {
+public:
+   explicit SslContextImpl(bool server)
+       : _context(server ? boost::asio::ssl::context::tls_server : boost::asio::ssl::context::tls_client),
+         _server(server) {}
+   bool IsServer() const override { return _server; }
+   boost::asio::ssl::context& Get() { return _context; }
+   SslClientOptions clientOptions;
+
+private:
+   boost::asio::ssl::context _context;
+   bool _server;
+};
+
+// OpenSSL's reason for the last failure on this thread, or `fallback`.
+std::string LastSslError(const std::string& fallback) {
+   unsigned long code = ERR_get_error();
+   ERR_clear_error();
+   if (code == 0) return fallback;
+   const char* reason = ERR_reason_error_string(code);
+   return reason != nullptr ? reason : fallback;
+}
+
+void Check(const boost::system::error_code& error, const std::string& what) {
+   if (error) throw SslException(what + ": " + error.message());
+}
+
+void ApplyVersionAndCiphers(SSL_CTX* context, const std::string& minVersion, const std::string& ciphers) {
+   int version = 0;
+   if (minVersion == "TLSv1.2") {
+      version = TLS1_2_VERSION;
+   } else if (minVersion == "TLSv1.3") {
+      version = TLS1_3_VERSION;
+   } else {
+      throw SslException("unsupported minimum version " + minVersion);
+   }
+   if (SSL_CTX_set_min_proto_version(context, version) != 1) {
+      throw SslException(LastSslError("cannot set the minimum version"));
+   }
+   if (!ciphers.empty() && SSL_CTX_set_cipher_list(context, ciphers.c_str()) != 1) {
+      throw SslException("cipher list " + ciphers + ": " + LastSslError("no cipher matches"));
+   }
+}
+
+SslContextImpl* ContextOf(SslContext* context, bool server) {
+   auto* impl = dynamic_cast<SslContextImpl*>(context);
+   if (impl == nullptr || impl->IsServer() != server) {
+      throw InvalidArgumentException(server ? "a server TLS context is needed" : "a client TLS context is needed");
+   }
+   return impl;
+}
+
+Ref<SslGenericStream> MakeSslStream(SslSocket&& socket) {
+   boost::system::error_code error;
+   Tcp::socket& tcp = socket.next_layer();
+   Ref<BindingInfo> local = MakeBindingInfo(tcp.local_endpoint(error));
+   auto remote = tcp.remote_endpoint(error);
+   Ref<BindingInfo> peer = error ? Ref<BindingInfo>() : MakeBindingInfo(remote);
+   std::string description = DescribeStream("tls", local.Get(), peer.Get());
+   Ref<SslGenericStream> stream = new SslGenericStream(std::move(socket), nullptr, description);
+   stream->SetBindings(local, peer);
+   return stream;
+}
+
+// A handshake failure with the certificate check's own reason where there is one.
+Exception* HandshakeFailure(const boost::system::error_code& error, SslSocket& socket) {
+   std::unique_ptr<Exception> failure(MakeStreamException(error));
+   long verify = SSL_get_verify_result(socket.native_handle());
+   if (dynamic_cast<SslException*>(failure.get()) != nullptr && verify != X509_V_OK) {
+      return new SslException(error.message() + " (" + X509_verify_cert_error_string(verify) + ")");
+   }
+   if (dynamic_cast<SslException*>(failure.get()) == nullptr) {
+      return new SslException("handshake failed: " + failure->GetMessage());
+   }
+   return failure.release();
+}
+
+class SslServerSocket : public ServerSocketImpl<Tcp> {
+public:
+   SslServerSocket(Tcp::acceptor&& acceptor, const ServerSocketOptions& options, SslContextImpl* context)
+       : ServerSocketImpl<Tcp>(std::move(acceptor), options), _context(context) {}
+
+protected:
+   boost::asio::any_io_executor AcceptExecutor() override {
+      return boost::asio::make_strand(GetPoolIoContext());
+   }
+
+   void MakeStream(Tcp::socket&& socket, const std::function<void(Exception*, Stream*)>& done) override {
+      struct Handshake {
+         Handshake(Tcp::socket&& tcp, boost::asio::ssl::context& context)
+             : stream(std::move(tcp), context), timer(stream.get_executor()) {}
+         SslSocket stream;
+         boost::asio::steady_timer timer;
+         bool finished = false;
+      };
+      auto handshake = std::make_shared<Handshake>(std::move(socket), _context->Get());
+      long long limit = _options.handshakeTimeoutMicroseconds;
+      Ref<ServerSocketImpl<Tcp>> self(this);
+      // Inside the connection's strand; the result leaves it, so that the callback may
+      // use the stream synchronously.
+      boost::asio::dispatch(handshake->stream.get_executor(), [handshake, limit, done, self] {
+         if (limit >= 0) {
+            handshake->timer.expires_after(std::chrono::microseconds(limit));
+            handshake->timer.async_wait([handshake](const boost::system::error_code& error) {
+               if (error || handshake->finished) return;
+               boost::system::error_code ignored;
+               handshake->stream.lowest_layer().close(ignored);
+            });
+         }
+         handshake->stream.async_handshake(
+             boost::asio::ssl::stream_base::server, [handshake, done](const boost::system::error_code& error) {
+                handshake->finished = true;
+                handshake->timer.cancel();
+                std::shared_ptr<Exception> failure;
+                Ref<SslGenericStream> stream;
+                if (error) {
+                   failure.reset(HandshakeFailure(error, handshake->stream));
+                } else {
+                   stream = MakeSslStream(std::move(handshake->stream));
+                }
+                boost::asio::post(GetPoolIoContext(), [done, failure, stream] { done(failure.get(), stream.Get()); });
+             });
+      });
+   }
+
+private:
+   Ref<SslContextImpl> _context;
+};
+
+}  // namespace
+
+void CreateSslServerContext(const SslServerOptions& options, Ref<SslContext>& out) {
+   Ref<SslContextImpl> context = new SslContextImpl(true);
+   boost::asio::ssl::context& ssl = context->Get();
+   ssl.set_options(boost::asio::ssl::context::default_workarounds | boost::asio::ssl::context::no_sslv2 |
+                   boost::asio::ssl::context::no_sslv3 | boost::asio::ssl::context::single_dh_use);
+   boost::system::error_code error;
+   ssl.use_certificate_chain_file(options.certificateChainFile, error);
+   Check(error, "certificate chain " + options.certificateChainFile);
+   ssl.use_private_key_file(options.privateKeyFile, boost::asio::ssl::context::pem, error);
+   Check(error, "private key " + options.privateKeyFile);
+   if (SSL_CTX_check_private_key(ssl.native_handle()) != 1) {
+      throw SslException("private key " + options.privateKeyFile + ": " +
+                         LastSslError("does not match the certificate"));
+   }
+   ApplyVersionAndCiphers(ssl.native_handle(), options.minVersion, options.cipherList);
+   out = context;
+}
+
+void CreateSslClientContext(const SslClientOptions& options, Ref<SslContext>& out) {
+   Ref<SslContextImpl> context = new SslContextImpl(false);
+   boost::asio::ssl::context& ssl = context->Get();
+   boost::system::error_code error;
+   if (options.caFile.empty()) {
+      ssl.set_default_verify_paths(error);
+      Check(error, "system certificate store");
+   } else {
+      ssl.load_verify_file(options.caFile, error);
+      Check(error, "CA file " + options.caFile);
+   }
+   ssl.set_verify_mode(options.verifyPeer ? boost::asio::ssl::verify_peer : boost::asio::ssl::verify_none);
+   ApplyVersionAndCiphers(ssl.native_handle(), options.minVersion, options.cipherList);
+   context->clientOptions = options;
+   out = context;
+}
+
+void CreateSslServerSocket(const std::string& host, int port, const ServerSocketOptions& options,
+                           SslContext* context, Ref<ServerSocket>& out) {
+   SslContextImpl* impl = ContextOf(context, true);
+   std::vector<Ref<InetBindingInfo>> addresses;
+   ResolveAddress(host, port, true, addresses);
+   Tcp::endpoint endpoint(boost::asio::ip::make_address(addresses.front()->GetAddress()),
+                          static_cast<unsigned short>(port));
+   Tcp::acceptor acceptor(GetPoolIoContext());
+   OpenAcceptor(acceptor, endpoint, options, options.reuseAddress);
+   out = new SslServerSocket(std::move(acceptor), options, impl);
+}
+
+void CreateSslConnection(const std::string& host, int port, long long timeoutMicroseconds,
+                         SslContext* context, Ref<Stream>& out) {
+   SslContextImpl* impl = ContextOf(context, false);
+   auto deadline = DeadlineAfter(timeoutMicroseconds);
+   Tcp::socket tcp(boost::asio::make_strand(GetPoolIoContext()));
+   ConnectTcpSocket(host, port, deadline, tcp);
+   SslSocket ssl(std::move(tcp), impl->Get());
+   const std::string& name = impl->clientOptions.serverName.empty() ? host : impl->clientOptions.serverName;
+   SSL_set_tlsext_host_name(ssl.native_handle(), name.c_str());
+   if (impl->clientOptions.verifyPeer) ssl.set_verify_callback(boost::asio::ssl::host_name_verification(name));
+
+   auto wait = std::make_shared<OperationWait>();
+   boost::asio::dispatch(ssl.get_executor(), [&ssl, wait] {
+      ssl.async_handshake(boost::asio::ssl::stream_base::client,
+                          [wait](const boost::system::error_code& error) { wait->Done(error); });
+   });
+   WaitOrCancel(*wait, deadline, [&ssl] {
+      OperationWait closed;
+      boost::asio::dispatch(ssl.get_executor(), [&ssl, &closed] {
+         boost::system::error_code ignored;
+         ssl.lowest_layer().close(ignored);
+         closed.Done({});
+      });
+      closed.WaitDone();
+   });
+   if (wait->Error()) {
+      std::unique_ptr<Exception> failure(HandshakeFailure(wait->Error(), ssl));
+      failure->Throw();
+   }
+   out = MakeSslStream(std::move(ssl));
+}
+
+}  // namespace Pelmora::System

@@ -1,0 +1,266 @@
+// TLS over loopback with throw-away certificates made by the openssl command: echo,
+// verification against the right and the wrong CA, bad settings, and no leaked
+// descriptors after a failed handshake.
+
+#include <dirent.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <string>
+#include <thread>
+
+#include "tests/support/netFixture.h"
+
+namespace Pelmora::System {
+namespace {
+
+using NetTesting::Completion;
+
+// A CA, a server certificate it signed for localhost and 127.0.0.1, and an unrelated CA.
+struct Certificates {
+   std::string dir;
+   bool ok = false;
+   std::string Path(const char* name) const { return dir + "/" + name; }
+};
+
+const Certificates& GetCertificates() {
+   static Certificates certificates = [] {
+      Certificates made;
+      made.dir = ::testing::TempDir() + "pelmora_tls_" + std::to_string(::getpid());
+      std::string d = made.dir;
+      std::ofstream(d + ".ext") << "subjectAltName=DNS:localhost,IP:127.0.0.1\n";
+      std::string key = " -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes";
+      std::string script =
+          "set -e; mkdir -p " + d + "; cd " + d + "; mv " + d + ".ext ext.cnf;" +
+          " openssl req -x509" + key + " -keyout ca.key -out ca.pem -days 2 -subj /CN=PelmoraTestCA;" +
+          " openssl req -x509" + key + " -keyout other.key -out other.pem -days 2 -subj /CN=OtherCA;" +
+          " openssl req" + key + " -keyout server.key -out server.csr -subj /CN=localhost;" +
+          " openssl x509 -req -in server.csr -CA ca.pem -CAkey ca.key -CAcreateserial" +
+          " -out server.pem -days 2 -extfile ext.cnf";
+      made.ok = std::system(("(" + script + ") >/dev/null 2>&1").c_str()) == 0;
+      return made;
+   }();
+   return certificates;
+}
+
+int CountDescriptors() {
+   int count = 0;
+   DIR* dir = ::opendir("/proc/self/fd");
+   while (dirent* entry = ::readdir(dir)) {
+      if (entry->d_name[0] != '.') ++count;
+   }
+   ::closedir(dir);
+   return count;
+}
+
+class SslStreamTest : public ::testing::Test {
+protected:
+   void SetUp() override {
+      NetTesting::EnsurePool();
+      const Certificates& certificates = GetCertificates();
+      ASSERT_TRUE(certificates.ok) << "the openssl command could not make certificates";
+      SslServerOptions serverOptions;
+      serverOptions.certificateChainFile = certificates.Path("server.pem");
+      serverOptions.privateKeyFile = certificates.Path("server.key");
+      CreateSslServerContext(serverOptions, serverContext);
+      CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), serverContext.Get(), server);
+      Ref<BindingInfo> listening;
+      server->GetBindingInfo(listening);
+      port = listening->GetPort();
+   }
+   void TearDown() override {
+      if (server) server->Close();
+   }
+
+   Ref<SslContext> ClientContext(const char* caName) {
+      SslClientOptions options;
+      options.caFile = GetCertificates().Path(caName);
+      Ref<SslContext> context;
+      CreateSslClientContext(options, context);
+      return context;
+   }
+
+   Ref<SslContext> serverContext;
+   Ref<ServerSocket> server;
+   int port = 0;
+};
+
+TEST_F(SslStreamTest, EchoSynchronousAndAsynchronousAfterVerifiedHandshake) {
+   Completion accepted;
+   Ref<Stream> serverSide;
+   server->AsyncAccept([&](ServerSocket*, Exception* error, Stream* stream) {
+      serverSide = stream;
+      accepted.Done(error, 0);
+   });
+   Ref<SslContext> client = ClientContext("ca.pem");
+   Ref<Stream> stream;
+   CreateSslConnection("127.0.0.1", port, 10000000, client.Get(), stream);
+   ASSERT_TRUE(accepted.WaitCount(1));
+   ASSERT_FALSE(accepted.Failed()) << accepted.Error();
+   std::thread echo([&] {
+      char buffer[8192];
+      for (;;) {
+         int n = serverSide->Read(buffer, sizeof buffer);
+         if (n == 0) break;
+         serverSide->Write(buffer, n);
+      }
+      serverSide->Close();
+   });
+   EXPECT_NE(std::string::npos, stream->ToString().find("tls 127.0.0.1:")) << stream->ToString();
+   Ref<BindingInfo> local;
+   Ref<BindingInfo> peer;
+   stream->GetBindingInfo(typeid(InetBindingInfo), local, peer);
+   ASSERT_TRUE(peer);
+   EXPECT_EQ(port, peer->GetPort());
+
+   // 200 KiB both ways at once: reads and writes share the TLS engine.
+   std::string big(200 * 1024, 0);
+   for (size_t i = 0; i < big.size(); ++i) big[i] = static_cast<char>(i * 7);
+   std::string back;
+   Completion wrote;
+   stream->AsyncWrite(big.data(), static_cast<int>(big.size()),
+                      [&](Stream*, Exception* error) { wrote.Done(error, 0); });
+   char buffer[8192];
+   while (back.size() < big.size()) {
+      int n = stream->Read(buffer, sizeof buffer);
+      ASSERT_GT(n, 0);
+      back.append(buffer, n);
+   }
+   ASSERT_TRUE(wrote.WaitCount(1));
+   EXPECT_FALSE(wrote.Failed()) << wrote.Error();
+   EXPECT_TRUE(big == back);
+
+   stream->Close();
+   echo.join();
+}
+
+TEST_F(SslStreamTest, WrongCaFailsTheHandshakeOnBothSidesWithoutLeaks) {
+   Ref<SslContext> wrong = ClientContext("other.pem");
+   // Warm up the pool and the resolver so that their descriptors are counted before.
+   std::vector<Ref<InetBindingInfo>> ignored;
+   ResolveAddress("127.0.0.1", port, false, ignored);
+   int before = CountDescriptors();
+   for (int i = 0; i < 3; ++i) {
+      Completion accepted;
+      server->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { accepted.Done(error, 0); });
+      Ref<Stream> stream;
+      try {
+         CreateSslConnection("127.0.0.1", port, 10000000, wrong.Get(), stream);
+         FAIL() << "the handshake succeeded";
+      } catch (const SslException& e) {
+         EXPECT_NE(std::string::npos, std::string(e.what()).find("certificate verify failed")) << e.what();
+      }
+      EXPECT_FALSE(stream);
+      ASSERT_TRUE(accepted.WaitCount(1));
+      EXPECT_TRUE(accepted.Failed());
+      EXPECT_EQ(0u, accepted.Error().rfind("SSL error: ", 0)) << accepted.Error();
+   }
+   // The server side lets go of a failed connection on a pool thread, soon after.
+   EXPECT_TRUE(NetTesting::WaitFor([&] { return CountDescriptors() <= before; }, "descriptors released"))
+       << CountDescriptors() << " descriptors open, " << before << " before";
+
+   // The certificate names localhost and 127.0.0.1, nothing else.
+   SslClientOptions options;
+   options.caFile = GetCertificates().Path("ca.pem");
+   options.serverName = "elsewhere.example";
+   Ref<SslContext> misnamed;
+   CreateSslClientContext(options, misnamed);
+   Completion accepted;
+   server->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { accepted.Done(error, 0); });
+   Ref<Stream> stream;
+   EXPECT_THROW(CreateSslConnection("127.0.0.1", port, 10000000, misnamed.Get(), stream), SslException);
+   ASSERT_TRUE(accepted.WaitCount(1));
+}
+
+TEST_F(SslStreamTest, AStalledHandshakeTimesOutOnBothSides) {
+   ServerSocketOptions options;
+   options.handshakeTimeoutMicroseconds = 30000;
+   Ref<ServerSocket> slow;
+   CreateSslServerSocket("127.0.0.1", 0, options, serverContext.Get(), slow);
+   Ref<BindingInfo> listening;
+   slow->GetBindingInfo(listening);
+   Completion accepted;
+   slow->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { accepted.Done(error, 0); });
+   // A plain TCP client that never speaks TLS.
+   Ref<Stream> silent;
+   CreateTcpConnection("127.0.0.1", listening->GetPort(), 5000000, silent);
+   ASSERT_TRUE(accepted.WaitCount(1));
+   EXPECT_TRUE(accepted.Failed());
+   EXPECT_EQ(0u, accepted.Error().rfind("SSL error: ", 0)) << accepted.Error();
+   slow->Close();
+
+   // A TLS client against a plain server that never answers gives up at its time-out.
+   Ref<ServerSocket> plain;
+   CreateTcpServerSocket("127.0.0.1", 0, ServerSocketOptions(), plain);
+   plain->GetBindingInfo(listening);
+   Ref<Stream> stream;
+   EXPECT_THROW(CreateSslConnection("127.0.0.1", listening->GetPort(), 30000,
+                                    ClientContext("ca.pem").Get(), stream),
+                TimeoutException);
+   plain->Close();
+}
+
+TEST_F(SslStreamTest, BadSettingsAreSslExceptions) {
+   const Certificates& certificates = GetCertificates();
+   Ref<SslContext> context;
+   SslServerOptions options;
+   options.certificateChainFile = certificates.Path("server.pem");
+   options.privateKeyFile = certificates.Path("other.key");  // not the certificate's key
+   EXPECT_THROW(CreateSslServerContext(options, context), SslException);
+   options.privateKeyFile = certificates.Path("server.key");
+   options.certificateChainFile = certificates.Path("missing.pem");
+   EXPECT_THROW(CreateSslServerContext(options, context), SslException);
+   options.certificateChainFile = certificates.Path("server.pem");
+   options.minVersion = "TLSv1.0";
+   EXPECT_THROW(CreateSslServerContext(options, context), SslException);
+   options.minVersion = "TLSv1.2";
+   options.cipherList = "NO-SUCH-CIPHER";
+   EXPECT_THROW(CreateSslServerContext(options, context), SslException);
+
+   SslClientOptions client;
+   client.caFile = certificates.Path("missing.pem");
+   EXPECT_THROW(CreateSslClientContext(client, context), SslException);
+   // A client context cannot serve, nor a server context connect.
+   Ref<ServerSocket> socket;
+   EXPECT_THROW(CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), ClientContext("ca.pem").Get(), socket),
+                InvalidArgumentException);
+   Ref<Stream> stream;
+   EXPECT_THROW(CreateSslConnection("127.0.0.1", port, 1000000, serverContext.Get(), stream),
+                InvalidArgumentException);
+}
+
+TEST_F(SslStreamTest, MinimumVersionIsEnforced) {
+   // A server that wants TLS 1.3 refuses a TLS 1.2 client, and takes a TLS 1.3 one.
+   const Certificates& certificates = GetCertificates();
+   SslServerOptions options;
+   options.certificateChainFile = certificates.Path("server.pem");
+   options.privateKeyFile = certificates.Path("server.key");
+   options.minVersion = "TLSv1.3";
+   Ref<SslContext> strict;
+   CreateSslServerContext(options, strict);
+   Ref<ServerSocket> strictServer;
+   CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), strict.Get(), strictServer);
+   Ref<BindingInfo> listening;
+   strictServer->GetBindingInfo(listening);
+   for (const char* version : {"-tls1_2", "-tls1_3"}) {
+      Completion accepted;
+      strictServer->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { accepted.Done(error, 0); });
+      std::string command = "openssl s_client -connect 127.0.0.1:" + std::to_string(listening->GetPort()) +
+                            " " + version + " </dev/null >/dev/null 2>&1";
+      int status = std::system(command.c_str());
+      ASSERT_TRUE(accepted.WaitCount(1));
+      if (std::string(version) == "-tls1_2") {
+         EXPECT_NE(0, status);
+         EXPECT_TRUE(accepted.Failed());
+      } else {
+         EXPECT_FALSE(accepted.Failed()) << accepted.Error();
+      }
+   }
+   strictServer->Close();
+}
+
+}  // namespace
+}  // namespace Pelmora::System
