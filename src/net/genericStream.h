@@ -11,10 +11,10 @@
 #include <string>
 #include <utility>
 
+#include <boost/asio/buffer.hpp>
 #include <boost/asio/dispatch.hpp>
 #include <boost/asio/io_context.hpp>
 #include <boost/asio/post.hpp>
-#include <boost/asio/write.hpp>
 
 #include "pelmora/system/workQueue.h"
 #include "src/net/streamBase.h"
@@ -74,12 +74,26 @@ protected:
                           });
    }
 
-   void WriteNow(const char* buffer, int length) {
+   // Writes the rest from `written` on. Each further piece starts from the completion of
+   // the previous one, under the stream's lock (or inside the strand), like every other
+   // use of the I/O object, so that a concurrent Close never races it.
+   void WriteNow(const char* buffer, int length, int written = 0) {
       Ref<GenericStream> self(this);
-      boost::asio::async_write(_io, boost::asio::buffer(buffer, static_cast<std::size_t>(length)),
-                               [self](const boost::system::error_code& error, std::size_t bytes) {
-                                  self->Finish(true, error, bytes);
-                               });
+      _io.async_write_some(
+          boost::asio::buffer(buffer + written, static_cast<std::size_t>(length - written)),
+          [self, buffer, length, written](const boost::system::error_code& error, std::size_t bytes) {
+             int total = written + static_cast<int>(bytes);
+             if (!error && total < length) {
+                if constexpr (kSerialized) {
+                   self->WriteNow(buffer, length, total);
+                } else {
+                   Synchronized lock(self.Get());
+                   self->WriteNow(buffer, length, total);
+                }
+                return;
+             }
+             self->Finish(true, error, static_cast<std::size_t>(total));
+          });
    }
 
    void CloseNow() {

@@ -25,6 +25,7 @@ public:
 protected:
    void MakeStream(typename Protocol::socket&& socket,
                    const std::function<void(Exception*, Stream*)>& done) override {
+      if constexpr (std::is_same_v<Protocol, Tcp>) SetNoDelay(socket);
       Ref<BindingInfo> local = MakeBindingInfo(socket.local_endpoint());
       boost::system::error_code error;
       auto remote = socket.remote_endpoint(error);
@@ -53,6 +54,7 @@ void RemoveStaleSocket(const std::string& path) {
 template <class Socket>
 void FinishConnection(Socket&& socket, const char* kind, Ref<Stream>& out) {
    SetCloseOnExec(socket.native_handle());
+   if constexpr (std::is_same_v<Socket, Tcp::socket>) SetNoDelay(socket);
    boost::system::error_code error;
    Ref<BindingInfo> local = MakeBindingInfo(socket.local_endpoint(error));
    auto remote = socket.remote_endpoint(error);
@@ -64,6 +66,11 @@ void FinishConnection(Socket&& socket, const char* kind, Ref<Stream>& out) {
 }
 
 }  // namespace
+
+void SetNoDelay(Tcp::socket& socket) {
+   boost::system::error_code ignored;
+   socket.set_option(Tcp::no_delay(true), ignored);
+}
 
 Ref<BindingInfo> MakeBindingInfo(const Tcp::endpoint& endpoint) {
    boost::asio::ip::address address = endpoint.address();

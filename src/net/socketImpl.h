@@ -22,6 +22,8 @@ Ref<BindingInfo> MakeBindingInfo(const boost::asio::ip::tcp::endpoint& endpoint)
 Ref<BindingInfo> MakeBindingInfo(const boost::asio::local::stream_protocol::endpoint& endpoint);
 // "tcp 127.0.0.1:80 <- 127.0.0.1:5000" and the like.
 std::string DescribeStream(const char* kind, BindingInfo* local, BindingInfo* peer);
+// Request-response traffic goes out at once instead of waiting to fill a segment.
+void SetNoDelay(boost::asio::ip::tcp::socket& socket);
 // Sets FD_CLOEXEC; SystemException when the system refuses.
 void SetCloseOnExec(int fd);
 

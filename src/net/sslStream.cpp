@@ -110,6 +110,7 @@ protected:
    }
 
    void MakeStream(Tcp::socket&& socket, const std::function<void(Exception*, Stream*)>& done) override {
+      SetNoDelay(socket);
       struct Handshake {
          Handshake(Tcp::socket&& tcp, boost::asio::ssl::context& context)
              : stream(std::move(tcp), context), timer(stream.get_executor()) {}
@@ -206,6 +207,7 @@ void CreateSslConnection(const std::string& host, int port, long long timeoutMic
    auto deadline = DeadlineAfter(timeoutMicroseconds);
    Tcp::socket tcp(boost::asio::make_strand(GetPoolIoContext()));
    ConnectTcpSocket(host, port, deadline, tcp);
+   SetNoDelay(tcp);
    SslSocket ssl(std::move(tcp), impl->Get());
    const std::string& name = impl->clientOptions.serverName.empty() ? host : impl->clientOptions.serverName;
    SSL_set_tlsext_host_name(ssl.native_handle(), name.c_str());

@@ -3,6 +3,8 @@
 #include "src/net/socketImpl.h"
 
 #include <fcntl.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
@@ -20,6 +22,12 @@ namespace {
 using NetTesting::Completion;
 
 bool CloseOnExec(int fd) { return (::fcntl(fd, F_GETFD) & FD_CLOEXEC) != 0; }
+
+bool NoDelay(int fd) {
+   int value = 0;
+   socklen_t size = sizeof value;
+   return ::getsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &value, &size) == 0 && value != 0;
+}
 
 int NativeOf(Stream* stream) {
    if (auto* tcp = dynamic_cast<GenericStream<boost::asio::ip::tcp::socket>*>(stream))
@@ -153,7 +161,7 @@ TEST_F(SocketTest, UnixDomainEchoAndStaleSocketFile) {
    ::unlink(path.c_str());
 }
 
-TEST_F(SocketTest, SocketsAreCloseOnExecAndAddressesReusable) {
+TEST_F(SocketTest, SocketsAreCloseOnExecWithoutDelayAndAddressesReusable) {
    Ref<ServerSocket> server;
    CreateTcpServerSocket("127.0.0.1", 0, ServerSocketOptions(), server);
    auto* impl = dynamic_cast<ServerSocketImpl<boost::asio::ip::tcp>*>(server.Get());
@@ -171,6 +179,8 @@ TEST_F(SocketTest, SocketsAreCloseOnExecAndAddressesReusable) {
    ASSERT_TRUE(serverSide);
    EXPECT_TRUE(CloseOnExec(NativeOf(client.Get())));
    EXPECT_TRUE(CloseOnExec(NativeOf(serverSide.Get())));
+   EXPECT_TRUE(NoDelay(NativeOf(client.Get())));
+   EXPECT_TRUE(NoDelay(NativeOf(serverSide.Get())));
 
    // The server side closes first, leaving its end in TIME_WAIT; SO_REUSEADDR lets a
    // new server bind the same port at once.
