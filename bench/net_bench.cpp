@@ -6,6 +6,8 @@
 
 #include <unistd.h>
 
+#include <utility>  // before asio: its coroutine header needs std::exchange
+
 #include <boost/asio.hpp>
 #include <boost/asio/ssl.hpp>
 
@@ -310,6 +312,7 @@ void BM_AsioBulk(benchmark::State& state) {
    asio::io_context io;
    Tcp::socket client(io);
    client.connect(Tcp::endpoint(asio::ip::make_address("127.0.0.1"), static_cast<unsigned short>(server.port)));
+   client.set_option(Tcp::no_delay(true));
    PeerBulkLoop(state, client);
 }
 BENCHMARK(BM_AsioBulk)->UseRealTime()->MinTime(1.0);
@@ -326,6 +329,7 @@ void BM_AsioTlsBulk(benchmark::State& state) {
    asio::ssl::stream<Tcp::socket> client(io, context);
    client.lowest_layer().connect(
        Tcp::endpoint(asio::ip::make_address("127.0.0.1"), static_cast<unsigned short>(server.port)));
+   client.lowest_layer().set_option(Tcp::no_delay(true));
    client.handshake(asio::ssl::stream_base::client);
    PeerBulkLoop(state, client);
 }

@@ -2,6 +2,7 @@
 
 #include "src/net/streamBase.h"
 
+#include <algorithm>
 #include <chrono>
 #include <mutex>
 #include <set>
@@ -113,8 +114,18 @@ void StreamBase::AsyncRead(char* buffer, int length,
 }
 
 int StreamBase::Write(const char* buffer, int length) {
-   AsyncWrite(buffer, length, Functor<void, Stream*, Exception*>());
-   return WaitWrite();
+   // Most writes fit the socket's buffer: done on this thread, without a completion to
+   // hand over. The rest goes the asynchronous way.
+   int written = 0;
+   {
+      Synchronized lock(this);
+      if (_write.state == STATE_IDLE && !_write.waiter) {
+         written = std::max(0, TryWriteNow(buffer, length));
+         if (written == length) return length;
+      }
+   }
+   AsyncWrite(buffer + written, length - written, Functor<void, Stream*, Exception*>());
+   return written + WaitWrite();
 }
 
 int StreamBase::Read(char* buffer, int length) {

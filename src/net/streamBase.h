@@ -81,6 +81,13 @@ protected:
    // Start the transport's operation; never complete inline. Called with the lock held.
    virtual void StartRead(char* buffer, int length) = 0;
    virtual void StartWrite(const char* buffer, int length) = 0;
+   // Writes what the transport takes at once without blocking; -1 where it cannot try
+   // (the asynchronous path then does all). Called with the lock held, direction idle.
+   virtual int TryWriteNow(const char* buffer, int length) {
+      (void)buffer;
+      (void)length;
+      return -1;
+   }
    // Closes the transport so that outstanding operations finish. Called with the lock held.
    virtual void CloseIo() = 0;
    // The transport finished an operation of that direction (`error` null on success).

@@ -280,15 +280,18 @@ TEST(StreamBaseTest, TickerClosesOnThePoolAndForgetsReleasedStreams) {
    NetTesting::EnsurePool();
    DefaultLogCapture log;
    long long saved = GetStreamTimeoutTick();
-   SetStreamTimeoutTick(10000);
    TimeoutTicker& ticker = TimeoutTicker::GetInstance();
    int before = ticker.GetStreamCount();
    {
+      // Armed at the production tick first: shortening the tick must restart the timer.
       Ref<ManualStream> stream = new ManualStream();
       stream->SetReadTimeout(0, Service::Logger::LOG_WARNING, "ticker");
       EXPECT_EQ(before + 1, ticker.GetStreamCount());
+      SetStreamTimeoutTick(10000);
+      stream->SetReadTimeout(0, Service::Logger::LOG_WARNING, "ticker");
       stream->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
-      EXPECT_TRUE(WaitFor([&] { return stream->closes.load() == 1; }, "the ticker's close"));
+      EXPECT_TRUE(WaitFor([&] { return stream->closes.load() == 1; }, "the ticker's close",
+                          std::chrono::milliseconds(2000)));
       EXPECT_TRUE(log.Contains("ticker : Read timeout after approximately 10ms. Closing stream manual stream"))
           << log.Text();
    }
