@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cstdio>
 #include <cstring>
+#include <thread>
 #include <utility>
 
 #include "pelmora/exception/exceptions.h"
@@ -119,6 +120,19 @@ void MemLogWriterImpl::WriteLocked(Logger::CombinedLevel level, const char* data
 
 std::string MemLogWriterImpl::GetText() {
    std::lock_guard<std::mutex> lock(_mutex);
+   return GetTextLocked();
+}
+
+std::string MemLogWriterImpl::GetTextForReport(std::chrono::steady_clock::time_point deadline) {
+   std::unique_lock<std::mutex> lock(_mutex, std::try_to_lock);
+   while (!lock.owns_lock() && std::chrono::steady_clock::now() < deadline) {
+      std::this_thread::yield();
+      lock.try_lock();
+   }
+   return GetTextLocked();
+}
+
+std::string MemLogWriterImpl::GetTextLocked() {
    auto* ring = dynamic_cast<RingStringWriter*>(GetTarget());
    std::string text = ring->GetText();
    // A full ring has overwritten the start of its oldest line: leave that line out.
@@ -173,6 +187,14 @@ void LogOutputLock::ReadLock() {
       return;
    }
    pthread_rwlock_rdlock(&_lock);
+}
+
+bool LogOutputLock::TryReadLock() {
+   if (IsWriteLockedByMe()) {
+      ++_depth;
+      return true;
+   }
+   return pthread_rwlock_tryrdlock(&_lock) == 0;
 }
 
 void LogOutputLock::ReadUnlock() {
@@ -258,6 +280,17 @@ RefVector<LogWriter> LogOutputImpl::Snapshot() {
    for (auto& [name, writer] : _writers) writers.push_back(writer);
    _lock.ReadUnlock();
    return writers;
+}
+
+bool LogOutputImpl::TrySnapshot(std::chrono::steady_clock::time_point deadline,
+                                RefVector<LogWriter>& out) {
+   while (!_lock.TryReadLock()) {
+      if (std::chrono::steady_clock::now() >= deadline) return false;
+      std::this_thread::yield();
+   }
+   for (auto& [name, writer] : _writers) out.push_back(writer);
+   _lock.ReadUnlock();
+   return true;
 }
 
 void LogOutputImpl::Flush() {

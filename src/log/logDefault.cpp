@@ -3,6 +3,8 @@
 
 #include "src/internal/subsystemLog.h"
 
+#include <chrono>
+
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/logMacros.h"
 #include "pelmora/service/logWriters.h"
@@ -17,6 +19,9 @@ namespace {
 constexpr int kDefaultMemoryLogSizeK = 256;
 constexpr const char* kDefaultSubsystem = "default";
 
+// How long a dying process waits for a log lock before it reads the ring without it.
+constexpr std::chrono::milliseconds kReportLockWait{100};
+
 std::string CollectRing(LogOutput* memory) {
    std::string text;
    auto* impl = dynamic_cast<LogOutputImpl*>(memory);
@@ -27,18 +32,44 @@ std::string CollectRing(LogOutput* memory) {
    return text;
 }
 
+// As CollectRing in a dying process, with no lock waited for past a short bound: the
+// thread holding one may be gone (the report child has only the panicking thread). When
+// the memory output stays locked, `fallback`, the ring taken from the default output,
+// is read alone.
+std::string CollectRingForReport(LogOutput* memory, LogWriter* fallback) {
+   std::string text;
+   auto deadline = std::chrono::steady_clock::now() + kReportLockWait;
+   RefVector<LogWriter> writers;
+   auto* impl = dynamic_cast<LogOutputImpl*>(memory);
+   if (!impl || !impl->TrySnapshot(deadline, writers)) {
+      writers.clear();
+      if (fallback) writers.push_back(fallback);
+   }
+   for (Ref<LogWriter>& writer : writers) {
+      if (auto* ring = dynamic_cast<MemLogWriterImpl*>(writer.Get())) {
+         text += ring->GetTextForReport(deadline);
+      }
+   }
+   return text;
+}
+
 // The ring goes out as one block at the output half of `level` only, so that the memory
 // writers do not take their own lines in again.
-void WriteRing(LogOutput* memory, LogOutput* destination, Logger::LogLevel level,
-               const std::string& message) {
-   if (!memory || !destination) return;
+void WriteRing(LogOutput* destination, Logger::LogLevel level, const std::string& message,
+               const std::string& text) {
+   if (!destination) return;
    std::string block = "----- Recent log lines (" + message + ") -----\n";
-   std::string text = CollectRing(memory);
    block += text;
    if (!text.empty() && text.back() != '\n') block += '\n';
    block += "----- End of recent log lines -----\n";
    destination->WriteMessage(static_cast<Logger::CombinedLevel>(level), block.data(),
                              static_cast<int>(block.size()));
+}
+
+void WriteRing(LogOutput* memory, LogOutput* destination, Logger::LogLevel level,
+               const std::string& message) {
+   if (!memory || !destination) return;
+   WriteRing(destination, level, message, CollectRing(memory));
 }
 
 class LoggingReportSink : public Internal::ReportSink {
@@ -64,20 +95,20 @@ public:
       // The process is dying: the ring stops taking lines while it is written out.
       LogManager* manager = logger->GetLogManager();
       Ref<LogOutput> memory;
+      Ref<LogWriter> ring;
       // The panic may have come from inside the manager, with its lock held.
       bool locked = !manager->IsLocked();
       if (locked) manager->Lock();
       try {
          manager->RemoveLogOutput(LogManager::kMemoryOutput, memory);
-         if (memory) {
-            Ref<LogWriter> writer;
-            logger->GetLogOutput()->RemoveWriter(LogManager::kMemoryOutput, writer);
-         }
+         if (memory) logger->GetLogOutput()->RemoveWriter(LogManager::kMemoryOutput, ring);
       } catch (...) {
       }
       if (locked) manager->Unlock();
+      if (!memory) return;
       try {
-         WriteRing(memory.Get(), logger->GetLogOutput(), logLevel, message);
+         WriteRing(logger->GetLogOutput(), logLevel, message,
+                   CollectRingForReport(memory.Get(), ring.Get()));
       } catch (...) {
       }
    }

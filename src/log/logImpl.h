@@ -5,6 +5,7 @@
 #include <sys/types.h>
 
 #include <atomic>
+#include <chrono>
 #include <map>
 #include <mutex>
 #include <set>
@@ -62,9 +63,15 @@ public:
    MemLogWriterImpl(int sizeBytes, Logger::CombinedLevel mask);
    // The whole lines the ring holds, oldest first.
    std::string GetText();
+   // As GetText for a dying process: waits for the lock until `deadline`, then reads
+   // without it (in a report child, the thread that held it no longer runs).
+   std::string GetTextForReport(std::chrono::steady_clock::time_point deadline);
 
 protected:
    void WriteLocked(Logger::CombinedLevel level, const char* data, int length) override;
+
+private:
+   std::string GetTextLocked();
 };
 
 // The per-thread recursive write lock over a system reader/writer lock (readers may
@@ -75,6 +82,8 @@ public:
    LogOutputLock();
    ~LogOutputLock();
    void ReadLock();
+   // False when a writer holds the lock (or a writer's hold cannot be told from one).
+   bool TryReadLock();
    void WriteLock();
    void ReadUnlock();
    void WriteUnlock();
@@ -118,6 +127,8 @@ public:
 
    // The writers at this moment, copied under the read lock.
    RefVector<LogWriter> Snapshot();
+   // As Snapshot, trying for the read lock until `deadline`; false if it never came.
+   bool TrySnapshot(std::chrono::steady_clock::time_point deadline, RefVector<LogWriter>& out);
 
 private:
    const std::string _name;

@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <chrono>
 #include <fstream>
 #include <regex>
 #include <string>
@@ -15,6 +16,7 @@
 #include "pelmora/io/writers.h"
 #include "pelmora/object/ref.h"
 #include "pelmora/service.h"
+#include "src/internal/report.h"
 #include "tests/support/watchdog.h"
 #include "tests/support/logLines.h"
 
@@ -36,4 +38,32 @@ TEST(LogMemoryDeathTest, PanicAndExceptionDumpReportTheRecentLines) {
           abort();
        },
        "error 'default'\\] \n\nException: Invalid state\nType: .*Recent log lines.*before the dump");
+}
+
+// A thread that holds the memory output's lock when the process panics stays stopped in
+// the report child for good; the report must still carry the ring's lines, and in good
+// time (the report time-out here is far above the bounded wait for a lock).
+TEST(LogMemoryDeathTest, PanicReportHasTheRecentLinesWhileAnotherThreadHoldsALogLock) {
+   auto panicWithTheMemoryOutputHeld = [] {
+      SetPanicMayFork(true);
+      Internal::SetPanicReportTimeout(std::chrono::seconds(20));
+      PELMORA_LOG_VERBOSE(GetDefaultLogger(), "recent line %1", 7);
+      Ref<LogOutput> memory;
+      GetDefaultLogManager()->FindLogOutput(LogManager::kMemoryOutput, memory);
+      std::atomic<bool> held{false};
+      std::thread([&] {
+         memory->RecursiveWriteLock();
+         held.store(true);
+         for (;;) pause();
+      }).detach();
+      auto end = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+      while (!held.load() && std::chrono::steady_clock::now() < end) std::this_thread::yield();
+      PELMORA_VERIFY(1 + 1 == 3);
+   };
+   auto start = std::chrono::steady_clock::now();
+   EXPECT_DEATH(panicWithTheMemoryOutputHeld(),
+                "Panic: Assert Failed: \"1 \\+ 1 == 3\".*"
+                "----- Recent log lines \\(Assert Failed: .*recent line 7\n.*"
+                "----- End of recent log lines -----");
+   EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(15));
 }
