@@ -160,17 +160,6 @@ void CreateMemLogWriter(const std::string&, int sizeK, const std::string& level,
 
 // ---- the output lock
 
-LogOutputLock::LogOutputLock() {
-   // Readers first: a reader may re-enter while a writer waits.
-   pthread_rwlockattr_t attr;
-   pthread_rwlockattr_init(&attr);
-   pthread_rwlockattr_setkind_np(&attr, PTHREAD_RWLOCK_PREFER_READER_NP);
-   pthread_rwlock_init(&_lock, &attr);
-   pthread_rwlockattr_destroy(&attr);
-}
-
-LogOutputLock::~LogOutputLock() { pthread_rwlock_destroy(&_lock); }
-
 const void* LogOutputLock::Self() {
    // The address of a thread-local object names the thread without a system call.
    static thread_local char marker;
@@ -181,12 +170,30 @@ bool LogOutputLock::IsWriteLockedByMe() const {
    return _owner.load(std::memory_order_relaxed) == Self();
 }
 
+uint32_t LogOutputLock::Await(uint32_t seen) {
+   if (!(seen & kWaiting) &&
+       !_state.compare_exchange_strong(seen, seen | kWaiting, std::memory_order_relaxed)) {
+      return seen;  // changed meanwhile: look again
+   }
+   seen |= kWaiting;
+   _state.wait(seen, std::memory_order_relaxed);
+   return _state.load(std::memory_order_relaxed);
+}
+
 void LogOutputLock::ReadLock() {
    if (IsWriteLockedByMe()) {
       ++_depth;
       return;
    }
-   pthread_rwlock_rdlock(&_lock);
+   uint32_t state = _state.load(std::memory_order_relaxed);
+   for (;;) {
+      if (state & kWriter) {
+         state = Await(state);
+      } else if (_state.compare_exchange_weak(state, state + 1, std::memory_order_acquire,
+                                              std::memory_order_relaxed)) {
+         return;
+      }
+   }
 }
 
 bool LogOutputLock::TryReadLock() {
@@ -194,7 +201,14 @@ bool LogOutputLock::TryReadLock() {
       ++_depth;
       return true;
    }
-   return pthread_rwlock_tryrdlock(&_lock) == 0;
+   uint32_t state = _state.load(std::memory_order_relaxed);
+   while (!(state & kWriter)) {
+      if (_state.compare_exchange_weak(state, state + 1, std::memory_order_acquire,
+                                       std::memory_order_relaxed)) {
+         return true;
+      }
+   }
+   return false;
 }
 
 void LogOutputLock::ReadUnlock() {
@@ -203,7 +217,13 @@ void LogOutputLock::ReadUnlock() {
       --_depth;
       return;
    }
-   pthread_rwlock_unlock(&_lock);
+   uint32_t before = _state.fetch_sub(1, std::memory_order_release);
+   if ((before & kReaders) == 1 && (before & kWaiting)) {
+      // The last reader out wakes the writers waiting; a waiter that still cannot go in
+      // marks itself again.
+      _state.fetch_and(~kWaiting, std::memory_order_relaxed);
+      _state.notify_all();
+   }
 }
 
 void LogOutputLock::WriteLock() {
@@ -212,7 +232,12 @@ void LogOutputLock::WriteLock() {
       ++_depth;
       return;
    }
-   pthread_rwlock_wrlock(&_lock);
+   uint32_t state = 0;
+   // A waiting mark alone does not keep a writer out; it stays for the others.
+   while (!_state.compare_exchange_weak(state, kWriter | (state & kWaiting),
+                                        std::memory_order_acquire, std::memory_order_relaxed)) {
+      if (state & ~kWaiting) state = Await(state) & kWaiting;
+   }
    _owner.store(self, std::memory_order_relaxed);
    _depth = 1;
 }
@@ -221,7 +246,7 @@ void LogOutputLock::WriteUnlock() {
    PELMORA_VERIFY(IsWriteLockedByMe());
    if (--_depth > 0) return;
    _owner.store(nullptr, std::memory_order_relaxed);
-   pthread_rwlock_unlock(&_lock);
+   if (_state.exchange(0, std::memory_order_release) & kWaiting) _state.notify_all();
 }
 
 // ---- outputs

@@ -1,10 +1,10 @@
 #pragma once
 // The logging implementation classes shared by the logging units.
 
-#include <pthread.h>
 #include <sys/types.h>
 
 #include <atomic>
+#include <cstdint>
 #include <chrono>
 #include <map>
 #include <mutex>
@@ -74,15 +74,14 @@ private:
    std::string GetTextLocked();
 };
 
-// The per-thread recursive write lock over a system reader/writer lock (readers may
-// re-enter while no writer holds it). A thread that holds the read lock must not ask for
-// the write lock.
+// The per-thread recursive write lock, with readers (who may re-enter while a writer
+// waits) sharing it. A thread that holds the read lock must not ask for the write lock.
+// One word and the futex behind std::atomic::wait: taking and giving back an uncontended
+// hold is one atomic operation each, which matters on every log line.
 class LogOutputLock {
 public:
-   LogOutputLock();
-   ~LogOutputLock();
    void ReadLock();
-   // False when a writer holds the lock (or a writer's hold cannot be told from one).
+   // False when a writer holds the lock.
    bool TryReadLock();
    void WriteLock();
    void ReadUnlock();
@@ -90,8 +89,16 @@ public:
    bool IsWriteLockedByMe() const;
 
 private:
+   static constexpr uint32_t kWriter = 1u << 31;
+   static constexpr uint32_t kWaiting = 1u << 30;  // someone sleeps on _state
+   static constexpr uint32_t kReaders = kWaiting - 1;
+
    static const void* Self();
-   pthread_rwlock_t _lock;
+   // Sleeps until _state differs from `seen`, after marking that someone waits; returns
+   // the state found then.
+   uint32_t Await(uint32_t seen);
+
+   std::atomic<uint32_t> _state{0};
    std::atomic<const void*> _owner{nullptr};
    int _depth = 0;  // of the owner's write (and nested read) holds
 };

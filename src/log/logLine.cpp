@@ -107,7 +107,7 @@ public:
                self->_output->WriteUnlock();
             }
             self->_chunkPos = 0;
-            self->_output.Reset();
+            self->_output = nullptr;
          }
       } release{this};
       if (g_fastPath.load(std::memory_order_relaxed) && !_locked) {
@@ -117,7 +117,7 @@ public:
       }
    }
 
-   bool IsActive() const { return static_cast<bool>(_output); }
+   bool IsActive() const { return _output != nullptr; }
 
 private:
    void WriteLogPrefix(const std::string& subsystem,
@@ -165,6 +165,10 @@ private:
          tail.Append(_threadText);
          tail.Append(" ");
          _tail = tail;
+         BoundedText stampedTail = stamp;
+         stampedTail.Append("000");
+         stampedTail.Append(tail.data, static_cast<size_t>(tail.size));
+         _stampedTail = stampedTail;
       }
       // "%sT%s%s [%p %s '" with the date, time, bias, thread and level texts, bounded to
       // kPrefixLimit bytes with its terminator as a bounded printf would; assembled from
@@ -173,23 +177,32 @@ private:
       char millisText[3] = {static_cast<char>('0' + millis / 100),
                             static_cast<char>('0' + millis / 10 % 10),
                             static_cast<char>('0' + millis % 10)};
-      BoundedText head = _stamp;
-      head.Append(millisText, sizeof(millisText));
-      head.Append(_tail.data, static_cast<size_t>(_tail.size));
-      head.Append(GetCombinedLevelName(_level));
-      head.Append(" '", 2);
-      if (context.empty() &&
-          static_cast<int>(subsystem.size()) + head.size + 3 <= kChunkSize - _chunkPos) {
-         // The usual prefix: straight into the empty chunk.
+      const char* levelName = GetCombinedLevelName(_level);
+      size_t levelSize = strlen(levelName);
+      int usualSize = _stampedTail.size + static_cast<int>(levelSize) + 2;
+      if (context.empty() && usualSize < kPrefixLimit &&
+          static_cast<int>(subsystem.size()) + usualSize + 3 <= kChunkSize - _chunkPos) {
+         // The usual prefix, nothing cut: straight into the chunk, with the milliseconds
+         // set into the cached text of this second.
          char* out = _chunk + _chunkPos;
-         CopyBytes(out, head.data, static_cast<size_t>(head.size));
-         out += head.size;
+         CopyBytes(out, _stampedTail.data, static_cast<size_t>(_stampedTail.size));
+         memcpy(out + _stamp.size, millisText, sizeof(millisText));
+         out += _stampedTail.size;
+         CopyBytes(out, levelName, levelSize);
+         out += levelSize;
+         memcpy(out, " '", 2);
+         out += 2;
          CopyBytes(out, subsystem.data(), subsystem.size());
          out += subsystem.size();
          memcpy(out, "'] ", 3);
-         _chunkPos += head.size + static_cast<int>(subsystem.size()) + 3;
+         _chunkPos = static_cast<int>(out + 3 - _chunk);
          return;
       }
+      BoundedText head = _stamp;
+      head.Append(millisText, sizeof(millisText));
+      head.Append(_tail.data, static_cast<size_t>(_tail.size));
+      head.Append(levelName, levelSize);
+      head.Append(" '", 2);
       Write(head.data, head.size);
       Write(subsystem.data(), static_cast<int>(subsystem.size()));
       Write("'", 1);
@@ -205,7 +218,9 @@ private:
    const void* const _threadId;
    char _chunk[kChunkSize];
    int _chunkPos = 0;
-   Ref<LogOutput> _output;
+   // Kept alive by the logger that began the line; a counted reference here would cost
+   // two atomic operations a line.
+   LogOutput* _output = nullptr;
    bool _locked = false;
    Logger::CombinedLevel _level = 0;
    // Caches: the date text for its day, the bias text for its bias, the clock fields
@@ -220,6 +235,8 @@ private:
    // level name ("bias [thread "), as of _second.
    BoundedText _stamp;
    BoundedText _tail;
+   // Both with room for the milliseconds between them.
+   BoundedText _stampedTail;
    char _threadText[24];
 };
 

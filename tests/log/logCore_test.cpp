@@ -168,6 +168,46 @@ TEST(LogOutputTest, WriteLockIsRecursivePerThreadAndExcludesOtherThreads) {
    EXPECT_EQ(t.Lines().size(), 2u);
 }
 
+// Writers exclude everyone, readers only writers; every hand-over wakes whoever waits
+// (a lost wake-up hangs the joins), and a count kept under the write lock loses nothing.
+TEST(LogOutputTest, ReadAndWriteHoldsExcludeAsTheyShouldUnderContention) {
+   TestLogger t;
+   LogOutput* output = t.logger->GetLogOutput();
+   constexpr int kRounds = 20000;
+   std::atomic<int> writersIn{0}, readersIn{0}, faults{0};
+   long long guarded = 0;  // written under the write lock only
+   std::vector<std::thread> threads;
+   for (int w = 0; w < 2; ++w) {
+      threads.emplace_back([&] {
+         for (int i = 0; i < kRounds; ++i) {
+            output->RecursiveWriteLock();
+            if (writersIn.fetch_add(1) != 0 || readersIn.load() != 0) faults.fetch_add(1);
+            ++guarded;
+            if (i % 16 == 0) std::this_thread::yield();  // holds that overlap, if they can
+            writersIn.fetch_sub(1);
+            output->WriteUnlock();
+         }
+      });
+   }
+   for (int r = 0; r < 2; ++r) {
+      threads.emplace_back([&] {
+         long long seen = 0;
+         for (int i = 0; i < kRounds; ++i) {
+            output->RecursiveReadLock();
+            readersIn.fetch_add(1);
+            if (writersIn.load() != 0 || guarded < seen) faults.fetch_add(1);
+            seen = guarded;
+            if (i % 16 == 0) std::this_thread::yield();
+            readersIn.fetch_sub(1);
+            output->ReadUnlock();
+         }
+      });
+   }
+   Pelmora::Testing::JoinAll(threads, "readers and writers of one output");
+   EXPECT_EQ(0, faults.load());
+   EXPECT_EQ(2LL * kRounds, guarded);
+}
+
 TEST(LogMemoryTest, RingKeepsWholeRecentLinesAtMemoryLevelsAndIsWrittenOutOnRequest) {
    TestLogger t("warning");
    t.logger->SetMemLevelByName("verbose");
