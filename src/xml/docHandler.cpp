@@ -153,7 +153,7 @@ private:
 
    // The nodes that remain keep the arena alive; the handler only stops allocating from it.
    void ReleaseArena() {
-      if (_arena) std::exchange(_arena, nullptr)->Release();
+      if (_arena) std::exchange(_arena, nullptr)->ReleaseCreator();
    }
 
    // Open nodes, the document at the bottom. A vector keeps its capacity between documents.

@@ -4,6 +4,7 @@
 
 #include <expat.h>
 
+#include <algorithm>
 #include <climits>
 #include <cstddef>
 
@@ -18,6 +19,8 @@ namespace {
 
 // Bytes read from the reader and handed to expat at a time.
 constexpr int kBlockSize = 10240;
+// Bytes of a text parse handed to expat at a time, so that one call stays bounded.
+constexpr size_t kTextSliceSize = 64 * 1024;
 
 class XMLParserImpl final : public virtual XMLParser, public ObjectImpl {
 public:
@@ -40,12 +43,7 @@ public:
 
    void Parse(Reader* reader, bool restricted, Ref<Object>& result) override;
 
-   void Parse(const std::string& text, bool restricted, Ref<Object>& result) override {
-      if (text.size() > static_cast<size_t>(INT_MAX)) throw InvalidArgumentException("text");
-      Ref<StringReader> reader;
-      CreateStringReader(text.data(), static_cast<int>(text.size()), reader);
-      Parse(reader.Get(), restricted, result);
-   }
+   void Parse(const std::string& text, bool restricted, Ref<Object>& result) override;
 
    void Parse(Reader* reader, Ref<Object>& result) override { Parse(reader, false, result); }
 
@@ -72,6 +70,13 @@ private:
 
    void InstallCallbacks();
    [[noreturn]] void ThrowParseError();
+   // One document: `input` hands expat the whole input through Feed.
+   template <class Input>
+   void ParseDocument(bool restricted, Ref<Object>& result, Input input);
+   // Hands expat one piece; `last` ends the document.
+   void Feed(const char* data, int length, bool last) {
+      if (XML_Parse(_parser, data, length, last) != XML_STATUS_OK) ThrowParseError();
+   }
 
    // Calls the handler; any failure stops expat, so that the pending XML_Parse fails.
    // Events expat still delivers after the stop are dropped.
@@ -165,8 +170,8 @@ void XMLParserImpl::ThrowParseError() {
                            static_cast<int>(XML_GetCurrentLineNumber(_parser)));
 }
 
-void XMLParserImpl::Parse(Reader* reader, bool restricted, Ref<Object>& result) {
-   PELMORA_VERIFY(reader != NULL);
+template <class Input>
+void XMLParserImpl::ParseDocument(bool restricted, Ref<Object>& result, Input input) {
    // The reset clears the callbacks too.
    XML_ParserReset(_parser, nullptr);
    InstallCallbacks();
@@ -178,16 +183,34 @@ void XMLParserImpl::Parse(Reader* reader, bool restricted, Ref<Object>& result) 
    CleanUpGuard cleanUp(handler.Get());
    Ref<Object> document;
    handler->StartNewDocument(restricted, document);
-
-   char buffer[kBlockSize];
-   for (;;) {
-      int length = reader->Read(buffer, kBlockSize);
-      bool last = length < 0;
-      if (last) length = 0;
-      if (XML_Parse(_parser, buffer, length, last) != XML_STATUS_OK) ThrowParseError();
-      if (last) break;
-   }
+   input();
    result = document;
+}
+
+void XMLParserImpl::Parse(Reader* reader, bool restricted, Ref<Object>& result) {
+   PELMORA_VERIFY(reader != NULL);
+   ParseDocument(restricted, result, [&] {
+      char buffer[kBlockSize];
+      for (;;) {
+         int length = reader->Read(buffer, kBlockSize);
+         bool last = length < 0;
+         Feed(buffer, last ? 0 : length, last);
+         if (last) break;
+      }
+   });
+}
+
+void XMLParserImpl::Parse(const std::string& text, bool restricted, Ref<Object>& result) {
+   if (text.size() > static_cast<size_t>(INT_MAX)) throw InvalidArgumentException("text");
+   // Straight from the text: no reader to make and no copy into a block buffer.
+   ParseDocument(restricted, result, [&] {
+      size_t offset = 0;
+      do {
+         size_t length = std::min(text.size() - offset, kTextSliceSize);
+         Feed(text.data() + offset, static_cast<int>(length), offset + length == text.size());
+         offset += length;
+      } while (offset < text.size());
+   });
 }
 
 }  // namespace

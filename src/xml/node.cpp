@@ -73,17 +73,17 @@ NodeImpl::~NodeImpl() {
          child = next;
       }
       node->_firstChild = node->_lastChild = nullptr;
-      if (node != this) node->DecRef();
+      if (node != this) node->ObjectImpl::DecRef();
 
       node = nullptr;
       while (!orphans.empty() && !node) {
          NodeImpl* orphan = orphans.back();
          orphans.pop_back();
          // Still referenced elsewhere: it keeps its subtree and merely loses its parent.
-         if (orphan->GetRefCount() == 1 && orphan->_firstChild) {
+         if (orphan->ObjectImpl::GetRefCount() == 1 && orphan->_firstChild) {
             node = orphan;
          } else {
-            orphan->DecRef();
+            orphan->ObjectImpl::DecRef();
          }
       }
       if (!node) return;
@@ -138,7 +138,7 @@ void NodeImpl::VerifyInsert(Node* node, Node* pos, bool hasPos) {
 
 void NodeImpl::Insert(NodeImpl* child, NodeImpl* before) {
    child->VerifyFree();
-   child->IncRef();
+   child->ObjectImpl::IncRef();
    child->_parent = this;
    child->_nextSibling = before;
    child->_prevSibling = before ? before->_prevSibling : _lastChild;

@@ -45,12 +45,16 @@ void* NodeArena::Allocate(size_t size) {
    }
    void* memory = _cursor;
    _cursor += size;
-   _references.fetch_add(1, std::memory_order_relaxed);
+   ++_allocated;
    return memory;
 }
 
-void NodeArena::Release() {
-   if (_references.fetch_sub(1, std::memory_order_acq_rel) == 1) delete this;
+void NodeArena::Release() { Drop(1); }
+
+void NodeArena::ReleaseCreator() { Drop(kCreatorBias - _allocated); }
+
+void NodeArena::Drop(size_t references) {
+   if (_references.fetch_sub(references, std::memory_order_acq_rel) == references) delete this;
 }
 
 void* NodeImpl::operator new(size_t size) {

@@ -13,20 +13,29 @@ namespace Pelmora::Xml {
 
 class NodeArena {
 public:
-   // The creator holds the first reference and gives it up with Release.
+   // The creator holds the first reference and gives it up with ReleaseCreator.
    NodeArena() = default;
    NodeArena(const NodeArena&) = delete;
    NodeArena& operator=(const NodeArena&) = delete;
 
    // Memory for one node, 16-byte aligned; the node holds a reference until it dies.
    void* Allocate(size_t size);
-   // Drops one reference; the last frees every block.
+   // Drops a node's reference; the last frees every block.
    void Release();
+   // Drops the creator's reference, after its last Allocate.
+   void ReleaseCreator();
 
 private:
-   ~NodeArena();
+   // The creator's reference counts as this many, so that nodes need no atomic increment
+   // when they are made: nodes freed while the creator still holds it can never bring the
+   // count to zero, and ReleaseCreator trades the bias for the nodes made meanwhile.
+   static constexpr size_t kCreatorBias = size_t{1} << 62;
 
-   std::atomic<size_t> _references{1};
+   ~NodeArena();
+   void Drop(size_t references);
+
+   std::atomic<size_t> _references{kCreatorBias};
+   size_t _allocated = 0;  // by the creator's thread only
    std::vector<char*> _blocks;
    char* _cursor = nullptr;
    char* _end = nullptr;

@@ -121,6 +121,28 @@ TEST_F(ParserTest, BadInputRaisesXMLParseExceptionAndTheParserServesOn) {
    EXPECT_EQ("<a>ok</a>", Reparse(parser.Get(), "<a>ok</a>"));
 }
 
+// A text is handed to expat in slices: a document across several of them reads as the
+// same document through a reader, and an error past the first slice keeps its line.
+TEST_F(ParserTest, LongTextsParseAsTheirReaderDoesAndErrorsKeepTheirLines) {
+   Ref<XMLParser> parser = NewParser();
+   std::string text = "<r>";
+   for (int i = 0; i < 20000; ++i) text += "<e n='" + std::to_string(i) + "'>t&amp;</e>\n";
+   text += "</r>";
+   ASSERT_GT(text.size(), 200000u);
+   Ref<StringReader> reader;
+   CreateStringReader(text.data(), static_cast<int>(text.size()), reader);
+   Ref<Object> fromReader;
+   parser->Parse(reader.Get(), fromReader);
+   EXPECT_EQ(Write(fromReader.Cast<Document>().Get()), Reparse(parser.Get(), text));
+
+   int line = 0;
+   std::string broken = text.substr(0, text.size() - 4) + "</x>";
+   EXPECT_EQ("mismatched tag", Failure(parser.Get(), broken, false, &line));
+   EXPECT_EQ(20001, line);
+   std::string cut = text.substr(0, text.find('\n', 150000) + 1);
+   EXPECT_EQ("no element found", Failure(parser.Get(), cut, false));
+}
+
 // Callers catch the library's failures as Exception; a parse error must be one of them.
 TEST_F(ParserTest, ParseFailuresAreCaughtAsException) {
    Ref<XMLParser> parser = NewParser();
