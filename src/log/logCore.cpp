@@ -62,17 +62,17 @@ LogWriterImpl::LogWriterImpl(Writer* target, Logger::CombinedLevel mask, bool me
 
 void LogWriterImpl::Write(Logger::CombinedLevel level, const char* data, int length) {
    if ((level & GetMask()) == 0 || length <= 0) return;
-   std::lock_guard<std::mutex> lock(_mutex);
+   std::lock_guard<LogWriterMutex> lock(_mutex);
    WriteLocked(level, data, length);
 }
 
 void LogWriterImpl::Flush() {
-   std::lock_guard<std::mutex> lock(_mutex);
+   std::lock_guard<LogWriterMutex> lock(_mutex);
    FlushLocked();
 }
 
 void LogWriterImpl::Close() {
-   std::lock_guard<std::mutex> lock(_mutex);
+   std::lock_guard<LogWriterMutex> lock(_mutex);
    CloseLocked();
 }
 
@@ -119,12 +119,12 @@ void MemLogWriterImpl::WriteLocked(Logger::CombinedLevel level, const char* data
 }
 
 std::string MemLogWriterImpl::GetText() {
-   std::lock_guard<std::mutex> lock(_mutex);
+   std::lock_guard<LogWriterMutex> lock(_mutex);
    return GetTextLocked();
 }
 
 std::string MemLogWriterImpl::GetTextForReport(std::chrono::steady_clock::time_point deadline) {
-   std::unique_lock<std::mutex> lock(_mutex, std::try_to_lock);
+   std::unique_lock<LogWriterMutex> lock(_mutex, std::try_to_lock);
    while (!lock.owns_lock() && std::chrono::steady_clock::now() < deadline) {
       std::this_thread::yield();
       lock.try_lock();

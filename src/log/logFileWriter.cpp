@@ -105,14 +105,14 @@ public:
 
    ~LogFileWriterImpl() override {
       LogFileFlusher::Instance().Remove(this);
-      std::lock_guard<std::mutex> lock(_mutex);
+      std::lock_guard<LogWriterMutex> lock(_mutex);
       CloseLocked();
    }
 
    uint64_t GetLostCount() const override { return _lost.load(std::memory_order_relaxed); }
 
    void Reopen() override {
-      std::lock_guard<std::mutex> lock(_mutex);
+      std::lock_guard<LogWriterMutex> lock(_mutex);
       WriteBuffer();
       if (_fd >= 0) close(_fd);
       _fd = -1;
@@ -121,7 +121,7 @@ public:
 
    // From the flusher thread.
    void FlushIfDue(Clock::time_point now) {
-      std::lock_guard<std::mutex> lock(_mutex);
+      std::lock_guard<LogWriterMutex> lock(_mutex);
       if (_fd < 0 && !_held.empty()) RetryOpen(now);
       if (_used > 0 && _options.flushIntervalMs > 0 &&
           now - _dirtySince >= std::chrono::milliseconds(_options.flushIntervalMs)) {

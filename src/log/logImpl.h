@@ -26,6 +26,35 @@ constexpr Logger::CombinedLevel kSevereLevels = Logger::LOG_QUIET | Logger::LOG_
 // exceeds 65535, by the highest set bit.
 const char* GetCombinedLevelName(Logger::CombinedLevel level);
 
+// The lock of one log writer: one atomic word, with a futex wait only under contention.
+// Every line takes it once per writer, and the C library's mutex costs twice as much.
+class LogWriterMutex {
+public:
+   void lock() {
+      uint32_t state = 0;
+      if (_state.compare_exchange_strong(state, kLocked, std::memory_order_acquire,
+                                         std::memory_order_relaxed)) {
+         return;
+      }
+      // From here on the holder is told that someone waits; a wrong guess costs one wake.
+      while (_state.exchange(kContended, std::memory_order_acquire) != kFree) {
+         _state.wait(kContended, std::memory_order_relaxed);
+      }
+   }
+   bool try_lock() {
+      uint32_t state = kFree;
+      return _state.compare_exchange_strong(state, kLocked, std::memory_order_acquire,
+                                            std::memory_order_relaxed);
+   }
+   void unlock() {
+      if (_state.exchange(kFree, std::memory_order_release) == kContended) _state.notify_one();
+   }
+
+private:
+   static constexpr uint32_t kFree = 0, kLocked = 1, kContended = 2;
+   std::atomic<uint32_t> _state{kFree};
+};
+
 // A writer over a target Writer, filtered by a mask; its mutex serialises the target
 // against flushing and reading from other threads.
 class LogWriterImpl : public virtual LogWriter, public ObjectImpl {
@@ -49,7 +78,7 @@ protected:
    virtual void FlushLocked();
    virtual void CloseLocked();
 
-   std::mutex _mutex;
+   LogWriterMutex _mutex;
 
 private:
    Ref<Writer> _target;

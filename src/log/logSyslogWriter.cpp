@@ -61,7 +61,7 @@ public:
    }
 
    void Reopen() override {
-      std::lock_guard<std::mutex> lock(_mutex);
+      std::lock_guard<LogWriterMutex> lock(_mutex);
       Disconnect();
       Connect();
    }

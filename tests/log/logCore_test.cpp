@@ -208,6 +208,42 @@ TEST(LogOutputTest, ReadAndWriteHoldsExcludeAsTheyShouldUnderContention) {
    EXPECT_EQ(2LL * kRounds, guarded);
 }
 
+// Notes when two threads are inside Write at once.
+class OverlapWriter : public virtual Writer, public ObjectImpl {
+public:
+   void Write(const char*, int) override {
+      if (_inside.exchange(true)) overlaps.fetch_add(1);
+      for (volatile int i = 0; i < 200; i = i + 1) {
+      }
+      ++pieces;
+      _inside.store(false);
+   }
+   void Close() override {}
+   std::atomic<int> overlaps{0};
+   long pieces = 0;
+
+private:
+   std::atomic<bool> _inside{false};
+};
+
+// A writer's own lock serialises its target between threads that write to it without
+// the output's lock, as the flusher and direct callers do; a hand-over wakes the waiter.
+TEST(LogWriterTest, ConcurrentWritesReachTheTargetOneAtATime) {
+   Ref<OverlapWriter> target = new OverlapWriter();
+   Ref<LogWriter> writer;
+   CreateLogWriter("pieces", target.Get(), "trivia", writer);
+   constexpr int kRounds = 20000;
+   std::vector<std::thread> threads;
+   for (int t = 0; t < 3; ++t) {
+      threads.emplace_back([&] {
+         for (int i = 0; i < kRounds; ++i) writer->Write(Logger::LOG_INFO, "piece", 5);
+      });
+   }
+   Pelmora::Testing::JoinAll(threads, "writers of one log writer");
+   EXPECT_EQ(0, target->overlaps.load());
+   EXPECT_EQ(3L * kRounds, target->pieces);
+}
+
 TEST(LogMemoryTest, RingKeepsWholeRecentLinesAtMemoryLevelsAndIsWrittenOutOnRequest) {
    TestLogger t("warning");
    t.logger->SetMemLevelByName("verbose");
