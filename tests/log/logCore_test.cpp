@@ -213,8 +213,7 @@ class OverlapWriter : public virtual Writer, public ObjectImpl {
 public:
    void Write(const char*, int) override {
       if (_inside.exchange(true)) overlaps.fetch_add(1);
-      for (volatile int i = 0; i < 200; i = i + 1) {
-      }
+      for (int i = 0; i < 200; ++i) asm volatile("");  // a window for an overlap
       ++pieces;
       _inside.store(false);
    }
