@@ -4,6 +4,7 @@
 // request. Both are thread-safe.
 
 #include <map>
+#include <ostream>
 #include <mutex>
 #include <set>
 #include <string>
@@ -14,6 +15,16 @@
 #include "pelmora/authorize/providers.h"
 #include "pelmora/service/logger.h"
 #include "tests/support/pieceWriter.h"
+
+namespace Pelmora::Authorize {
+
+// Readable failures.
+inline void PrintTo(const ACEData& ace, std::ostream* out) {
+   *out << "{" << ace.entityId << ", " << ace.principal << (ace.isGroup ? " (group)" : "") << ", role " << ace.roleId
+        << (ace.propagate ? ", propagates}" : "}");
+}
+
+}  // namespace Pelmora::Authorize
 
 namespace Pelmora::TestSupport {
 
