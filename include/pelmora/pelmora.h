@@ -1,6 +1,7 @@
 #pragma once
 // Every public family of the library.
 
+#include "pelmora/authorize.h"
 #include "pelmora/exception.h"
 #include "pelmora/formatter.h"
 #include "pelmora/io.h"
