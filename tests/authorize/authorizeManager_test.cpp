@@ -502,20 +502,25 @@ TEST_F(ManagerTest, ConcurrentChecksSeeEitherTheOldOrTheNewPermission) {
    Ref<Session> alice = Connect("alice");
    std::atomic<bool> stop{false};
    std::atomic<int> wrong{0};
+   // Resolved up front: the threads touch nothing but the manager.
+   AuthEntity* vm = E("vm");
+   AuthEntity* host = E("host");
+   AuthEntity* dc = E("dc");
    std::vector<std::thread> threads;
    for (int t = 0; t < 2; ++t) {
       threads.emplace_back([&] {
          while (!stop.load()) {
             // View holds under both roles; Read flips with them.
-            if (!Can(alice.Get(), "vm", kPrivilegeView)) ++wrong;
-            Can(alice.Get(), "host");
-            std::vector<int> roles = RolesOn(alice.Get(), "vm");
+            if (!manager->HasEntityPrivilege(alice.Get(), vm, kPrivilegeView)) ++wrong;
+            manager->HasEntityPrivilege(alice.Get(), host, kPrivilegeRead);
+            std::vector<int> roles;
+            manager->GetEntityRoles(alice.Get(), vm, roles);
             if (roles.size() != 1) ++wrong;
          }
       });
    }
    for (int i = 0; i < 200; ++i) {
-      manager->ModifyACE(E("dc"), "alice", false, i % 2 ? kRoleReadOnly : kRoleView, true);
+      manager->ModifyACE(dc, "alice", false, i % 2 ? kRoleReadOnly : kRoleView, true);
       if (i % 50 == 0) manager->NotifyEntityMove({"vm"});
    }
    stop = true;
