@@ -53,6 +53,20 @@ private:
    const Ref<UserInfo> _user{new AnonymousUser()};
 };
 
+class StatsPublisher : public virtual PerfCounter::GroupPublisher, public ObjectImpl {
+public:
+   explicit StatsPublisher(AuthorizeStats* stats) : _stats(stats) {}
+   void CollectValues(RefVector<PerfCounter::Metadata>& metadata, std::vector<PerfCounter::Value>& values) override {
+      const long long read[] = {_stats->checks.load(), _stats->cacheHits.load(), _stats->cacheMisses.load(),
+                                _stats->sessions.load()};
+      values.clear();
+      for (size_t i = 0; i < metadata.size() && i < 4; ++i) values.emplace_back(read[i]);
+   }
+
+private:
+   const Ref<AuthorizeStats> _stats;
+};
+
 std::string Describe(const ACEData& data) {
    return data.entityId + ":" + (data.isGroup ? "group:" : "user:") + data.principal;
 }
@@ -78,7 +92,24 @@ void AuthorizeManagerImpl::RequireInit() const {
    if (!_initialized) throw NotInitializedException("Authorize manager is not initialized");
 }
 
+void AuthorizeManagerImpl::PublishCounters() {
+   using PerfCounter::Metadata;
+   RefVector<Metadata> metadata{new Metadata(kCounterChecks, Metadata::TYPE_COUNTER),
+                                new Metadata(kCounterCacheHits, Metadata::TYPE_COUNTER),
+                                new Metadata(kCounterCacheMisses, Metadata::TYPE_COUNTER),
+                                new Metadata(kCounterSessions, Metadata::TYPE_GAUGE)};
+   try {
+      PerfCounter::GetCounterRegistry()->RegisterGroup(metadata, new StatsPublisher(_stats.Get()), _counters);
+   } catch (const Exception& e) {
+      // Another manager of the process publishes them already.
+      PELMORA_LOG_WARNING(_logger.Get(), "Authorize manager publishes no counters: %1", e.what());
+   }
+}
+
 void AuthorizeManagerImpl::Reset() {
+   if (_counters) _counters->Unregister();
+   _counters.Reset();
+   _stats->sessions = 0;
    _initialized = false;
    _users.Clear();
    _acls.clear();
@@ -120,6 +151,7 @@ void AuthorizeManagerImpl::Init(UserDirectory* userDirectory, StorageProvider* s
       LoadRoles();
       LoadACEs();
       _initialized = true;
+      PublishCounters();
    } catch (const Exception& e) {
       PELMORA_LOG_ERROR(_logger.Get(), "[Auth] Failed to initialize: <%1>", e.what());
       Reset();
@@ -298,12 +330,14 @@ void AuthorizeManagerImpl::AddConnection(Session* session, const std::string& us
    WriteGuard guard(this);
    RequireInit();
    UserData* data = _users.Register(session, user, token.Get(), privileged, _maxEntries.load());
+   _stats->sessions = static_cast<long long>(_users.SessionCount());
    RecomputeUser(data);
 }
 
 void AuthorizeManagerImpl::RemoveConnection(Session* session) {
    WriteGuard guard(this);
    _users.Release(session);
+   _stats->sessions = static_cast<long long>(_users.SessionCount());
 }
 
 std::string AuthorizeManagerImpl::GetUser(Session* session) {
@@ -417,7 +451,12 @@ bool AuthorizeManagerImpl::Check(Session* session, AuthEntity* entity, unsigned 
    if (!entity) return false;
    const std::string& id = entity->GetId();
    bool allowed = false;
-   if (useCache && data->TestCached(id, index, allowed)) return allowed;
+   _stats->checks.fetch_add(1, std::memory_order_relaxed);
+   if (useCache && data->TestCached(id, index, allowed)) {
+      _stats->cacheHits.fetch_add(1, std::memory_order_relaxed);
+      return allowed;
+   }
+   _stats->cacheMisses.fetch_add(1, std::memory_order_relaxed);
    try {
       return ComputeAccess(data->GetUser(), data->GetToken(), id, useCache ? data : nullptr)->HasPrivilege(index);
    } catch (const AuthEntityNotFoundException&) {

@@ -8,11 +8,26 @@
 #include <vector>
 
 #include "pelmora/authorize/authorizeManager.h"
+#include "pelmora/perfCounter/registry.h"
 #include "pelmora/system/rwLock.h"
 #include "src/authorize/privileges.h"
 #include "src/authorize/userCache.h"
 
 namespace Pelmora::Authorize {
+
+// The counter names the manager registers in the process's counter registry.
+constexpr const char* kCounterChecks = "/Authorize/Checks";
+constexpr const char* kCounterCacheHits = "/Authorize/CacheHits";
+constexpr const char* kCounterCacheMisses = "/Authorize/CacheMisses";
+constexpr const char* kCounterSessions = "/Authorize/Sessions";
+
+// Check statistics, counted without the manager's lock.
+struct AuthorizeStats : public ObjectImpl {
+   std::atomic<long long> checks{0};
+   std::atomic<long long> cacheHits{0};
+   std::atomic<long long> cacheMisses{0};
+   std::atomic<long long> sessions{0};
+};
 
 class AuthorizeManagerImpl : public virtual AuthorizeManager, public System::RWLockableObjectImpl {
 public:
@@ -90,6 +105,7 @@ private:
    void RequireInit() const;
    UserValidationResult CheckPrincipal(const std::string& name, bool isGroup);
    void Reset();
+   void PublishCounters();
    unsigned PrivilegeIndex(const std::string& privilegeId) const;
    bool Check(Session* session, AuthEntity* entity, unsigned index, bool useCache);
    // Runs `writes` inside one transaction; any failure rolls it back and raises
@@ -128,6 +144,8 @@ private:
    Roles _roles;
    std::unordered_map<std::string, Ref<ACL>> _acls;
    UserCache _users;
+   const Ref<AuthorizeStats> _stats{new AuthorizeStats()};
+   Ref<PerfCounter::RegistryItem> _counters;
 };
 
 // A token for the anonymous principal: it belongs to no group.

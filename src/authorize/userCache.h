@@ -70,6 +70,7 @@ public:
    // One name per user with a session, sorted.
    void GetActiveUsers(std::vector<std::string>& out) const;
    void GetAllUserData(std::vector<Ref<UserData>>& out) const;
+   size_t SessionCount() const { return _sessions.size(); }
    void Clear();
 
 private:

@@ -7,6 +7,7 @@
 #include "pelmora/authorize/entityTree.h"
 #include "pelmora/authorize/exceptions.h"
 #include "pelmora/exception/exceptions.h"
+#include "pelmora/perfCounter/registry.h"
 #include "src/authorize/authorizeManager.h"
 #include "tests/support/authProviders.h"
 #include "tests/support/watchdog.h"
@@ -275,6 +276,36 @@ TEST_F(ManagerTest, CachesFollowPermissionChangesAndEntityMoves) {
 
    manager->RemoveACE(E("dc"), "alice", false);
    EXPECT_FALSE(Can(alice.Get(), "vm", kPrivilegeView));
+}
+
+// The process registry's value of `name`, or -1 when it is not registered.
+long long Counter(const std::string& name) {
+   PerfCounter::QueryResults results;
+   PerfCounter::GetCounterRegistry()->CollectAll(results);
+   for (const PerfCounter::QueryResult& result : results) {
+      if (result.metadata->GetName() == name) return result.value.Get();
+   }
+   return -1;
+}
+
+TEST_F(ManagerTest, ChecksAndSessionsAreCountedWhileTheManagerRuns) {
+   Start();
+   Ref<Session> root = Connect("root");
+   Ref<Session> alice = Connect("alice");
+   EXPECT_EQ(2, Counter(kCounterSessions));
+   long long checks = Counter(kCounterChecks);
+   long long hits = Counter(kCounterCacheHits);
+   long long misses = Counter(kCounterCacheMisses);
+   Can(alice.Get(), "vm");
+   Can(alice.Get(), "vm");
+   EXPECT_EQ(checks + 2, Counter(kCounterChecks));
+   EXPECT_EQ(misses + 1, Counter(kCounterCacheMisses));
+   EXPECT_EQ(hits + 1, Counter(kCounterCacheHits));
+   manager->RemoveConnection(root.Get());
+   EXPECT_EQ(1, Counter(kCounterSessions));
+   manager->Shutdown();
+   EXPECT_EQ(-1, Counter(kCounterChecks));
+   manager.Reset();
 }
 
 TEST_F(ManagerTest, TheCacheStaysWithinItsBound) {
