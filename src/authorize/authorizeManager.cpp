@@ -12,10 +12,10 @@ namespace Pelmora::Authorize {
 
 using Service::Logger;
 
-class AuthorizeManagerImpl::ReadGuard {
+class PELMORA_SCOPED_CAPABILITY AuthorizeManagerImpl::ReadGuard {
 public:
-   explicit ReadGuard(System::RWLockableObject* lock) : _lock(lock) { _lock->ReadLock(); }
-   ~ReadGuard() { _lock->Unlock(); }
+   explicit ReadGuard(System::RWLockableObject* lock) PELMORA_ACQUIRE_SHARED(lock) : _lock(lock) { _lock->ReadLock(); }
+   ~ReadGuard() PELMORA_RELEASE_GENERIC() { _lock->Unlock(); }
    ReadGuard(const ReadGuard&) = delete;
    ReadGuard& operator=(const ReadGuard&) = delete;
 
@@ -23,10 +23,10 @@ private:
    System::RWLockableObject* _lock;
 };
 
-class AuthorizeManagerImpl::WriteGuard {
+class PELMORA_SCOPED_CAPABILITY AuthorizeManagerImpl::WriteGuard {
 public:
-   explicit WriteGuard(System::RWLockableObject* lock) : _lock(lock) { _lock->WriteLock(); }
-   ~WriteGuard() { _lock->Unlock(); }
+   explicit WriteGuard(System::RWLockableObject* lock) PELMORA_ACQUIRE(lock) : _lock(lock) { _lock->WriteLock(); }
+   ~WriteGuard() PELMORA_RELEASE() { _lock->Unlock(); }
    WriteGuard(const WriteGuard&) = delete;
    WriteGuard& operator=(const WriteGuard&) = delete;
 
