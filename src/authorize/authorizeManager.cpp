@@ -12,26 +12,92 @@ namespace Pelmora::Authorize {
 
 using Service::Logger;
 
+namespace {
+
+// The manager locks the calling thread holds, innermost last; a thread holds few.
+struct HeldLock {
+   const ManagerLock* lock;
+   bool write;
+};
+constexpr int kMaxHeld = 8;
+thread_local HeldLock t_held[kMaxHeld];
+thread_local int t_heldCount = 0;
+
+const HeldLock* FindHeld(const ManagerLock* lock) {
+   for (int i = t_heldCount - 1; i >= 0; --i) {
+      if (t_held[i].lock == lock) return &t_held[i];
+   }
+   return nullptr;
+}
+
+void PushHeld(const ManagerLock* lock, bool write) {
+   PELMORA_VERIFY(t_heldCount < kMaxHeld);
+   t_held[t_heldCount++] = HeldLock{lock, write};
+}
+
+}  // namespace
+
+ManagerLock::ManagerLock() {
+   pthread_rwlockattr_t attr;
+   pthread_rwlockattr_init(&attr);
+   pthread_rwlockattr_setkind_np(&attr, PTHREAD_RWLOCK_PREFER_WRITER_NONRECURSIVE_NP);
+   pthread_rwlock_init(&_lock, &attr);
+   pthread_rwlockattr_destroy(&attr);
+}
+
+ManagerLock::~ManagerLock() { pthread_rwlock_destroy(&_lock); }
+
+void ManagerLock::ReadLock() {
+   PELMORA_VERIFY(FindHeld(this) == nullptr);
+   pthread_rwlock_rdlock(&_lock);
+   PushHeld(this, false);
+}
+
+void ManagerLock::WriteLock() {
+   PELMORA_VERIFY(FindHeld(this) == nullptr);
+   pthread_rwlock_wrlock(&_lock);
+   PushHeld(this, true);
+}
+
+void ManagerLock::Unlock() {
+   int i = t_heldCount - 1;
+   while (i >= 0 && t_held[i].lock != this) --i;
+   PELMORA_VERIFY(i >= 0);
+   for (; i + 1 < t_heldCount; ++i) t_held[i] = t_held[i + 1];
+   --t_heldCount;
+   pthread_rwlock_unlock(&_lock);
+}
+
+bool ManagerLock::IsReadLocked() const {
+   const HeldLock* held = FindHeld(this);
+   return held && !held->write;
+}
+
+bool ManagerLock::IsWriteLocked() const {
+   const HeldLock* held = FindHeld(this);
+   return held && held->write;
+}
+
 class PELMORA_SCOPED_CAPABILITY AuthorizeManagerImpl::ReadGuard {
 public:
-   explicit ReadGuard(System::RWLockableObject* lock) PELMORA_ACQUIRE_SHARED(lock) : _lock(lock) { _lock->ReadLock(); }
+   explicit ReadGuard(ManagerLock* lock) PELMORA_ACQUIRE_SHARED(lock) : _lock(lock) { _lock->ReadLock(); }
    ~ReadGuard() PELMORA_RELEASE_GENERIC() { _lock->Unlock(); }
    ReadGuard(const ReadGuard&) = delete;
    ReadGuard& operator=(const ReadGuard&) = delete;
 
 private:
-   System::RWLockableObject* _lock;
+   ManagerLock* _lock;
 };
 
 class PELMORA_SCOPED_CAPABILITY AuthorizeManagerImpl::WriteGuard {
 public:
-   explicit WriteGuard(System::RWLockableObject* lock) PELMORA_ACQUIRE(lock) : _lock(lock) { _lock->WriteLock(); }
+   explicit WriteGuard(ManagerLock* lock) PELMORA_ACQUIRE(lock) : _lock(lock) { _lock->WriteLock(); }
    ~WriteGuard() PELMORA_RELEASE() { _lock->Unlock(); }
    WriteGuard(const WriteGuard&) = delete;
    WriteGuard& operator=(const WriteGuard&) = delete;
 
 private:
-   System::RWLockableObject* _lock;
+   ManagerLock* _lock;
 };
 
 namespace {
@@ -57,8 +123,9 @@ class StatsPublisher : public virtual PerfCounter::GroupPublisher, public Object
 public:
    explicit StatsPublisher(AuthorizeStats* stats) : _stats(stats) {}
    void CollectValues(RefVector<PerfCounter::Metadata>& metadata, std::vector<PerfCounter::Value>& values) override {
-      const long long read[] = {_stats->checks.load(), _stats->cacheHits.load(), _stats->cacheMisses.load(),
-                                _stats->sessions.load()};
+      const long long hits = _stats->cacheHits.load();
+      const long long misses = _stats->cacheMisses.load();
+      const long long read[] = {hits + misses, hits, misses, _stats->sessions.load()};
       values.clear();
       for (size_t i = 0; i < metadata.size() && i < 4; ++i) values.emplace_back(read[i]);
    }
@@ -75,8 +142,7 @@ std::string Describe(const ACEData& data) {
 
 void CreateAnonymousToken(Ref<AuthTokenHelper>& out) { out = new AnonymousToken(); }
 
-// Writers first: a stream of checks must not hold a permission change off for ever.
-AuthorizeManagerImpl::AuthorizeManagerImpl() : RWLockableObjectImpl(LOCK_MODE_WRITER_PRIORITY) {}
+AuthorizeManagerImpl::AuthorizeManagerImpl() = default;
 
 AuthorizeManagerImpl::~AuthorizeManagerImpl() {
    if (_initialized) SetAuthLog(nullptr);
@@ -131,7 +197,7 @@ void AuthorizeManagerImpl::Init(UserDirectory* userDirectory, StorageProvider* s
    PELMORA_VERIFY(userDirectory != NULL);
    PELMORA_VERIFY(storageProvider != NULL);
    PELMORA_VERIFY(appModelProvider != NULL);
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    if (_initialized) throw AlreadyInitializedException();
    _directory = userDirectory;
    _storage = storageProvider;
@@ -303,22 +369,22 @@ void AuthorizeManagerImpl::CreateDefaultPermission() {
 }
 
 void AuthorizeManagerImpl::Shutdown() {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    Reset();
 }
 
 UserDirectory* AuthorizeManagerImpl::GetUserDirectory() {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    return _directory.Get();
 }
 
 StorageProvider* AuthorizeManagerImpl::GetStorageProvider() {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    return _storage.Get();
 }
 
 AppModelProvider* AuthorizeManagerImpl::GetAppModelProvider() {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    return _model.Get();
 }
 
@@ -327,7 +393,7 @@ AppModelProvider* AuthorizeManagerImpl::GetAppModelProvider() {
 void AuthorizeManagerImpl::AddConnection(Session* session, const std::string& user, Ref<AuthTokenHelper> token,
                                          bool privileged) {
    if (!token) GetAuthToken(user, token);
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    UserData* data = _users.Register(session, user, token.Get(), privileged, _maxEntries.load());
    _stats->sessions = static_cast<long long>(_users.SessionCount());
@@ -335,13 +401,13 @@ void AuthorizeManagerImpl::AddConnection(Session* session, const std::string& us
 }
 
 void AuthorizeManagerImpl::RemoveConnection(Session* session) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    _users.Release(session);
    _stats->sessions = static_cast<long long>(_users.SessionCount());
 }
 
 std::string AuthorizeManagerImpl::GetUser(Session* session) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    UserData* data = _users.GetUserData(session);
    return data ? data->GetUser() : std::string();
 }
@@ -353,7 +419,7 @@ void AuthorizeManagerImpl::GetAuthToken(const std::string& user, Ref<AuthTokenHe
    }
    Ref<UserDirectory> directory;
    {
-      ReadGuard guard(this);
+      ReadGuard guard(&_lock);
       RequireInit();
       directory = _directory;
    }
@@ -442,16 +508,16 @@ Ref<EntityAccess> AuthorizeManagerImpl::ComputeAccess(const std::string& user, A
 }
 
 bool AuthorizeManagerImpl::Check(Session* session, AuthEntity* entity, unsigned index, bool useCache) {
-   UserData* data = _users.GetUserData(session);
+   bool privileged = false;
+   UserData* data = _users.GetUserData(session, &privileged);
    if (!data) {
       PELMORA_LOG_ERROR(AuthLog(), "Failed to retrieve user data! User: [%1]", std::string());
       return false;
    }
-   if (_users.IsPrivileged(session)) return true;
+   if (privileged) return true;
    if (!entity) return false;
    const std::string& id = entity->GetId();
    bool allowed = false;
-   _stats->checks.fetch_add(1, std::memory_order_relaxed);
    if (useCache && data->TestCached(id, index, allowed)) {
       _stats->cacheHits.fetch_add(1, std::memory_order_relaxed);
       return allowed;
@@ -465,7 +531,7 @@ bool AuthorizeManagerImpl::Check(Session* session, AuthEntity* entity, unsigned 
 }
 
 bool AuthorizeManagerImpl::HasPrivilege(Session* session, const std::string& privilegeId) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    unsigned index = PrivilegeIndex(privilegeId);
    Ref<AuthEntity> root;
@@ -475,14 +541,14 @@ bool AuthorizeManagerImpl::HasPrivilege(Session* session, const std::string& pri
 
 bool AuthorizeManagerImpl::HasRootAccess(Session* session) {
    if (!session) return true;
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    UserData* data = _users.GetUserData(session);
    if (!data) return false;
    return data->HasRootAccess() || _users.IsPrivileged(session);
 }
 
 bool AuthorizeManagerImpl::HasEntityPrivilege(Session* session, AuthEntity* entity, const std::string& privilegeId) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    return Check(session, entity, PrivilegeIndex(privilegeId), true);
 }
@@ -495,7 +561,7 @@ bool AuthorizeManagerImpl::HasEntityPrivilege(const std::string& user, AuthEntit
    } catch (const AuthException&) {
       return false;
    }
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    unsigned index = PrivilegeIndex(privilegeId);
    if (!entity) return false;
@@ -509,7 +575,7 @@ bool AuthorizeManagerImpl::HasEntityPrivilege(const std::string& user, AuthEntit
 void AuthorizeManagerImpl::HasEntityPrivilegeList(Session* session, const EntityPrivilegeList& list,
                                                   std::vector<bool>& results) {
    results.assign(list.size(), false);
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    for (size_t i = 0; i < list.size(); ++i) {
       results[i] = Check(session, list[i].first, PrivilegeIndex(list[i].second), true);
@@ -519,7 +585,7 @@ void AuthorizeManagerImpl::HasEntityPrivilegeList(Session* session, const Entity
 void AuthorizeManagerImpl::HasEntityPrivilegeListUncached(Session* session, const EntityPrivilegeList& list,
                                                           std::vector<bool>& results) {
    results.assign(list.size(), false);
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    for (size_t i = 0; i < list.size(); ++i) {
       results[i] = Check(session, list[i].first, PrivilegeIndex(list[i].second), false);
@@ -528,7 +594,7 @@ void AuthorizeManagerImpl::HasEntityPrivilegeListUncached(Session* session, cons
 
 void AuthorizeManagerImpl::GetEntityRoles(Session* session, AuthEntity* entity, std::vector<int>& roleIds) {
    roleIds.clear();
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    UserData* data = _users.GetUserData(session);
    if (!data || !entity) return;
@@ -539,7 +605,7 @@ void AuthorizeManagerImpl::GetEntityRoles(Session* session, AuthEntity* entity, 
 }
 
 size_t AuthorizeManagerImpl::CachedEntryCount(Session* session) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    UserData* data = _users.GetUserData(session);
    return data ? data->Size() : 0;
 }
@@ -621,27 +687,27 @@ void AuthorizeManagerImpl::Recompute(const std::vector<std::string>& users) {
 }
 
 void AuthorizeManagerImpl::NotifyChange(const std::vector<std::string>& users) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    AfterChange(users);
 }
 
 void AuthorizeManagerImpl::NotifyEntityMove(const std::vector<std::string>& entityIds) {
    if (entityIds.empty()) return;
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    // A moved subtree inherits from new ancestors; what any user had cached below it is
    // stale, and finding those entries costs more than recomputing them on demand.
    AfterChange();
 }
 
 void AuthorizeManagerImpl::ClearUserCaches() {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    std::vector<Ref<UserData>> all;
    _users.GetAllUserData(all);
    for (const Ref<UserData>& data : all) data->Clear();
 }
 
 void AuthorizeManagerImpl::UpdateMaxUserCacheEntries(unsigned maxEntries) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    _maxEntries = maxEntries;
    std::vector<Ref<UserData>> all;
    _users.GetAllUserData(all);
@@ -666,7 +732,7 @@ RoleData AuthorizeManagerImpl::ToRoleData(Role* role) const {
 }
 
 void AuthorizeManagerImpl::CreateRole(const std::string& name, const PrivSet& privileges, int& id) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    CheckRoleName(name, 0);
    PrivSet set = privileges;
@@ -682,7 +748,7 @@ void AuthorizeManagerImpl::CreateRole(const std::string& name, const PrivSet& pr
 
 void AuthorizeManagerImpl::CreateRoleWithId(const std::string& name, const PrivSet& privileges, int id,
                                             bool persist) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    if (id <= 0) throw AuthSystemRoleException();
    if (_roles.Find(id)) throw AuthAlreadyExistsException();
@@ -699,7 +765,7 @@ void AuthorizeManagerImpl::CreateRoleWithId(const std::string& name, const PrivS
 }
 
 void AuthorizeManagerImpl::ModifyRole(int id, const std::string& name, PrivSet& privileges, bool persist) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    if (id < 0) throw AuthSystemRoleException();
    Role* role = _roles.Find(id);
@@ -717,7 +783,7 @@ void AuthorizeManagerImpl::ModifyRole(int id, const std::string& name, PrivSet& 
 }
 
 void AuthorizeManagerImpl::RemoveRole(int id, bool removePermissions, bool persist) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    if (id < 0) throw AuthSystemRoleException();
    if (!_roles.Find(id)) throw AuthRoleNotFoundException(id);
@@ -742,7 +808,7 @@ void AuthorizeManagerImpl::RemoveRole(int id, bool removePermissions, bool persi
 }
 
 void AuthorizeManagerImpl::GetRole(int id, Ref<Role>& out) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    Role* role = _roles.Find(id);
    if (!role) throw AuthRoleNotFoundException(id);
@@ -750,13 +816,13 @@ void AuthorizeManagerImpl::GetRole(int id, Ref<Role>& out) {
 }
 
 void AuthorizeManagerImpl::GetRoles(RoleResult& out) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    _roles.GetAll(out);
 }
 
 void AuthorizeManagerImpl::GetRolePrivList(int id, std::vector<std::string>& privilegeIds) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    Role* role = _roles.Find(id);
    if (!role) throw AuthRoleNotFoundException(id);
@@ -764,13 +830,13 @@ void AuthorizeManagerImpl::GetRolePrivList(int id, std::vector<std::string>& pri
 }
 
 void AuthorizeManagerImpl::GetPrivileges(PrivilegeResult& out) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    _privileges.GetAll(out);
 }
 
 void AuthorizeManagerImpl::GetPrivilege(const std::string& id, Ref<Privilege>& out) {
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    Privilege* privilege = _privileges.Find(id);
    if (!privilege) throw AuthPrivilegeNotFoundException(id);
@@ -778,7 +844,7 @@ void AuthorizeManagerImpl::GetPrivilege(const std::string& id, Ref<Privilege>& o
 }
 
 void AuthorizeManagerImpl::AddPrivileges(const std::vector<PrivilegeDef>& privileges) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    // Worked on a copy, so that a refused or unstored batch leaves nothing behind.
    PrivilegeTable table = _privileges;
@@ -802,7 +868,7 @@ void AuthorizeManagerImpl::AddPrivileges(const std::vector<PrivilegeDef>& privil
 }
 
 void AuthorizeManagerImpl::RemovePrivileges(const std::vector<std::string>& privilegeIds) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    PrivilegeTable table = _privileges;
    std::vector<unsigned> indexes;
@@ -831,7 +897,7 @@ void AuthorizeManagerImpl::RemovePrivileges(const std::vector<std::string>& priv
 }
 
 void AuthorizeManagerImpl::MoveRolePermissions(int fromRoleId, int toRoleId) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    if (fromRoleId == toRoleId) throw AuthSameRoleException();
    if (!_roles.Find(fromRoleId)) throw AuthRoleNotFoundException(fromRoleId);
@@ -856,7 +922,7 @@ void AuthorizeManagerImpl::MoveRolePermissions(int fromRoleId, int toRoleId) {
 
 void AuthorizeManagerImpl::CreateACE(AuthEntity* entity, const std::string& principal, bool isGroup, int roleId,
                                      bool propagate) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    if (!entity) throw AuthEntityNotFoundException(std::string());
    const std::string& entityId = entity->GetId();
@@ -877,7 +943,7 @@ void AuthorizeManagerImpl::CreateACE(AuthEntity* entity, const std::string& prin
 
 void AuthorizeManagerImpl::ModifyACE(AuthEntity* entity, const std::string& principal, bool isGroup, int roleId,
                                      bool propagate) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    if (!entity) throw AuthEntityNotFoundException(std::string());
    const std::string& entityId = entity->GetId();
@@ -896,7 +962,7 @@ void AuthorizeManagerImpl::ModifyACE(AuthEntity* entity, const std::string& prin
 }
 
 void AuthorizeManagerImpl::RemoveACE(AuthEntity* entity, const std::string& principal, bool isGroup) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    const std::string entityId = entity ? entity->GetId() : std::string();
    ACL* acl = FindACL(entityId);
@@ -921,7 +987,7 @@ void AuthorizeManagerImpl::RemoveACE(AuthEntity* entity, const std::string& prin
 
 void AuthorizeManagerImpl::GetACEs(AuthEntity* entity, bool inherited, ACEResult& out) {
    out.clear();
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    if (!entity) throw AuthEntityNotFoundException(std::string());
    const std::string& entityId = entity->GetId();
@@ -942,14 +1008,14 @@ void AuthorizeManagerImpl::GetACEs(AuthEntity* entity, bool inherited, ACEResult
 
 void AuthorizeManagerImpl::GetACEs(ACEResult& out) {
    out.clear();
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    ForEachACE([&](const std::string& entityId, ACE* ace) { out.push_back(ace->ToData(entityId)); });
 }
 
 void AuthorizeManagerImpl::GetACEsByRole(int roleId, ACEResult& out) {
    out.clear();
-   ReadGuard guard(this);
+   ReadGuard guard(&_lock);
    RequireInit();
    if (!_roles.Find(roleId)) throw AuthRoleNotFoundException(roleId);
    ForEachACE([&](const std::string& entityId, ACE* ace) {
@@ -959,7 +1025,7 @@ void AuthorizeManagerImpl::GetACEsByRole(int roleId, ACEResult& out) {
 
 void AuthorizeManagerImpl::ValidateACEs(ACEResult& removed) {
    removed.clear();
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    std::vector<ACEData> invalid;
    std::vector<ACEData> all;
@@ -1002,7 +1068,7 @@ void AuthorizeManagerImpl::ValidateACEs(ACEResult& removed) {
 }
 
 void AuthorizeManagerImpl::RemoveAssociatedACL(const std::string& entityId) {
-   WriteGuard guard(this);
+   WriteGuard guard(&_lock);
    RequireInit();
    ACL* acl = FindACL(entityId);
    if (!acl) return;

@@ -9,7 +9,9 @@
 
 #include "pelmora/authorize/authorizeManager.h"
 #include "pelmora/perfCounter/registry.h"
-#include "pelmora/system/rwLock.h"
+#include <pthread.h>
+
+#include "pelmora/object/threadAnnotations.h"
 #include "src/authorize/privileges.h"
 #include "src/authorize/userCache.h"
 
@@ -21,15 +23,37 @@ constexpr const char* kCounterCacheHits = "/Authorize/CacheHits";
 constexpr const char* kCounterCacheMisses = "/Authorize/CacheMisses";
 constexpr const char* kCounterSessions = "/Authorize/Sessions";
 
-// Check statistics, counted without the manager's lock.
+// Check statistics, counted without the manager's lock. Every check is a hit or a
+// miss, so the number of checks is their sum: one increment per check.
 struct AuthorizeStats : public ObjectImpl {
-   std::atomic<long long> checks{0};
    std::atomic<long long> cacheHits{0};
    std::atomic<long long> cacheMisses{0};
    std::atomic<long long> sessions{0};
 };
 
-class AuthorizeManagerImpl : public virtual AuthorizeManager, public System::RWLockableObjectImpl {
+// The manager's reader/writer lock: pthread's with writers preferred, so that a stream
+// of checks cannot hold a change off. It is not recursive: a thread that already holds
+// it in either mode and takes it again panics rather than deadlocking behind a waiting
+// writer. The calling thread's holds are tracked so that the Is...Locked queries answer
+// for it.
+class PELMORA_CAPABILITY("rwlock") ManagerLock {
+public:
+   ManagerLock();
+   ~ManagerLock();
+   ManagerLock(const ManagerLock&) = delete;
+   ManagerLock& operator=(const ManagerLock&) = delete;
+
+   void ReadLock() PELMORA_ACQUIRE_SHARED();
+   void WriteLock() PELMORA_ACQUIRE();
+   void Unlock() PELMORA_RELEASE_GENERIC();
+   bool IsReadLocked() const;
+   bool IsWriteLocked() const;
+
+private:
+   pthread_rwlock_t _lock;
+};
+
+class AuthorizeManagerImpl : public virtual AuthorizeManager, public ObjectImpl {
 public:
    AuthorizeManagerImpl();
    ~AuthorizeManagerImpl() override;
@@ -97,6 +121,8 @@ public:
    unsigned GetMaxUserCacheEntries() const { return _maxEntries.load(); }
    // Entries cached for the session's user; 0 for an unknown session.
    size_t CachedEntryCount(Session* session);
+   bool IsReadLocked() const { return _lock.IsReadLocked(); }
+   bool IsWriteLocked() const { return _lock.IsWriteLocked(); }
 
 private:
    class ReadGuard;
@@ -132,6 +158,7 @@ private:
    void Recompute(const std::vector<std::string>& users);
    void RecomputeUser(UserData* data);
 
+   mutable ManagerLock _lock;
    bool _initialized = false;
    Ref<UserDirectory> _directory;
    Ref<StorageProvider> _storage;

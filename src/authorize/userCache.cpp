@@ -77,9 +77,11 @@ bool UserCache::Release(Session* session) {
    return true;
 }
 
-UserData* UserCache::GetUserData(Session* session) const {
+UserData* UserCache::GetUserData(Session* session, bool* privileged) const {
    auto it = _sessions.find(session);
-   return it == _sessions.end() ? nullptr : it->second.data.Get();
+   if (it == _sessions.end()) return nullptr;
+   if (privileged) *privileged = it->second.privileged;
+   return it->second.data.Get();
 }
 
 bool UserCache::IsPrivileged(Session* session) const {

@@ -64,8 +64,8 @@ public:
                       unsigned maxEntries);
    // False for an unknown session.
    bool Release(Session* session);
-   // Null for an unknown session.
-   UserData* GetUserData(Session* session) const;
+   // Null for an unknown session; `privileged`, when given, receives the session's flag.
+   UserData* GetUserData(Session* session, bool* privileged = nullptr) const;
    bool IsPrivileged(Session* session) const;
    // One name per user with a session, sorted.
    void GetActiveUsers(std::vector<std::string>& out) const;

@@ -577,6 +577,32 @@ TEST_F(ManagerTest, InheritedAccessOutsideTheLockPanics) {
                 "Assert Failed: \"IsReadLocked\\(\\) \\|\\| IsWriteLocked\\(\\)\"");
 }
 
+TEST(ManagerLockTest, TracksTheCallingThreadsHoldAndRefusesToNest) {
+   ManagerLock a, b;
+   EXPECT_FALSE(a.IsReadLocked() || a.IsWriteLocked());
+   a.ReadLock();
+   b.WriteLock();
+   EXPECT_TRUE(a.IsReadLocked());
+   EXPECT_FALSE(a.IsWriteLocked());
+   EXPECT_TRUE(b.IsWriteLocked());
+   bool seenByOther = true;
+   std::thread other([&] { seenByOther = a.IsReadLocked() || b.IsWriteLocked(); });
+   Testing::Join(other, "the other thread");
+   EXPECT_FALSE(seenByOther);
+   // Released out of order.
+   a.Unlock();
+   EXPECT_FALSE(a.IsReadLocked());
+   EXPECT_TRUE(b.IsWriteLocked());
+   b.Unlock();
+   EXPECT_FALSE(b.IsWriteLocked());
+   EXPECT_DEATH(
+      {
+         a.ReadLock();
+         a.ReadLock();
+      },
+      "Assert Failed: \"FindHeld\\(this\\) == nullptr\"");
+}
+
 TEST(ManagerInstanceTest, TheProcessHasOneManagerUntilInitIsCalledItRefusesWork) {
    Ref<AuthorizeManager> a, b;
    GetInstance(a);
