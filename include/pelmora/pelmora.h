@@ -4,6 +4,7 @@
 #include "pelmora/authorize.h"
 #include "pelmora/exception.h"
 #include "pelmora/formatter.h"
+#include "pelmora/http.h"
 #include "pelmora/io.h"
 #include "pelmora/object.h"
 #include "pelmora/perfCounter.h"

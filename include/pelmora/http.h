@@ -1,0 +1,9 @@
+#pragma once
+// HTTP/1.x messages: status codes, headers and cookies, the server's request reader and
+// response writer, chunked decoding, URL and URI functions and HTML escaping.
+
+#include "pelmora/http/chunkStreamDecoder.h"
+#include "pelmora/http/cookie.h"
+#include "pelmora/http/header.h"
+#include "pelmora/http/responseCode.h"
+#include "pelmora/http/url.h"
