@@ -11,6 +11,10 @@ namespace Pelmora::Http {
 
 namespace {
 
+bool IsAlnum(unsigned char c) {
+   return (c >= '0' && c <= '9') || (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z');
+}
+
 bool IsTokenChar(unsigned char c) {
    if (c <= 0x20 || c >= 0x7f) return false;
    return std::strchr("()<>@,;:\\\"/[]?={}", c) == nullptr;
@@ -36,6 +40,11 @@ bool IsAcceptableValue(const std::string& value) {
       if (c < 0x20 || c == 0x7f || c == ';' || c == ',') return false;
    }
    return true;
+}
+
+// A value as kept: acceptable, and without blanks at its ends that reading would trim.
+bool IsStoredValue(const std::string& value) {
+   return IsAcceptableValue(value) && (value.empty() || (value.front() != ' ' && value.back() != ' '));
 }
 
 bool IsStrictValue(const std::string& value) {
@@ -85,6 +94,22 @@ int LeadingNumber(std::string_view token, size_t minDigits, size_t maxDigits, si
       ++used;
    }
    return used < minDigits ? -1 : value;
+}
+
+bool IsValidPath(const std::string& path) {
+   if (path.empty() || path.front() != '/') return false;
+   for (unsigned char c : path) {
+      if (c < 0x20 || c == 0x7f || c == ';') return false;
+   }
+   return true;
+}
+
+// Host names and address literals only: nothing that could end the attribute.
+bool IsValidDomain(const std::string& domain) {
+   for (unsigned char c : domain) {
+      if (!IsAlnum(c) && c != '.' && c != '-' && c != '_' && c != ':') return false;
+   }
+   return true;
 }
 
 }  // namespace
@@ -160,17 +185,39 @@ long long ParseCookieDate(std::string_view text) {
    time_t seconds = timegm(&parts);
    // timegm rolls 31 February over into March: such a day does not exist.
    if (parts.tm_mday != day) return -1;
-   return static_cast<long long>(seconds) * 1000000LL;
+   // Any day before 1970 has passed as surely as the epoch has.
+   return seconds < 0 ? 0 : static_cast<long long>(seconds) * 1000000LL;
 }
 
 CookieImpl::CookieImpl(const std::string& name, const std::string& value)
    : _name(name), _value(value) {}
 
+void CookieImpl::SetValue(const std::string& value) {
+   // Whatever is set here goes into a response header: it must not end the field.
+   if (!IsStoredValue(value)) {
+      throw InvalidArgumentException("cookie value '" + value + "'");
+   }
+   _value = value;
+}
+
+void CookieImpl::SetPath(const std::string& path) {
+   if (!path.empty() && !IsValidPath(path)) throw InvalidArgumentException("cookie path '" + path + "'");
+   _path = path;
+}
+
 void CookieImpl::SetDomain(const std::string& domain) {
    std::string lower;
    for (char c : domain) lower += (c >= 'A' && c <= 'Z') ? static_cast<char>(c - 'A' + 'a') : c;
    if (!lower.empty() && lower.front() == '.') lower.erase(0, 1);
+   if (!IsValidDomain(lower)) throw InvalidArgumentException("cookie domain '" + domain + "'");
    _domain = lower;
+}
+
+void CookieImpl::SetSameSite(const std::string& sameSite) {
+   if (!sameSite.empty() && sameSite != "Strict" && sameSite != "Lax" && sameSite != "None") {
+      throw InvalidArgumentException("cookie SameSite '" + sameSite + "'");
+   }
+   _sameSite = sameSite;
 }
 
 std::string CookieImpl::ToString() const {
@@ -210,9 +257,11 @@ void ApplyAttribute(CookieImpl* cookie, std::string_view name, std::string_view 
       }
       cookie->SetMaxAge(negative ? -seconds : seconds);
    } else if (EqualsIgnoreCase(name, "Domain")) {
-      if (!value.empty()) cookie->SetDomain(std::string(value));
+      std::string domain(value);
+      if (!domain.empty() && domain.front() == '.') domain.erase(0, 1);
+      if (!domain.empty() && IsValidDomain(domain)) cookie->SetDomain(domain);
    } else if (EqualsIgnoreCase(name, "Path")) {
-      if (!value.empty() && value.front() == '/') cookie->SetPath(std::string(value));
+      if (IsValidPath(std::string(value))) cookie->SetPath(std::string(value));
    } else if (EqualsIgnoreCase(name, "Secure")) {
       cookie->SetSecure(true);
    } else if (EqualsIgnoreCase(name, "HttpOnly")) {
@@ -242,7 +291,7 @@ void ParseCookieHeaderString(const std::string& text, bool setCookie, const Cook
       std::string_view name, value;
       if (!SplitPair(rest.substr(0, semi), name, value)) return;
       std::string unquoted = Unquote(value);
-      if (!IsValidName(std::string(name)) || !IsAcceptableValue(unquoted)) return;
+      if (!IsValidName(std::string(name)) || !IsStoredValue(unquoted)) return;
       Ref<CookieImpl> cookie = new CookieImpl(std::string(name), unquoted);
       while (semi != std::string_view::npos) {
          rest = rest.substr(semi + 1);
@@ -263,7 +312,7 @@ void ParseCookieHeaderString(const std::string& text, bool setCookie, const Cook
       if (!SplitPair(pair, name, value)) continue;
       std::string unquoted = Unquote(value);
       std::string nameText(name);
-      if (!IsValidName(nameText) || !IsAcceptableValue(unquoted)) continue;
+      if (!IsValidName(nameText) || !IsStoredValue(unquoted)) continue;
       Ref<CookieImpl> cookie = new CookieImpl(nameText, unquoted);
       callback(cookie.Get());
    }

@@ -14,9 +14,9 @@ public:
 
    const std::string& GetName() const override { return _name; }
    const std::string& GetValue() const override { return _value; }
-   void SetValue(const std::string& value) override { _value = value; }
+   void SetValue(const std::string& value) override;
    const std::string& GetPath() const override { return _path; }
-   void SetPath(const std::string& path) override { _path = path; }
+   void SetPath(const std::string& path) override;
    const std::string& GetDomain() const override { return _domain; }
    void SetDomain(const std::string& domain) override;
    long long GetExpires() const override { return _expires; }
@@ -28,7 +28,7 @@ public:
    bool IsHttpOnly() const override { return _httpOnly; }
    void SetHttpOnly(bool httpOnly) override { _httpOnly = httpOnly; }
    const std::string& GetSameSite() const override { return _sameSite; }
-   void SetSameSite(const std::string& sameSite) override { _sameSite = sameSite; }
+   void SetSameSite(const std::string& sameSite) override;
    using ObjectImpl::ToString;
    std::string ToString() const override;
 

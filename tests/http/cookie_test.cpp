@@ -63,6 +63,28 @@ TEST(CookieTest, SetCookieIgnoresBadAttributesAndSkipsBadCookies) {
    EXPECT_EQ(Parse("x=1; Max-Age=99999999999999999999999", true)[0]->GetMaxAge() > 0, true);
 }
 
+TEST(CookieTest, AttributesThatCouldNotBeWrittenBackAreDropped) {
+   auto cookies = Parse("a=\" x \"; Path=/p", true);
+   EXPECT_TRUE(cookies.empty());
+   cookies = Parse("a=b; Domain=. evil.com; Path=/\x01x", true);
+   ASSERT_EQ(cookies.size(), 1u);
+   EXPECT_EQ(cookies[0]->GetDomain(), "");
+   EXPECT_EQ(cookies[0]->GetPath(), "");
+   EXPECT_EQ(Parse("a=b; Domain=.Good.example", true)[0]->GetDomain(), "good.example");
+   EXPECT_EQ(Parse("a=b; Expires=Thu, 01 Jan 1900 00:00:00 GMT", true)[0]->GetExpires(), 0);
+   // Setters refuse what would end the header field on the wire.
+   Ref<Cookie> cookie;
+   CreateCookie("n", "v", cookie);
+   EXPECT_THROW(cookie->SetPath("/a\r\nX: y"), InvalidArgumentException);
+   EXPECT_THROW(cookie->SetPath("/a; Secure"), InvalidArgumentException);
+   EXPECT_THROW(cookie->SetDomain("a b"), InvalidArgumentException);
+   EXPECT_THROW(cookie->SetValue("v\n"), InvalidArgumentException);
+   EXPECT_THROW(cookie->SetSameSite("lax"), InvalidArgumentException);
+   cookie->SetSameSite("Strict");
+   cookie->SetDomain(".Example.org");
+   EXPECT_EQ(cookie->ToString(), "n=v; Domain=example.org; SameSite=Strict");
+}
+
 TEST(CookieTest, ExpiresDatesInTheFormsBrowsersAccept) {
    const long long expected = 784111777LL * 1000000;  // Sun, 06 Nov 1994 08:49:37 GMT
    EXPECT_EQ(ParseCookieDate("Sun, 06 Nov 1994 08:49:37 GMT"), expected);

@@ -4,6 +4,7 @@
 // SameSite. ParseCookieHeaderString reads the value of a "Cookie" request field (many
 // pairs, no attributes) or of one "Set-Cookie" response field (one pair and its
 // attributes); text that is not a valid cookie is skipped, never an error.
+// Setters refuse (InvalidArgumentException) text that could not go back on the wire.
 // A cookie is not thread-safe; hand out copies, or do not change a shared one.
 
 #include <string>
