@@ -10,15 +10,21 @@ int HeaderScanner::Scan(const char* data, int length) {
    for (int i = 0; i < length; ++i) {
       char c = data[i];
       if (c == '\n') {
-         if (!_lineHasContent && _contentSeen) return i + 1;
+         if (!_lineHasContent && _contentSeen) {
+            _scanned += i + 1;
+            return i + 1;
+         }
          _lineHasContent = false;
+         _lineStart = _scanned + i + 1;
       } else if (c == '\0') {
          throw MalformedHeaderException("invalid value 0 ");
       } else if (c != '\r' && c != ' ') {
+         if (!_contentSeen) _contentStart = _lineStart;
          _lineHasContent = true;
          _contentSeen = true;
       }
    }
+   _scanned += length;
    return -1;
 }
 

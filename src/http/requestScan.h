@@ -13,15 +13,24 @@ public:
    void Reset() {
       _lineHasContent = false;
       _contentSeen = false;
+      _scanned = 0;
+      _lineStart = 0;
+      _contentStart = 0;
    }
    // Scans `length` new bytes. Returns the offset one past the LF that ends the header,
    // or -1 when the end is not among them. MalformedHeaderException "invalid value 0 "
    // for a NUL byte.
    int Scan(const char* data, int length);
+   // Where the first line with content starts, counted over all bytes scanned since
+   // Reset: the blank lines before it are not part of the header.
+   int ContentStart() const { return _contentStart; }
 
 private:
    bool _lineHasContent = false;
    bool _contentSeen = false;
+   int _scanned = 0;
+   int _lineStart = 0;
+   int _contentStart = 0;
 };
 
 class ChunkedBodyDecoder {

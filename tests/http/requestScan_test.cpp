@@ -16,6 +16,10 @@ int ScanAll(const std::string& text) {
 TEST(RequestScanTest, HeaderEndsAtTheFirstBlankLineAfterContent) {
    EXPECT_EQ(ScanAll("GET / HTTP/1.1\r\n\r\nbody"), 18);
    EXPECT_EQ(ScanAll("\r\n\n \r\nGET / HTTP/1.1\r\n\r\n"), 24);
+   HeaderScanner scanner;
+   scanner.Scan("\r\n\n", 3);
+   scanner.Scan(" \r\nG", 4);
+   EXPECT_EQ(scanner.ContentStart(), 6);
    // A line of spaces and CR is blank; LF alone ends lines too.
    EXPECT_EQ(ScanAll("GET / HTTP/1.1\nA: b\n  \r \nrest"), 25);
    EXPECT_EQ(ScanAll("GET / HTTP/1.1\r\nA: b\r\n"), -1);
