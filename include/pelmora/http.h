@@ -5,5 +5,7 @@
 #include "pelmora/http/chunkStreamDecoder.h"
 #include "pelmora/http/cookie.h"
 #include "pelmora/http/header.h"
+#include "pelmora/http/request.h"
+#include "pelmora/http/response.h"
 #include "pelmora/http/responseCode.h"
 #include "pelmora/http/url.h"
