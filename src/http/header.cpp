@@ -2,6 +2,7 @@
 
 #include <cstring>
 #include <ctime>
+#include <string_view>
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/formatter/dateTime.h"
@@ -170,8 +171,10 @@ void Header::ParseFieldLine(const char* begin, const char* end, bool setCookie) 
 }
 
 void Header::FromString(const std::string& text, bool setCookie) {
-   const char* pos = text.data();
-   const char* end = pos + text.size();
+   ParseFields(text.data(), text.data() + text.size(), setCookie);
+}
+
+void Header::ParseFields(const char* pos, const char* end, bool setCookie) {
    // The logical line being gathered; only continuation lines need a copy.
    const char* lineBegin = nullptr;
    const char* lineEnd = nullptr;
@@ -237,10 +240,13 @@ bool RequestHeader::GetCookie(const std::string& name, Ref<Cookie>& out) const {
 
 void RequestHeader::GetCookieList(RefList<Cookie>& out) const { out = _cookies; }
 
-void RequestHeader::FromString(const std::string& text) {
+void RequestHeader::FromString(const std::string& text) { FromString(text.data(), text.size()); }
+
+void RequestHeader::FromString(const char* data, size_t length) {
    ClearHeader();
+   std::string_view text(data, length);
    size_t lineEnd = text.find("\r\n");
-   std::string_view line(text.data(), lineEnd == std::string::npos ? text.size() : lineEnd);
+   std::string_view line(text.data(), lineEnd == std::string_view::npos ? text.size() : lineEnd);
    struct MethodName {
       const char* name;
       size_t length;
@@ -264,8 +270,8 @@ void RequestHeader::FromString(const std::string& text) {
    _method = matched->method;
    _path = URLDecode(std::string(begin, space ? space : end));
    _version = line.find("HTTP/1.1") != std::string_view::npos ? kVersion11 : kVersion10;
-   if (lineEnd != std::string::npos && lineEnd + 2 < text.size()) {
-      Header::FromString(text.substr(lineEnd + 2), false);
+   if (lineEnd != std::string_view::npos && lineEnd + 2 < text.size()) {
+      ParseFields(data + lineEnd + 2, data + length, false);
    }
 }
 
@@ -351,7 +357,7 @@ void ClientResponseHeader::FromString(const std::string& text) {
    if (code < -2147483648LL || code > 2147483647LL) throw NumberRangeException();
    _code = static_cast<int>(code);
    if (lineEnd != std::string::npos && lineEnd + 2 < text.size()) {
-      Header::FromString(text.substr(lineEnd + 2), true);
+      ParseFields(text.data() + lineEnd + 2, text.data() + text.size(), true);
    }
 }
 

@@ -132,7 +132,7 @@ bool RequestImpl::ScanPending() {
       int end = _scanned + found;
       _scanned = end;
       int start = _scanner.ContentStart();
-      _header.FromString(std::string(_area + start, static_cast<size_t>(end - start)));
+      _header.FromString(_area + start, static_cast<size_t>(end - start));
       _leftover = end;
       _leftoverCount = _used - end;
       _chunked = _header.IsChunkedTransferEncoding();

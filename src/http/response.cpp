@@ -202,8 +202,8 @@ void ResponseImpl::PrependHeader() {
       size_t numWritten = _buffer->Prepend(head.data(), headLen);
       PELMORA_VERIFY(numWritten == headLen);
    } else {
-      int numWritten = _stream->Write(head.data(), static_cast<int>(headLen));
-      PELMORA_VERIFY(headLen == static_cast<size_t>(numWritten));
+      size_t numWritten = static_cast<size_t>(_stream->Write(head.data(), static_cast<int>(headLen)));
+      PELMORA_VERIFY(headLen == numWritten);
    }
    _headerSent = true;
 }

@@ -77,6 +77,7 @@ public:
    void FromString(const std::string& text, bool setCookie);
 
 protected:
+   void ParseFields(const char* begin, const char* end, bool setCookie);
    void ParseFieldLine(const char* begin, const char* end, bool setCookie);
    void StoreField(std::string name, std::string value, bool setCookie);
    // Keeps the parsed "Content-Length" in step with the field.
@@ -107,6 +108,7 @@ public:
    // Replaces the header with the request line and the fields of `text`. NotSupportedException for a method other
    // than GET, PUT, POST, HEAD, DELETE and CONNECT; the exceptions of Header::FromString.
    void FromString(const std::string& text);
+   void FromString(const char* text, size_t length);
 
 private:
    int _method = UNKNOWN;
