@@ -15,10 +15,20 @@ bool IsAlnum(unsigned char c) {
    return (c >= '0' && c <= '9') || (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z');
 }
 
-bool IsTokenChar(unsigned char c) {
-   if (c <= 0x20 || c >= 0x7f) return false;
-   return std::strchr("()<>@,;:\\\"/[]?={}", c) == nullptr;
-}
+struct TokenTable {
+   bool token[256];
+   constexpr TokenTable() : token() {
+      const char separators[] = "()<>@,;:\\\"/[]?={}";
+      for (int c = 0x21; c < 0x7f; ++c) {
+         bool separator = false;
+         for (const char* p = separators; *p != 0; ++p) separator = separator || *p == c;
+         token[c] = !separator;
+      }
+   }
+};
+constexpr TokenTable kToken;
+
+bool IsTokenChar(unsigned char c) { return kToken.token[c]; }
 
 bool IsCookieOctet(unsigned char c) {
    return c == 0x21 || (c >= 0x23 && c <= 0x2b) || (c >= 0x2d && c <= 0x3a) ||

@@ -21,7 +21,7 @@ void TrimRange(const char*& begin, const char*& end) {
    while (end > begin && IsSpace(end[-1])) --end;
 }
 
-bool EqualsIgnoreCase(const std::string& a, const char* b) {
+bool EqualsIgnoreCase(std::string_view a, const char* b) {
    size_t n = std::strlen(b);
    if (a.size() != n) return false;
    for (size_t i = 0; i < n; ++i) {
@@ -53,12 +53,26 @@ const char kContentLength[] = "Content-Length";
 
 }  // namespace
 
-bool CaseInsensitiveStringLess::operator()(const std::string& a, const std::string& b) const noexcept {
+namespace {
+
+struct LowerTable {
+   unsigned char map[256];
+   constexpr LowerTable() : map() {
+      for (int c = 0; c < 256; ++c) map[c] = static_cast<unsigned char>(c >= 'A' && c <= 'Z' ? c + 32 : c);
+   }
+};
+constexpr LowerTable kLower;
+
+}  // namespace
+
+bool CaseInsensitiveStringLess::operator()(std::string_view a, std::string_view b) const noexcept {
    size_t n = a.size() < b.size() ? a.size() : b.size();
+   const unsigned char* x = reinterpret_cast<const unsigned char*>(a.data());
+   const unsigned char* y = reinterpret_cast<const unsigned char*>(b.data());
    for (size_t i = 0; i < n; ++i) {
-      unsigned char x = Lower(a[i]);
-      unsigned char y = Lower(b[i]);
-      if (x != y) return x < y;
+      unsigned char p = kLower.map[x[i]];
+      unsigned char q = kLower.map[y[i]];
+      if (p != q) return p < q;
    }
    return a.size() < b.size();
 }
@@ -84,6 +98,16 @@ std::string HttpDateFormatter::ToString() const {
    return text;
 }
 
+Header::Header(const Header& other)
+   : _fields(other._fields), _cookies(other._cookies), _contentLength(other._contentLength) {}
+
+Header& Header::operator=(const Header& other) {
+   _fields = other._fields;
+   _cookies = other._cookies;
+   _contentLength = other._contentLength;
+   return *this;
+}
+
 Header::~Header() = default;
 
 bool Header::GetField(const std::string& name, std::string& value) const {
@@ -106,6 +130,9 @@ void Header::RemoveField(const std::string& name) {
 void Header::GetFields(FieldMap& out) const { out = _fields; }
 
 void Header::ClearHeader() {
+   while (!_fields.empty() && _spareNodes.size() < kMaxSpareNodes) {
+      _spareNodes.push_back(_fields.extract(_fields.begin()));
+   }
    _fields.clear();
    _cookies.clear();
    _contentLength = -1;
@@ -143,18 +170,25 @@ void Header::FieldChanged(const std::string& name) {
    _contentLength = length;
 }
 
-void Header::StoreField(std::string name, std::string value, bool setCookie) {
+void Header::StoreField(std::string_view name, std::string_view value, bool setCookie) {
    if (EqualsIgnoreCase(name, setCookie ? "Set-Cookie" : "Cookie")) {
-      ParseCookieHeaderString(value, setCookie, [this](Cookie* cookie) { AddCookie(cookie); });
+      ParseCookieHeaderString(std::string(value), setCookie, [this](Cookie* cookie) { AddCookie(cookie); });
    }
-   auto [at, inserted] = _fields.try_emplace(std::move(name));
-   if (inserted) {
-      at->second = std::move(value);
-   } else {
+   // One descent finds the field or the place for it.
+   auto at = _fields.lower_bound(name);
+   if (at != _fields.end() && !_fields.key_comp()(name, at->first)) {
       // Repeated fields are one list (RFC 9110, 5.3); two Content-Length values then no
       // longer read as a number, which refuses a request that could be framed two ways.
       at->second += ", ";
       at->second += value;
+   } else if (!_spareNodes.empty()) {
+      FieldMap::node_type node = std::move(_spareNodes.back());
+      _spareNodes.pop_back();
+      node.key().assign(name);
+      node.mapped().assign(value);
+      at = _fields.insert(at, std::move(node));
+   } else {
+      at = _fields.emplace_hint(at, std::string(name), std::string(value));
    }
    FieldChanged(at->first);
 }
@@ -167,7 +201,8 @@ void Header::ParseFieldLine(const char* begin, const char* end, bool setCookie) 
    TrimRange(begin, nameEnd);
    TrimRange(valueBegin, end);
    if (begin == nameEnd) return;
-   StoreField(std::string(begin, nameEnd), std::string(valueBegin, end), setCookie);
+   StoreField(std::string_view(begin, static_cast<size_t>(nameEnd - begin)),
+              std::string_view(valueBegin, static_cast<size_t>(end - valueBegin)), setCookie);
 }
 
 void Header::FromString(const std::string& text, bool setCookie) {

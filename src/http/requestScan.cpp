@@ -7,22 +7,34 @@
 namespace Pelmora::Http {
 
 int HeaderScanner::Scan(const char* data, int length) {
-   for (int i = 0; i < length; ++i) {
-      char c = data[i];
-      if (c == '\n') {
-         if (!_lineHasContent && _contentSeen) {
-            _scanned += i + 1;
-            return i + 1;
+   // Line by line with memchr rather than byte by byte: this runs for every request.
+   // A NUL fails the header only when it comes before the header's end (body bytes
+   // read along with the header may hold any byte).
+   const char* nul = static_cast<const char*>(std::memchr(data, '\0', static_cast<size_t>(length)));
+   const int nulAt = nul != nullptr ? static_cast<int>(nul - data) : length;
+   int i = 0;
+   while (i < length) {
+      const char* lf = static_cast<const char*>(std::memchr(data + i, '\n', static_cast<size_t>(length - i)));
+      int stop = lf != nullptr ? static_cast<int>(lf - data) : length;
+      if (nulAt < stop) throw MalformedHeaderException("invalid value 0 ");
+      if (!_lineHasContent) {
+         for (int j = i; j < stop; ++j) {
+            if (data[j] != ' ' && data[j] != '\r') {
+               if (!_contentSeen) _contentStart = _lineStart;
+               _lineHasContent = true;
+               _contentSeen = true;
+               break;
+            }
          }
-         _lineHasContent = false;
-         _lineStart = _scanned + i + 1;
-      } else if (c == '\0') {
-         throw MalformedHeaderException("invalid value 0 ");
-      } else if (c != '\r' && c != ' ') {
-         if (!_contentSeen) _contentStart = _lineStart;
-         _lineHasContent = true;
-         _contentSeen = true;
       }
+      if (lf == nullptr) break;
+      if (!_lineHasContent && _contentSeen) {
+         _scanned += stop + 1;
+         return stop + 1;
+      }
+      _lineHasContent = false;
+      _lineStart = _scanned + stop + 1;
+      i = stop + 1;
    }
    _scanned += length;
    return -1;

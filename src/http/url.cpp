@@ -26,6 +26,7 @@ void AppendEscape(std::string& out, unsigned char c, const char* digits) {
 }
 
 std::string DecodeHex(const std::string& text, bool plusIsSpace) {
+   if (text.find_first_of(plusIsSpace ? "%+" : "%") == std::string::npos) return text;
    std::string out;
    out.reserve(text.size());
    for (size_t i = 0; i < text.size(); ++i) {

@@ -6,6 +6,8 @@
 
 #include <map>
 #include <string>
+#include <string_view>
+#include <vector>
 
 #include "pelmora/exception/throwable.h"
 #include "pelmora/formatter/printable.h"
@@ -16,9 +18,10 @@
 
 namespace Pelmora::Http {
 
-// ASCII case-insensitive ordering of field names.
+// ASCII case-insensitive ordering of field names; looks up by any string type.
 struct PELMORA_EXPORT CaseInsensitiveStringLess {
-   bool operator()(const std::string& a, const std::string& b) const noexcept;
+   using is_transparent = void;
+   bool operator()(std::string_view a, std::string_view b) const noexcept;
 };
 
 using FieldMap = std::map<std::string, std::string, CaseInsensitiveStringLess>;
@@ -45,8 +48,8 @@ private:
 class PELMORA_EXPORT Header {
 public:
    Header() = default;
-   Header(const Header&) = default;
-   Header& operator=(const Header&) = default;
+   Header(const Header& other);
+   Header& operator=(const Header& other);
    virtual ~Header();
 
    // True when the field is present.
@@ -79,13 +82,19 @@ public:
 protected:
    void ParseFields(const char* begin, const char* end, bool setCookie);
    void ParseFieldLine(const char* begin, const char* end, bool setCookie);
-   void StoreField(std::string name, std::string value, bool setCookie);
+   void StoreField(std::string_view name, std::string_view value, bool setCookie);
    // Keeps the parsed "Content-Length" in step with the field.
    void FieldChanged(const std::string& name);
 
    FieldMap _fields;
    RefList<Cookie> _cookies;
    long long _contentLength = -1;
+
+private:
+   // Map nodes kept from cleared fields, strings and all, so that a header read again on
+   // a kept-alive connection allocates next to nothing.
+   static constexpr size_t kMaxSpareNodes = 64;
+   std::vector<FieldMap::node_type> _spareNodes;
 };
 
 class PELMORA_EXPORT RequestHeader : public Header {
