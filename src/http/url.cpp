@@ -2,6 +2,9 @@
 
 #include <boost/regex.hpp>
 
+#include <cstring>
+#include <string_view>
+
 #include "pelmora/exception/exceptions.h"
 
 namespace Pelmora::Http {
@@ -44,16 +47,6 @@ std::string DecodeHex(const std::string& text, bool plusIsSpace) {
    return out;
 }
 
-// Boost gives up on expressions that backtrack too much (std::runtime_error); callers
-// treat that as no match.
-bool MatchSafely(const std::string& text, boost::smatch& match, const boost::regex& expression) {
-   try {
-      return boost::regex_match(text, match, expression);
-   } catch (const std::runtime_error&) {
-      return false;
-   }
-}
-
 const boost::regex& UriExpression() {
    static const boost::regex expression("^(([^:/?#]+):)?(//([^/?#]*))?([^?#]*)(\\?([^#]*))?(#(.*))?");
    return expression;
@@ -64,6 +57,51 @@ const boost::regex& AuthorityExpression() {
       "^((([\\w.~-]?(%[0-9a-fA-F][0-9a-fA-F])?[!$&'()*+,;=]?[:]?)+)@)?"
       "((([\\w.~-]?(%[0-9a-fA-F][0-9a-fA-F])?[!$&'()*+,;=]?)+)(:([0-9]+))?)$");
    return expression;
+}
+
+// Whether `text` is made of the authority's characters: letters, digits, "_.~-", "%"
+// with two hex digits, the sub-delimiters and, when `colonAllowed`, ":".
+bool IsAuthorityText(std::string_view text, bool colonAllowed) {
+   for (size_t i = 0; i < text.size(); ++i) {
+      unsigned char c = static_cast<unsigned char>(text[i]);
+      if (IsAlnum(c) || (c != 0 && std::strchr("_.~-!$&'()*+,;=", c) != nullptr)) continue;
+      if (c == ':' && colonAllowed) continue;
+      if (c == '%' && i + 2 < text.size() && HexValue(text[i + 1]) >= 0 && HexValue(text[i + 2]) >= 0) {
+         i += 2;
+         continue;
+      }
+      return false;
+   }
+   return true;
+}
+
+// The authority expression nests optional groups inside a repetition, so a near miss
+// makes the matcher try every way of splitting the text; the same language is checked
+// here in one pass first, and only text that will match goes to the expression.
+bool CouldBeAuthority(std::string_view authority, std::string& userInfo, std::string& host, std::string& port) {
+   size_t at = authority.find('@');
+   std::string_view hostPort = authority;
+   std::string_view user;
+   if (at != std::string_view::npos) {
+      user = authority.substr(0, at);
+      if (!IsAuthorityText(user, true)) return false;
+      hostPort = authority.substr(at + 1);
+   }
+   std::string_view portText;
+   size_t colon = hostPort.find(':');
+   if (colon != std::string_view::npos) {
+      portText = hostPort.substr(colon + 1);
+      if (portText.empty()) return false;
+      for (char c : portText) {
+         if (c < '0' || c > '9') return false;
+      }
+      hostPort = hostPort.substr(0, colon);
+   }
+   if (!IsAuthorityText(hostPort, false)) return false;
+   userInfo.assign(user);
+   host.assign(hostPort);
+   port.assign(portText);
+   return true;
 }
 
 }  // namespace
@@ -170,11 +208,20 @@ bool ParseURI(const std::string& uri, std::string& scheme, std::string& authorit
 
 bool ParseURIAuthority(const std::string& authority, std::string& userInfo, std::string& host,
                        std::string& port) {
+   std::string splitUser, splitHost, splitPort;
+   if (!CouldBeAuthority(authority, splitUser, splitHost, splitPort)) return false;
    boost::smatch match;
-   if (!MatchSafely(authority, match, AuthorityExpression()) || match.size() != 11) return false;
-   userInfo = match[2].str();
-   host = match[6].str();
-   port = match[10].str();
+   try {
+      if (!boost::regex_match(authority, match, AuthorityExpression()) || match.size() != 11) return false;
+      userInfo = match[2].str();
+      host = match[6].str();
+      port = match[10].str();
+   } catch (const std::runtime_error&) {
+      // A long text the expression gives up on; the one-pass split found the same parts.
+      userInfo = splitUser;
+      host = splitHost;
+      port = splitPort;
+   }
    return true;
 }
 

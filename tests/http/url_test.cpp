@@ -69,8 +69,19 @@ TEST(UrlTest, ParseAuthority) {
    EXPECT_EQ(port, "");
    EXPECT_FALSE(ParseURIAuthority("bad host", user, host, port));
    EXPECT_FALSE(ParseURIAuthority("host:port", user, host, port));
-   // A long run of characters that each optional group could take must not hang.
-   EXPECT_FALSE(ParseURIAuthority(std::string(3000, 'a') + " ", user, host, port));
+   EXPECT_TRUE(ParseURIAuthority("a%41!:x@h%2e_~-.com", user, host, port));
+   EXPECT_EQ(user, "a%41!:x");
+   EXPECT_EQ(host, "h%2e_~-.com");
+   EXPECT_FALSE(ParseURIAuthority("a@b@c", user, host, port));
+   EXPECT_FALSE(ParseURIAuthority("h%4", user, host, port));
+   EXPECT_FALSE(ParseURIAuthority("h:", user, host, port));
+   // Near misses that make the expression try every split of a long text.
+   std::string run;
+   for (int i = 0; i < 3000; ++i) run += "a.!";
+   EXPECT_FALSE(ParseURIAuthority(run + "\x7f", user, host, port));
+   EXPECT_FALSE(ParseURIAuthority(run + ":" + run + "@@", user, host, port));
+   EXPECT_TRUE(ParseURIAuthority(run + ":1", user, host, port));
+   EXPECT_EQ(port, "1");
 }
 
 TEST(UrlTest, ParseHttpUrl) {
