@@ -122,6 +122,16 @@ bool IsValidDomain(const std::string& domain) {
    return true;
 }
 
+// Lower case without the one leading dot a server may send. False for a domain that
+// would not read back the same once written: empty, more leading dots, or characters
+// that are not a host name's.
+bool NormaliseDomain(const std::string& domain, std::string& out) {
+   out.clear();
+   for (char c : domain) out += (c >= 'A' && c <= 'Z') ? static_cast<char>(c - 'A' + 'a') : c;
+   if (!out.empty() && out.front() == '.') out.erase(0, 1);
+   return !out.empty() && out.front() != '.' && IsValidDomain(out);
+}
+
 }  // namespace
 
 // The tolerant date reading browsers apply to Expires: tokens in any order, the first
@@ -216,11 +226,13 @@ void CookieImpl::SetPath(const std::string& path) {
 }
 
 void CookieImpl::SetDomain(const std::string& domain) {
-   std::string lower;
-   for (char c : domain) lower += (c >= 'A' && c <= 'Z') ? static_cast<char>(c - 'A' + 'a') : c;
-   if (!lower.empty() && lower.front() == '.') lower.erase(0, 1);
-   if (!IsValidDomain(lower)) throw InvalidArgumentException("cookie domain '" + domain + "'");
-   _domain = lower;
+   if (domain.empty()) {
+      _domain.clear();
+      return;
+   }
+   std::string normalised;
+   if (!NormaliseDomain(domain, normalised)) throw InvalidArgumentException("cookie domain '" + domain + "'");
+   _domain = normalised;
 }
 
 void CookieImpl::SetSameSite(const std::string& sameSite) {
@@ -267,9 +279,8 @@ void ApplyAttribute(CookieImpl* cookie, std::string_view name, std::string_view 
       }
       cookie->SetMaxAge(negative ? -seconds : seconds);
    } else if (EqualsIgnoreCase(name, "Domain")) {
-      std::string domain(value);
-      if (!domain.empty() && domain.front() == '.') domain.erase(0, 1);
-      if (!domain.empty() && IsValidDomain(domain)) cookie->SetDomain(domain);
+      std::string domain;
+      if (NormaliseDomain(std::string(value), domain)) cookie->SetDomain(domain);
    } else if (EqualsIgnoreCase(name, "Path")) {
       if (IsValidPath(std::string(value))) cookie->SetPath(std::string(value));
    } else if (EqualsIgnoreCase(name, "Secure")) {
