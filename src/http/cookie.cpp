@@ -52,9 +52,11 @@ bool IsAcceptableValue(const std::string& value) {
    return true;
 }
 
-// A value as kept: acceptable, and without blanks at its ends that reading would trim.
+// A value as kept: acceptable, without blanks at its ends that reading would trim and
+// without quotes that reading would take off again.
 bool IsStoredValue(const std::string& value) {
-   return IsAcceptableValue(value) && (value.empty() || (value.front() != ' ' && value.back() != ' '));
+   return IsAcceptableValue(value) && value.find('"') == std::string::npos &&
+          (value.empty() || (value.front() != ' ' && value.back() != ' '));
 }
 
 bool IsStrictValue(const std::string& value) {

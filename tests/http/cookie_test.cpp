@@ -66,6 +66,9 @@ TEST(CookieTest, SetCookieIgnoresBadAttributesAndSkipsBadCookies) {
 TEST(CookieTest, AttributesThatCouldNotBeWrittenBackAreDropped) {
    auto cookies = Parse("a=\" x \"; Path=/p", true);
    EXPECT_TRUE(cookies.empty());
+   // A quoted value that is itself quoted would lose its quotes when read again.
+   EXPECT_TRUE(Parse("b=\"\"b=\"\"", true).empty());
+   EXPECT_TRUE(Parse("b=\"\"b=\"\"", false).empty());
    cookies = Parse("a=b; Domain=. evil.com; Path=/\x01x", true);
    ASSERT_EQ(cookies.size(), 1u);
    EXPECT_EQ(cookies[0]->GetDomain(), "");
