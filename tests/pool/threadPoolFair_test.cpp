@@ -219,12 +219,15 @@ TEST_F(ThreadPoolFairTest, AnUrgentLevelRunsWhileLowerLevelsSaturateThePool) {
       low->Enqueue([&] { gate.Pass(); });
       lower->Enqueue([&] { gate.Pass(); });
    }
-   // Level 5 may leave 2 of 6 slots free (3 running), level 15 then none: 3 + 0 blocked.
-   WaitFor([&] { return gate.Waiting() == 3; }, "the lower levels to saturate");
+   // Level 5 leaves at least 2 of 6 slots free; level 15 may take one of them only while
+   // level 5 runs fewer than 3 (the reservation grows with every 3 running). So the lower
+   // levels hold 3 or 4 slots, depending on which level a worker reached first.
+   WaitFor([&] { return gate.Waiting() >= 3; }, "the lower levels to saturate");
    std::atomic<int> urgentDone{0};
    for (int i = 0; i < 50; ++i) urgent->Enqueue([&] { ++urgentDone; });
    WaitFor([&] { return urgentDone.load() == 50; }, "the urgent items");
-   EXPECT_EQ(3, gate.Waiting());
+   EXPECT_GE(gate.Waiting(), 3);
+   EXPECT_LE(gate.Waiting(), 4);
    EXPECT_LE(pool->GetThreadCount(), 6);
    gate.Open();
    WaitFor([&] { return low->GetQueueSize() == 0 && lower->GetQueueSize() == 0; }, "the lower items");
