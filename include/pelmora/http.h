@@ -9,3 +9,6 @@
 #include "pelmora/http/response.h"
 #include "pelmora/http/responseCode.h"
 #include "pelmora/http/url.h"
+
+// The server: service and request handlers.
+#include "pelmora/http/httpSvc.h"

@@ -1,0 +1,131 @@
+#pragma once
+// The server's internals, shared by the service, its connections and their tests.
+
+#include <chrono>
+#include <condition_variable>
+#include <memory>
+#include <mutex>
+#include <regex>
+#include <set>
+#include <thread>
+
+#include "pelmora/http/httpSvc.h"
+
+namespace Pelmora::Http {
+
+class HttpSvcImpl;
+
+// One accepted stream: reads a request, dispatches it, and after a kept-alive response
+// reads the next one. Driven by one chain of completions at a time.
+class HttpConnectionImpl : public virtual HttpConnection, public ObjectImpl {
+public:
+   enum State { WAITING = 0, BUSY = 1, CLOSED = 2 };
+
+   HttpConnectionImpl(HttpSvcImpl* svc, System::Stream* stream);
+
+   void Begin();
+   const HttpSvcConfig& GetHttpSvcConfig() const;
+   long long GetReadTimeout() const;
+   bool IsAuthenticated() const { return _authenticated; }
+   void InitClientCapabilities();
+   void GetClientCapabilities(ClientCapabilities& out) override { out = _capabilities; }
+   long long GetMaxBufferedResponseBytes() override;
+   void ResponseCompleted(bool keepAlive) override;
+   // Closes the stream; the pending read ends the connection.
+   void Close(const char* why);
+   // Whether the connection waits with no part of a request received.
+   bool IsIdle();
+   // Whether a request header has been arriving for longer than `limit` microseconds.
+   bool IsOverdue(std::chrono::steady_clock::time_point now, long long limit);
+   State GetState();
+   System::Stream* GetStream() const { return _stream.Get(); }
+   // The stream wrapper reports received bytes here.
+   void BytesArrived();
+
+private:
+   void Next();
+   void HeaderDone(Exception* error, bool gotRequest);
+   bool Process(Exception* error, bool gotRequest);
+   bool Dispatch();
+   bool FinishRequest();
+   void End();
+
+   Ref<HttpSvcImpl> _svc;
+   Ref<System::Stream> _stream;
+   Ref<Request> _request;
+   Ref<Response> _response;
+   Ref<Service::Logger> _logger;
+   ClientCapabilities _capabilities;
+   bool _authenticated = false;
+   bool _firstRequest = true;
+   bool _completed = false;
+   bool _completedKeepAlive = false;
+
+   std::mutex _mutex;
+   State _state = WAITING;
+   bool _starting = false;
+   bool _syncDone = false;
+   std::unique_ptr<Exception> _syncError;
+   bool _syncGot = false;
+   std::chrono::steady_clock::time_point _firstByte;
+   bool _haveFirstByte = false;
+};
+
+class HttpSvcImpl : public virtual HttpSvc, public ObjectImpl {
+public:
+   HttpSvcImpl(System::ServerSocket* socket, Service::Logger* logger, Service::Config::View* view);
+   ~HttpSvcImpl() override;
+
+   void Start() override;
+   void Stop() override;
+   void SetRequestHandler(RequestHandler* handler) override;
+   void GetRequestHandler(Ref<RequestHandler>& out) override;
+   void AddRequestHandler(const std::string& path, RequestHandler* handler) override;
+   void RemoveRequestHandler(const std::string& path) override;
+   long long GetDefaultReadTimeout() override { return _config.defaultReadTimeout; }
+   long long GetDefaultWriteTimeout() override { return _config.defaultWriteTimeout; }
+   long long GetAuthenticatedReadTimeout() override { return _config.authenticatedReadTimeout; }
+   long long GetAuthenticatedWriteTimeout() override { return _config.authenticatedWriteTimeout; }
+   int GetConnectionCount() override;
+   std::string ToString() const override;
+
+   const HttpSvcConfig& GetConfig() const { return _config; }
+   Service::Logger* GetLogger() const { return _logger.Get(); }
+   bool IsRunning();
+   // The handler for `path` and whether it is the default one.
+   bool FindHandler(const std::string& path, Ref<RequestHandler>& out);
+   void ConnectionEnded(HttpConnectionImpl* connection);
+   // The compiled agent expressions; an empty expression matches nothing.
+   bool IsNonChunkingAgent(const std::string& agent) const;
+   bool NeedsContentLength(const std::string& agent) const;
+
+private:
+   void IssueAccept();
+   void AcceptHttpConn(System::ServerSocket* socket, Exception* error, System::Stream* stream);
+   void Watch();
+   void CompileAgents(Service::Config::View* view);
+
+   Ref<Service::Logger> _logger;
+   HttpSvcConfig _config;
+   std::regex _nonChunking;
+   std::regex _needsLength;
+   bool _haveNonChunking = false;
+   bool _haveNeedsLength = false;
+
+   std::mutex _mutex;
+   Ref<System::ServerSocket> _socket;
+   Ref<RequestHandler> _defaultHandler;
+   RequestHandlerMap _handlers;
+   enum OpState { STOPPED = 0, STARTED = 1 } _opState = STOPPED;
+   bool _acceptPending = false;
+   std::set<Ref<HttpConnectionImpl>> _connections;
+   std::condition_variable _changed;
+   std::thread _watcher;
+   bool _watcherStop = false;
+};
+
+// Whether `text` is well-formed UTF-8 (no overlong forms, surrogates or values past
+// U+10FFFF).
+bool IsValidUtf8(const std::string& text);
+
+}  // namespace Pelmora::Http

@@ -1,0 +1,422 @@
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <fstream>
+#include <memory>
+#include <thread>
+#include <vector>
+
+#include "pelmora/exception/exceptions.h"
+#include "pelmora/http/httpSvc.h"
+#include "pelmora/service/config.h"
+#include "src/http/httpSvcImpl.h"
+#include "tests/support/httpClient.h"
+#include "tests/support/netFixture.h"
+#include "tests/support/watchdog.h"
+
+namespace Pelmora::Http {
+namespace {
+
+using System::NetTesting::DefaultLogCapture;
+using System::NetTesting::EnsurePool;
+using System::NetTesting::WaitFor;
+using Testing::RawClient;
+using Testing::RunCommand;
+
+class Handler : public RequestHandlerMixin, public ObjectImpl {
+public:
+   explicit Handler(std::string name) : _name(std::move(name)) {}
+   void HandleGet(Request* request, Response* response) override {
+      if (request->GetPath() == "/slow") {
+         started = true;
+         std::this_thread::sleep_for(std::chrono::milliseconds(300));
+      }
+      if (request->GetPath() == "/fail") throw InvalidStateException("handler broke");
+      std::string text = _name + " " + request->GetPath();
+      response->GetHeader().SetContentType("text/plain");
+      response->Write(text.data(), static_cast<int>(text.size()));
+      response->Complete();
+   }
+   void HandlePost(Request* request, Response* response) override {
+      std::string body;
+      char piece[4096];
+      for (int n; (n = request->Read(piece, sizeof piece)) > 0;) body.append(piece, static_cast<size_t>(n));
+      std::string text = "posted " + std::to_string(body.size()) + " " + body.substr(0, 32);
+      response->Write(text.data(), static_cast<int>(text.size()));
+      response->Complete();
+   }
+   std::atomic<bool> started{false};
+
+private:
+   std::string _name;
+};
+
+Ref<Service::Logger> TestLogger() {
+   static Ref<Service::Logger> logger = [] {
+      Ref<Service::Logger> made;
+      Service::GetDefaultLogger()->CreateLogger("httpTest", 0x7F, made);
+      return made;
+   }();
+   return logger;
+}
+
+Ref<Service::Config::View> Settings(const std::vector<std::pair<std::string, std::string>>& values) {
+   Ref<Service::Config> config;
+   Service::CreateScratchConfig(config);
+   Ref<Service::Config::View> view;
+   config->GetView("pelmora/http", view);
+   for (const auto& [key, value] : values) view->Set(key, value.c_str());
+   return view;
+}
+
+class HttpSvcTest : public ::testing::Test {
+protected:
+   void SetUp() override { EnsurePool(); }
+   void TearDown() override {
+      if (_svc) _svc->Stop();
+   }
+   void StartServer(const std::vector<std::pair<std::string, std::string>>& values = {}) {
+      Ref<System::ServerSocket> socket;
+      System::CreateTcpServerSocket("127.0.0.1", 0, System::ServerSocketOptions(), socket);
+      Ref<System::BindingInfo> local;
+      socket->GetBindingInfo(local);
+      _port = local->GetPort();
+      CreateHttpSvc(socket.Get(), TestLogger().Get(), Settings(values).Get(), _svc);
+      _default = new Handler("default");
+      _sdk = new Handler("sdk");
+      _svc->SetRequestHandler(_default.Get());
+      _svc->AddRequestHandler("/sdk", _sdk.Get());
+      _svc->Start();
+   }
+   std::string Url(const std::string& path) { return "http://127.0.0.1:" + std::to_string(_port) + path; }
+   std::string Get(const std::string& path) {
+      RawClient client(_port);
+      client.Send("GET " + path + " HTTP/1.1\r\nHost: x\r\nConnection: close\r\n\r\n");
+      return client.ReadResponse();
+   }
+
+   Ref<HttpSvc> _svc;
+   Ref<Handler> _default;
+   Ref<Handler> _sdk;
+   int _port = 0;
+};
+
+TEST(LookupByPrefixTest, ShorterPrefixesAreTriedInOrder) {
+   Ref<RequestHandler> a(new Handler("a")), root(new Handler("root")), ab(new Handler("ab"));
+   RequestHandlerMap handlers{{"/sdk", a}, {"/", root}, {"/a/b", ab}};
+   Ref<RequestHandler> out;
+   EXPECT_TRUE(LookupByPrefix("/sdk/", handlers, out));
+   EXPECT_EQ(out, a);
+   EXPECT_TRUE(LookupByPrefix("/sdk?x=1", handlers, out));
+   EXPECT_EQ(out, a);
+   EXPECT_TRUE(LookupByPrefix("/sdk/deeper/more#frag", handlers, out));
+   EXPECT_EQ(out, a);
+   EXPECT_TRUE(LookupByPrefix("/a/b/", handlers, out));
+   EXPECT_EQ(out, ab);
+   // "/" is only ever an exact match.
+   EXPECT_TRUE(LookupByPrefix("/", handlers, out));
+   EXPECT_EQ(out, root);
+   EXPECT_FALSE(LookupByPrefix("/other", handlers, out));
+   EXPECT_FALSE(LookupByPrefix("/sdkx", handlers, out));
+   EXPECT_FALSE(LookupByPrefix("", handlers, out));
+   EXPECT_FALSE(LookupByPrefix("noslash", handlers, out));
+}
+
+TEST(LookupByPrefixTest, LogsEachCandidate) {
+   DefaultLogCapture log;
+   RequestHandlerMap handlers{{"/a", Ref<RequestHandler>(new Handler("a"))}};
+   Ref<RequestHandler> out;
+   LookupByPrefix("/a/b/", handlers, out, TestLogger().Get());
+   std::string text = log.Text();
+   EXPECT_NE(text.find("Lookup handler by prefix for: /a/b/"), std::string::npos);
+   size_t first = text.find("Inspecting path: /a/b/"), second = text.find("Inspecting path: /a/b\n");
+   EXPECT_NE(first, std::string::npos);
+   EXPECT_NE(second, std::string::npos);
+   EXPECT_LT(first, second);
+   EXPECT_NE(text.find("Found matching path: /a"), std::string::npos);
+}
+
+TEST(HttpSvcConfigTest, DefaultsAndOverrides) {
+   HttpSvcConfig defaults(TestLogger().Get(), nullptr);
+   EXPECT_EQ(defaults.defaultReadTimeout, 45000000);
+   EXPECT_EQ(defaults.defaultWriteTimeout, 45000000);
+   EXPECT_EQ(defaults.authenticatedReadTimeout, 1200000000LL);
+   EXPECT_EQ(defaults.authenticatedWriteTimeout, 1800000000LL);
+   EXPECT_TRUE(defaults.xFrameOptionsEnabled);
+   EXPECT_EQ(defaults.xFrameOptions, "DENY");
+
+   DefaultLogCapture log;
+   HttpSvcConfig set(TestLogger().Get(), Settings({{"readTimeoutMs", "-1"},
+                                                   {"writeTimeoutMs", "0"},
+                                                   {"authenticatedReadTimeoutMs", "250"},
+                                                   {"maxBufferedResponseBytes", "4096"},
+                                                   {"XFrameOptionsHeader", "ALLOW-FROM https://a.example"},
+                                                   {"EnableXFrameOptionsHeader", "false"}})
+                                              .Get());
+   EXPECT_EQ(set.defaultReadTimeout, -1);
+   EXPECT_EQ(set.defaultWriteTimeout, 0);
+   EXPECT_EQ(set.authenticatedReadTimeout, 250000);
+   EXPECT_EQ(set.maxBufferedResponseBytes, 4096);
+   EXPECT_EQ(set.xFrameOptions, "ALLOW-FROM https://a.example");
+   EXPECT_FALSE(set.xFrameOptionsEnabled);
+   EXPECT_TRUE(log.Contains("Setting readTimeoutMs to disabled"));
+   EXPECT_TRUE(log.Contains("Setting writeTimeoutMs to 0 ms"));
+   EXPECT_TRUE(log.Contains("Setting authenticatedReadTimeoutMs to 250 ms"));
+   EXPECT_TRUE(log.Contains("Max buffered response size is 4096 bytes"));
+}
+
+TEST(HttpSvcConfigTest, BadFrameOptionsAndAgentExpressionsFallBack) {
+   EnsurePool();
+   DefaultLogCapture log;
+   HttpSvcConfig frame(TestLogger().Get(), Settings({{"XFrameOptionsHeader", "allow"}}).Get());
+   EXPECT_EQ(frame.xFrameOptions, "DENY");
+   EXPECT_TRUE(log.Contains(
+       "Invalid value provided for X-Frame-Options response header: allow. Set to default value."));
+
+   Ref<HttpSvc> svc;
+   CreateHttpSvc(nullptr, TestLogger().Get(),
+                 Settings({{"nonChunkingAgents", "Bad(Agent"}, {"agentsNeedingContentLength", ""}}).Get(), svc);
+   auto* impl = dynamic_cast<HttpSvcImpl*>(svc.Get());
+   EXPECT_TRUE(log.Contains("Unable to parse nonChunkingAgents: 'Bad(Agent'.  Using default: '"));
+   EXPECT_TRUE(log.Contains("Parameter agentsNeedingContentLength is empty"));
+   EXPECT_TRUE(impl->IsNonChunkingAgent("Norvex-desktop/7.1"));
+   EXPECT_FALSE(impl->IsNonChunkingAgent("curl/8.0 Norvex-desktop/7.1"));
+   EXPECT_FALSE(impl->NeedsContentLength("Norvex-client/3.2"));
+
+   CreateHttpSvc(nullptr, TestLogger().Get(), Settings({{"agentsNeedingContentLength", "Tool/.*"}}).Get(), svc);
+   EXPECT_TRUE(log.Contains("Loaded agentsNeedingContentLength: 'Tool/.*'"));
+   EXPECT_TRUE(log.Contains("Using default for nonChunkingAgents: '"));
+   EXPECT_TRUE(dynamic_cast<HttpSvcImpl*>(svc.Get())->NeedsContentLength("Tool/1"));
+}
+
+TEST_F(HttpSvcTest, StartRefusesWithoutSocketOrHandlerAndDescribesItself) {
+   Ref<HttpSvc> svc;
+   CreateHttpSvc(nullptr, TestLogger().Get(), nullptr, svc);
+   try {
+      svc->Start();
+      ADD_FAILURE() << "started without a socket";
+   } catch (const InvalidStateException& e) {
+      EXPECT_EQ(e.GetMessage(), "ServerSocket not set");
+   }
+   Ref<System::ServerSocket> socket;
+   System::CreateTcpServerSocket("127.0.0.1", 0, System::ServerSocketOptions(), socket);
+   CreateHttpSvc(socket.Get(), TestLogger().Get(), nullptr, svc);
+   try {
+      svc->Start();
+      ADD_FAILURE() << "started without a handler";
+   } catch (const InvalidStateException& e) {
+      EXPECT_EQ(e.GetMessage(), "No RequestHandler has been set");
+   }
+   std::string text = svc->ToString();
+   EXPECT_EQ(text.rfind("HttpSvcImpl @0x", 0), 0u) << text;
+   EXPECT_NE(text.find(" {_logger=["), std::string::npos) << text;
+   EXPECT_NE(text.find(", _socket=listening 127.0.0.1:"), std::string::npos) << text;
+   EXPECT_NE(text.find(", _defaultRequestHandler=(null), _opState=0}"), std::string::npos) << text;
+   socket->Close();
+}
+
+TEST_F(HttpSvcTest, DispatchesByPrefixAndKeepsConnectionsAlive) {
+   DefaultLogCapture log;
+   StartServer();
+   _svc->Start();
+   EXPECT_TRUE(log.Contains("Request to start ignored, already started"));
+   EXPECT_TRUE(log.Contains("Http Service started: HttpSvcImpl @"));
+
+   RawClient client(_port);
+   ASSERT_TRUE(client.Connected());
+   client.Send("GET /sdk/ HTTP/1.1\r\nHost: x\r\n\r\n");
+   std::string first = client.ReadResponse();
+   EXPECT_NE(first.find("HTTP/1.1 200"), std::string::npos) << first;
+   EXPECT_NE(first.find("X-Frame-Options: DENY"), std::string::npos) << first;
+   EXPECT_NE(first.find("sdk /sdk/"), std::string::npos) << first;
+   // The same connection serves the next request, pipelined ones in order.
+   client.Send("GET /sdk?x=1 HTTP/1.1\r\nHost: x\r\n\r\nGET /other HTTP/1.1\r\nHost: x\r\n\r\n");
+   EXPECT_NE(client.ReadResponse().find("sdk /sdk?x=1"), std::string::npos);
+   EXPECT_NE(client.ReadResponse().find("default /other"), std::string::npos);
+   EXPECT_TRUE(log.Contains("ProcessRequest: using default handler"));
+   client.Send("POST /echo HTTP/1.1\r\nHost: x\r\nContent-Length: 5\r\n\r\nhello");
+   EXPECT_NE(client.ReadResponse().find("posted 5 hello"), std::string::npos);
+   EXPECT_EQ(_svc->GetConnectionCount(), 1);
+}
+
+TEST_F(HttpSvcTest, Http10ClosesUnlessKeepAliveIsAsked) {
+   StartServer();
+   RawClient plain(_port);
+   plain.Send("GET /a HTTP/1.0\r\n\r\n");
+   std::string response = plain.ReadResponse();
+   EXPECT_NE(response.find("default /a"), std::string::npos) << response;
+   EXPECT_TRUE(plain.Closed());
+
+   RawClient kept(_port);
+   kept.Send("GET /a HTTP/1.0\r\nConnection: Keep-Alive\r\n\r\n");
+   EXPECT_NE(kept.ReadResponse().find("default /a"), std::string::npos);
+   kept.Send("GET /b HTTP/1.0\r\nConnection: Keep-Alive\r\n\r\n");
+   EXPECT_NE(kept.ReadResponse().find("default /b"), std::string::npos);
+
+   RawClient closing(_port);
+   closing.Send("GET /c HTTP/1.1\r\nConnection: close\r\n\r\n");
+   EXPECT_NE(closing.ReadResponse().find("default /c"), std::string::npos);
+   EXPECT_TRUE(closing.Closed());
+}
+
+TEST_F(HttpSvcTest, BadRequestsEndTheirConnectionOnly) {
+   DefaultLogCapture log;
+   StartServer({{"maxHeaderFields", "4"}, {"maxRequestBodyBytes", "100"}});
+   {
+      RawClient client(_port);
+      client.Send("BREW /pot HTTP/1.1\r\nHost: x\r\n\r\n");
+      EXPECT_NE(client.ReadResponse().find("HTTP/1.1 501"), std::string::npos);
+      EXPECT_TRUE(log.Contains("HTTP parser failed: "));
+   }
+   {
+      RawClient client(_port);
+      client.Send("GET / HTTP/1.1\r\nX-Big: " + std::string(Request::kHeaderAreaSize, 'a') + "\r\n\r\n");
+      EXPECT_TRUE(client.Closed());
+      EXPECT_TRUE(WaitFor([&] { return log.Contains("Ill-formed header on stream 0x"); }, "log line"));
+   }
+   {
+      RawClient client(_port);
+      client.Send("GET / HTTP/1.1\r\nA: 1\r\nB: 2\r\nC: 3\r\nD: 4\r\nE: 5\r\n\r\n");
+      EXPECT_NE(client.ReadResponse().find("HTTP/1.1 431"), std::string::npos);
+      EXPECT_TRUE(client.Closed());
+   }
+   {
+      RawClient client(_port);
+      client.Send("POST / HTTP/1.1\r\nContent-Length: 101\r\n\r\n");
+      EXPECT_NE(client.ReadResponse().find("HTTP/1.1 413"), std::string::npos);
+   }
+   {
+      RawClient client(_port);
+      client.Send("GET /caf\xC3 HTTP/1.1\r\n\r\n");
+      EXPECT_NE(client.ReadResponse().find("HTTP/1.1 400"), std::string::npos);
+   }
+   {
+      RawClient client(_port);
+      client.Send("GET /fail HTTP/1.1\r\n\r\n");
+      EXPECT_NE(client.ReadResponse().find("HTTP/1.1 500"), std::string::npos);
+      EXPECT_TRUE(log.Contains("HTTP Transaction failed on stream 0x"));
+   }
+   {
+      // HEAD is not served by the test handler: the base class refuses it.
+      RawClient client(_port);
+      client.Send("HEAD /sdk HTTP/1.1\r\n\r\n");
+      EXPECT_NE(client.ReadResponse(true).find("HTTP/1.1 400"), std::string::npos);
+      EXPECT_TRUE(log.Contains("UnimplementedRequestHandler: HTTP method HEAD not supported for URI /sdk"));
+   }
+   EXPECT_NE(Get("/still").find("default /still"), std::string::npos);
+}
+
+TEST_F(HttpSvcTest, IdleClientsTimeOutButDoNotHoldThreads) {
+   long long tick = System::GetStreamTimeoutTick();
+   System::SetStreamTimeoutTick(20000);
+   StartServer({{"readTimeoutMs", "100"}});
+   {
+      // Far more idle connections than pool threads, and requests still get through.
+      std::vector<std::unique_ptr<RawClient>> idle;
+      for (int i = 0; i < 200; ++i) idle.push_back(std::make_unique<RawClient>(_port));
+      EXPECT_NE(Get("/busy").find("default /busy"), std::string::npos);
+      // The connections that never sent a request are closed by their time-out.
+      EXPECT_TRUE(idle.front()->Closed());
+      EXPECT_TRUE(WaitFor([&] { return _svc->GetConnectionCount() == 0; }, "idle connections closed"));
+   }
+   System::SetStreamTimeoutTick(tick);
+}
+
+TEST_F(HttpSvcTest, SlowlorisIsClosedWhileOthersAreServed) {
+   DefaultLogCapture log;
+   StartServer({{"requestDeadlineMs", "300"}});
+   RawClient slow(_port, 3000);
+   std::string request = "GET /slowly HTTP/1.1\r\nHost: x\r\nX-Padding: aaaaaaaaaaaaaaaaaaaaaaaaaaaaaaaa\r\n\r\n";
+   auto began = std::chrono::steady_clock::now();
+   bool cut = false;
+   for (char c : request) {
+      if (!slow.Send(std::string(1, c))) {
+         cut = true;
+         break;
+      }
+      EXPECT_NE(Get("/other").find("default /other"), std::string::npos);
+      std::this_thread::sleep_for(std::chrono::milliseconds(100));
+      if (std::chrono::steady_clock::now() - began > std::chrono::seconds(2)) break;
+   }
+   EXPECT_TRUE(cut || slow.Closed());
+   EXPECT_TRUE(log.Contains("Request not complete within 300 ms; closing stream"));
+}
+
+TEST_F(HttpSvcTest, ConnectionLimitMakesNewClientsWait) {
+   StartServer({{"maxConnections", "2"}});
+   RawClient a(_port), b(_port);
+   a.Send("GET /a HTTP/1.1\r\n\r\n");
+   b.Send("GET /b HTTP/1.1\r\n\r\n");
+   EXPECT_NE(a.ReadResponse().find("default /a"), std::string::npos);
+   EXPECT_NE(b.ReadResponse().find("default /b"), std::string::npos);
+   RawClient waiting(_port, 300);
+   waiting.Send("GET /c HTTP/1.1\r\nConnection: close\r\n\r\n");
+   EXPECT_EQ(waiting.ReadResponse(), "");  // still in the backlog
+   EXPECT_EQ(_svc->GetConnectionCount(), 2);
+   a.Send("GET /a HTTP/1.1\r\nConnection: close\r\n\r\n");
+   EXPECT_NE(a.ReadResponse().find("default /a"), std::string::npos);
+   RawClient patient(_port);
+   patient.Send("GET /d HTTP/1.1\r\nConnection: close\r\n\r\n");
+   EXPECT_NE(patient.ReadResponse().find("default /d"), std::string::npos);
+}
+
+TEST_F(HttpSvcTest, StopFinishesRequestsInFlightAndClosesIdleAtOnce) {
+   DefaultLogCapture log;
+   StartServer({{"shutdownDeadlineMs", "3000"}});
+   RawClient idle(_port);
+   RawClient busy(_port);
+   busy.Send("GET /slow HTTP/1.1\r\n\r\n");
+   ASSERT_TRUE(WaitFor([&] { return _default->started.load(); }, "slow request started"));
+   auto began = std::chrono::steady_clock::now();
+   _svc->Stop();
+   EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(2));
+   EXPECT_NE(busy.ReadResponse().find("default /slow"), std::string::npos);
+   EXPECT_TRUE(idle.Closed());
+   EXPECT_TRUE(log.Contains("Stopped HTTP service"));
+   EXPECT_FALSE(log.Contains("at shutdown with a request in progress"));
+   EXPECT_EQ(_svc->GetConnectionCount(), 0);
+}
+
+TEST_F(HttpSvcTest, StopPastItsDeadlineClosesWithALogLine) {
+   DefaultLogCapture log;
+   StartServer({{"shutdownDeadlineMs", "50"}});
+   RawClient busy(_port);
+   busy.Send("GET /slow HTTP/1.1\r\n\r\n");
+   ASSERT_TRUE(WaitFor([&] { return _default->started.load(); }, "slow request started"));
+   _svc->Stop();
+   EXPECT_TRUE(log.Contains("at shutdown with a request in progress"));
+   EXPECT_TRUE(WaitFor([&] { return _svc->GetConnectionCount() == 0; }, "connection gone"));
+}
+
+TEST_F(HttpSvcTest, RealClientsReuseConnectionsAndUploadChunked) {
+   StartServer();
+   std::string out = RunCommand("curl -sv --max-time 5 " + Url("/one") + " " + Url("/two") + " 2>&1");
+   EXPECT_NE(out.find("default /one"), std::string::npos) << out;
+   EXPECT_NE(out.find("default /two"), std::string::npos) << out;
+   EXPECT_NE(out.find("Re-using existing connection"), std::string::npos) << out;
+
+   out = RunCommand("curl -s --http1.0 --max-time 5 " + Url("/old"));
+   EXPECT_EQ(out, "default /old");
+
+   out = RunCommand("printf 'abcdefgh' | curl -s --max-time 5 -H 'Transfer-Encoding: chunked' --data-binary @- " +
+                    Url("/up"));
+   EXPECT_EQ(out, "posted 8 abcdefgh");
+
+   out = RunCommand("curl -sI --max-time 5 " + Url("/sdk"));
+   EXPECT_NE(out.find("400"), std::string::npos) << out;
+
+   std::string script =
+       "import http.client,sys\n"
+       "c=http.client.HTTPConnection('127.0.0.1'," + std::to_string(_port) + ",timeout=5)\n"
+       "for p in ('/p1','/sdk/p2'):\n"
+       "  c.request('GET',p); r=c.getresponse(); sys.stdout.write(r.read().decode()+'|')\n"
+       "c.request('POST','/p3',body=b'x'*70000); r=c.getresponse(); sys.stdout.write(r.read().decode()[:9])\n";
+   std::string path = ::testing::TempDir() + "httpsvc_client.py";
+   std::ofstream(path) << script;
+   out = RunCommand("python3 " + path);
+   EXPECT_EQ(out, "default /p1|sdk /sdk/p2|posted 70") << out;
+}
+
+}  // namespace
+}  // namespace Pelmora::Http
