@@ -10,5 +10,6 @@
 #include "pelmora/http/responseCode.h"
 #include "pelmora/http/url.h"
 
-// The server: service and request handlers.
+// The server: service, request handlers and the document handler.
+#include "pelmora/http/documentHandler.h"
 #include "pelmora/http/httpSvc.h"
