@@ -51,7 +51,7 @@ using RequestHandlerMap = std::unordered_map<std::string, Ref<RequestHandler>>;
 PELMORA_EXPORT bool LookupByPrefix(const std::string& path, const RequestHandlerMap& handlers,
                                    Ref<RequestHandler>& out, Service::Logger* logger = nullptr);
 
-// The service's settings, read once from "pelmora/http" (see docs/http.md for the keys).
+// The service's settings, read once from "pelmora/http" (keys and defaults: docs/http.md).
 // Immutable after construction and shared by every connection.
 class PELMORA_EXPORT HttpSvcConfig {
 public:
