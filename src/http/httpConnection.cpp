@@ -1,3 +1,4 @@
+#include <atomic>
 #include <cstdio>
 #include <vector>
 
@@ -44,9 +45,13 @@ public:
       _inner->GetBindingInfo(type, local, peer);
    }
    void CloseNoLock() override { _inner->CloseNoLock(); }
-   int Write(const char* buffer, int length) override { return _inner->Write(buffer, length); }
+   int Write(const char* buffer, int length) override {
+      _written.fetch_add(length, std::memory_order_relaxed);
+      return _inner->Write(buffer, length);
+   }
    void AsyncWrite(const char* buffer, int length,
                    const System::Functor<void, System::Stream*, Exception*>& callback) override {
+      _written.fetch_add(length, std::memory_order_relaxed);
       Ref<WatchedStream> self(this);
       _inner->AsyncWrite(buffer, length, [self, callback](System::Stream*, Exception* e) { callback(self.Get(), e); });
    }
@@ -64,9 +69,12 @@ public:
       });
    }
    void Close() override { _inner->Close(); }
+   // Bytes handed to the stream for writing so far.
+   long long Written() const { return _written.load(std::memory_order_relaxed); }
 
 private:
    Ref<System::Stream> _inner;
+   std::atomic<long long> _written{0};
    HttpConnectionImpl* _connection;  // owns this stream
 };
 
@@ -74,6 +82,17 @@ std::string StreamName(System::Stream* stream) {
    char text[32];
    std::snprintf(text, sizeof text, "%p", static_cast<const void*>(stream));
    return text;
+}
+
+const char* MethodName(int method) {
+   switch (method) {
+      case RequestHeader::GET: return "GET";
+      case RequestHeader::HEAD: return "HEAD";
+      case RequestHeader::POST: return "POST";
+      case RequestHeader::PUT: return "PUT";
+      case RequestHeader::DELETE: return "DELETE";
+      default: return "OTHER";
+   }
 }
 
 }  // namespace
@@ -222,7 +241,21 @@ bool HttpConnectionImpl::Process(Exception* error, bool gotRequest) {
    }
    _firstRequest = false;
    _completed = false;
+   auto began = std::chrono::steady_clock::now();
+   auto* watched = dynamic_cast<WatchedStream*>(_stream.Get());
+   long long writtenBefore = watched->Written();
    bool next = Dispatch();
+   if (GetHttpSvcConfig().accessLog) {
+      long long micros =
+          std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::steady_clock::now() - began).count();
+      Ref<System::BindingInfo> local, peer;
+      _stream->GetBindingInfo(typeid(System::BindingInfo), local, peer);
+      PELMORA_LOG_INFO(_logger.Get(), "%1 %2 %3 %4 %5 %6", MethodName(_request->GetMethod()), _request->GetPath(),
+                       _response->GetHeader().GetResponseCode().code,
+                       watched->Written() - writtenBefore, micros,
+                       peer ? peer->GetAddress() + ":" + std::to_string(peer->GetPort()) : std::string("-"));
+   }
+   if (next) next = FinishRequest();
    if (!next) End();
    return next;
 }
@@ -280,7 +313,7 @@ bool HttpConnectionImpl::Dispatch() {
       }
       return false;
    }
-   return FinishRequest();
+   return _completed && _completedKeepAlive;
 }
 
 // After a kept-alive response: skip what the handler left of the body, rearm the

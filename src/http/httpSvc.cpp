@@ -57,6 +57,7 @@ HttpSvcConfig::HttpSvcConfig(Logger* logger, Service::Config::View* view) {
       PELMORA_LOG_INFO(logger, "Max header fields is %1", maxHeaderFields);
    if (view->Get("maxConnections", &maxConnections))
       PELMORA_LOG_INFO(logger, "Max open connections is %1", maxConnections);
+   if (view->Get("accessLog", &accessLog)) PELMORA_LOG_INFO(logger, "Access log is %1", accessLog ? "on" : "off");
    view->Get("EnableXFrameOptionsHeader", &xFrameOptionsEnabled);
    std::string frame;
    if (view->Get("XFrameOptionsHeader", &frame)) {
@@ -147,18 +148,22 @@ HttpSvcImpl::HttpSvcImpl(System::ServerSocket* socket, Logger* logger, Service::
    CompileAgents(view);
 }
 
-HttpSvcImpl::~HttpSvcImpl() {
+HttpSvcImpl::~HttpSvcImpl() { StopWatcher(); }
+
+void HttpSvcImpl::StopWatcher() {
+   std::thread watcher;
    {
       std::lock_guard<std::mutex> lock(_mutex);
       _watcherStop = true;
+      watcher.swap(_watcher);
    }
    _changed.notify_all();
-   if (_watcher.joinable()) {
-      if (_watcher.get_id() == std::this_thread::get_id())
-         _watcher.detach();
-      else
-         _watcher.join();
-   }
+   if (!watcher.joinable()) return;
+   // The watcher may hold the last reference and so end the service on its own thread.
+   if (watcher.get_id() == std::this_thread::get_id())
+      watcher.detach();
+   else
+      watcher.join();
 }
 
 void HttpSvcImpl::CompileAgents(Service::Config::View* view) {
@@ -217,7 +222,8 @@ void HttpSvcImpl::Start() {
    }
    _opState = STARTED;
    _watcherStop = false;
-   if (!_watcher.joinable()) _watcher = std::thread([this] { Watch(); });
+   // The watcher keeps the service alive until Stop, as the pending accept does.
+   if (!_watcher.joinable()) _watcher = std::thread([self = Ref<HttpSvcImpl>(this)] { self->Watch(); });
    lock.unlock();
    IssueAccept();
    PELMORA_LOG_INFO(_logger.Get(), "Http Service started: %1", ToString());
@@ -334,6 +340,7 @@ void HttpSvcImpl::Stop() {
    }
    if (socket) socket->Close();
    PELMORA_LOG_INFO(_logger.Get(), "Stopped HTTP service");
+   StopWatcher();
    for (auto& connection : connections)
       if (connection->IsIdle()) connection->Close("idle");
    connections.clear();

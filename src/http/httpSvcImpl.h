@@ -103,6 +103,7 @@ private:
    void IssueAccept();
    void AcceptHttpConn(System::ServerSocket* socket, Exception* error, System::Stream* stream);
    void Watch();
+   void StopWatcher();
    void CompileAgents(Service::Config::View* view);
 
    Ref<Service::Logger> _logger;

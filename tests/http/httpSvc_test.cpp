@@ -240,6 +240,29 @@ TEST_F(HttpSvcTest, DispatchesByPrefixAndKeepsConnectionsAlive) {
    EXPECT_EQ(_svc->GetConnectionCount(), 1);
 }
 
+TEST_F(HttpSvcTest, AccessLogIsOffUnlessAsked) {
+   DefaultLogCapture log;
+   StartServer();
+   EXPECT_NE(Get("/quiet").find("default /quiet"), std::string::npos);
+   _svc->Stop();
+   EXPECT_FALSE(log.Contains("GET /quiet 200"));
+   StartServer({{"accessLog", "true"}, {"maxRequestBodyBytes", "100"}});
+   EXPECT_NE(Get("/sdk/x?y=1").find("sdk /sdk/x?y=1"), std::string::npos);
+   RawClient client(_port);
+   client.Send("POST /big HTTP/1.1\r\nContent-Length: 200\r\n\r\n");
+   EXPECT_NE(client.ReadResponse().find("413"), std::string::npos);
+   ASSERT_TRUE(WaitFor([&] { return log.Contains("POST /big 413 "); }, "access line of the refused request"));
+   std::string text = log.Text();
+   size_t line = text.find("GET /sdk/x?y=1 200 ");
+   ASSERT_NE(line, std::string::npos) << text;
+   std::string rest = text.substr(line, text.find('\n', line) - line);
+   // Status, the bytes of the whole answer, microseconds and the peer.
+   EXPECT_NE(rest.find(" 127.0.0.1:"), std::string::npos) << rest;
+   long long bytes = std::stoll(rest.substr(std::string("GET /sdk/x?y=1 200 ").size()));
+   EXPECT_GT(bytes, 100);
+   EXPECT_LT(bytes, 400);
+}
+
 TEST_F(HttpSvcTest, Http10ClosesUnlessKeepAliveIsAsked) {
    StartServer();
    RawClient plain(_port);

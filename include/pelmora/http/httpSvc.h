@@ -72,6 +72,7 @@ public:
    long long requestDeadline = 30000000;
    int maxConnections = 10000;
    long long shutdownDeadline = 10000000;
+   bool accessLog = false;
 };
 
 class PELMORA_EXPORT HttpSvc : public virtual Object {
