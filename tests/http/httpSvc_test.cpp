@@ -330,17 +330,32 @@ TEST_F(HttpSvcTest, BadRequestsEndTheirConnectionOnly) {
    EXPECT_NE(Get("/still").find("default /still"), std::string::npos);
 }
 
-TEST_F(HttpSvcTest, IdleClientsTimeOutButDoNotHoldThreads) {
+TEST_F(HttpSvcTest, ThousandsOfIdleConnectionsDoNotHoldThreads) {
+   StartServer();
+   std::vector<std::unique_ptr<RawClient>> idle;
+   for (int i = 0; i < 2000; ++i) idle.push_back(std::make_unique<RawClient>(_port));
+   ASSERT_TRUE(WaitFor([&] { return _svc->GetConnectionCount() == 2000; }, "2000 connections accepted"));
+   // Far more idle connections than pool threads, and requests still get through.
+   EXPECT_NE(Get("/busy").find("default /busy"), std::string::npos);
+   idle[7]->Send("GET /late HTTP/1.1\r\n\r\n");
+   EXPECT_NE(idle[7]->ReadResponse().find("default /late"), std::string::npos);
+   idle.clear();
+   EXPECT_TRUE(WaitFor([&] { return _svc->GetConnectionCount() == 0; }, "closed connections ended"));
+}
+
+TEST_F(HttpSvcTest, IdleClientsTimeOut) {
    long long tick = System::GetStreamTimeoutTick();
    System::SetStreamTimeoutTick(20000);
    StartServer({{"readTimeoutMs", "100"}});
    {
-      // Far more idle connections than pool threads, and requests still get through.
-      std::vector<std::unique_ptr<RawClient>> idle;
-      for (int i = 0; i < 200; ++i) idle.push_back(std::make_unique<RawClient>(_port));
-      EXPECT_NE(Get("/busy").find("default /busy"), std::string::npos);
-      // The connections that never sent a request are closed by their time-out.
-      EXPECT_TRUE(idle.front()->Closed());
+      RawClient silent(_port);
+      RawClient between(_port);
+      between.Send("GET /one HTTP/1.1\r\n\r\n");
+      EXPECT_NE(between.ReadResponse().find("default /one"), std::string::npos);
+      // Neither the client that never asked nor the one that went quiet after its
+      // answer is kept.
+      EXPECT_TRUE(silent.Closed());
+      EXPECT_TRUE(between.Closed());
       EXPECT_TRUE(WaitFor([&] { return _svc->GetConnectionCount() == 0; }, "idle connections closed"));
    }
    System::SetStreamTimeoutTick(tick);
