@@ -16,6 +16,10 @@
 #include <boost/asio/steady_timer.hpp>
 #include <boost/asio/strand.hpp>
 
+#include <algorithm>
+#include <deque>
+#include <set>
+
 #include "pelmora/system/ssl.h"
 #include "src/net/socketImpl.h"
 
@@ -104,31 +108,164 @@ Exception* HandshakeFailure(const boost::system::error_code& error, SslSocket& s
    return failure.release();
 }
 
-class SslServerSocket : public ServerSocketImpl<Tcp> {
+// Accepts connections in the background and runs their handshakes side by side, each
+// with its own time-out, so that a client that never speaks cannot hold up the others.
+// Outcomes (streams or handshake failures) queue in the order they finish until an
+// accept takes them; connections in handshake plus queued outcomes stay within
+// `maxPendingAccepts`. The object is its own lock; handshakes run on their strands and
+// report back under it.
+class SslServerSocket : public virtual ServerSocket, public LockableObjectImpl {
 public:
-   SslServerSocket(Tcp::acceptor&& acceptor, const ServerSocketOptions& options, SslContextImpl* context)
-       : ServerSocketImpl<Tcp>(std::move(acceptor), options), _context(context) {}
+   using Callback = Functor<void, ServerSocket*, Exception*, Stream*>;
 
-protected:
-   boost::asio::any_io_executor AcceptExecutor() override {
-      return boost::asio::make_strand(GetPoolIoContext());
+   SslServerSocket(Tcp::acceptor&& acceptor, const ServerSocketOptions& options, SslContextImpl* context)
+       : _options(options), _acceptor(std::move(acceptor)), _context(context) {
+      _local = MakeBindingInfo(_acceptor.local_endpoint());
+      _limit = static_cast<size_t>(std::max(1, options.maxPendingAccepts));
    }
 
-   void MakeStream(Tcp::socket&& socket, const std::function<void(Exception*, Stream*)>& done) override {
-      SetNoDelay(socket);
-      struct Handshake {
-         Handshake(Tcp::socket&& tcp, boost::asio::ssl::context& context)
-             : stream(std::move(tcp), context), timer(stream.get_executor()) {}
-         SslSocket stream;
-         boost::asio::steady_timer timer;
-         bool finished = false;
+   void AsyncAccept(const Callback& callback) override { Wait(callback); }
+
+   void Accept(long long microseconds, Ref<Stream>& out) override {
+      struct Result {
+         OperationWait wait;
+         Ref<Stream> stream;
+         std::unique_ptr<Exception> failure;
       };
-      auto handshake = std::make_shared<Handshake>(std::move(socket), _context->Get());
+      auto result = std::make_shared<Result>();
+      unsigned long long ticket = Wait([result](ServerSocket*, Exception* error, Stream* stream) {
+         if (error != nullptr) result->failure.reset(error->Clone());
+         result->stream = stream;
+         result->wait.Done({});
+      });
+      if (!result->wait.WaitUntil(DeadlineAfter(microseconds))) {
+         {
+            Synchronized lock(this);
+            // Withdrawn before an outcome reached it: the background accepting goes on and
+            // what it finds waits for the next caller.
+            if (_waiting && _ticket == ticket) {
+               _waiting = false;
+               _waiter = Callback();
+               throw TimeoutException("Operation timed out");
+            }
+         }
+         result->wait.WaitDone();
+      }
+      if (result->failure) result->failure->Throw();
+      out = result->stream;
+   }
+
+   void GetBindingInfo(Ref<BindingInfo>& local) override { local = _local; }
+
+   void Close() override {
+      std::deque<Outcome> dropped;
+      {
+         Synchronized lock(this);
+         if (_closed) return;
+         _closed = true;
+         boost::system::error_code ignored;
+         _acceptor.close(ignored);
+         for (const std::shared_ptr<Handshake>& handshake : _handshakes) {
+            // The handshake's own completion then sees the socket closed and lets go of it.
+            boost::asio::post(handshake->stream.get_executor(), [handshake] {
+               boost::system::error_code ignored;
+               handshake->stream.lowest_layer().close(ignored);
+            });
+         }
+         dropped.swap(_ready);
+         if (_waiting) {
+            _waiting = false;
+            Deliver(_waiter, Outcome());
+            _waiter = Callback();
+         }
+      }
+      for (Outcome& outcome : dropped) {
+         if (outcome.stream) outcome.stream->Close();
+      }
+   }
+
+   using ObjectImpl::ToString;
+   std::string ToString() const override { return "listening tls " + _local->ToString(); }
+
+private:
+   struct Handshake {
+      Handshake(Tcp::socket&& tcp, boost::asio::ssl::context& context)
+          : stream(std::move(tcp), context), timer(stream.get_executor()) {}
+      SslSocket stream;
+      boost::asio::steady_timer timer;
+      bool finished = false;
+   };
+   // A finished handshake, or a failed accept; both empty: the socket was closed.
+   struct Outcome {
+      Ref<Stream> stream;
+      std::shared_ptr<Exception> failure;
+   };
+
+   // Registers the one waiting accept and returns its ticket.
+   unsigned long long Wait(const Callback& callback) {
+      Synchronized lock(this);
+      if (_closed) throw InvalidStateException("Server socket closed");
+      if (_waiting) throw InProgressException();
+      _waiting = true;
+      _waiter = callback;
+      _started = true;
+      unsigned long long ticket = ++_ticket;
+      Pump();
+      return ticket;
+   }
+
+   // Under the lock: hands a queued outcome to the waiter and keeps the accepts going.
+   void Pump() {
+      if (_waiting && !_ready.empty()) {
+         _waiting = false;
+         Deliver(_waiter, std::move(_ready.front()));
+         _waiter = Callback();
+         _ready.pop_front();
+      }
+      AcceptMore();
+   }
+
+   // Under the lock: one raw accept at a time while there is room.
+   void AcceptMore() {
+      if (_closed || !_started || _accepting || _handshakes.size() + _ready.size() >= _limit) return;
+      _accepting = true;
+      Ref<SslServerSocket> self(this);
+      // Each connection gets its own strand: the OpenSSL engine serves both directions.
+      _acceptor.async_accept(boost::asio::make_strand(GetPoolIoContext()),
+                             [self](const boost::system::error_code& error, Tcp::socket socket) {
+                                self->Accepted(error, std::move(socket));
+                             });
+   }
+
+   void Accepted(const boost::system::error_code& error, Tcp::socket&& socket) {
+      std::shared_ptr<Handshake> handshake;
+      {
+         Synchronized lock(this);
+         _accepting = false;
+         if (_closed) return;
+         if (error) {
+            _ready.push_back(Outcome{nullptr, std::shared_ptr<Exception>(MakeStreamException(error))});
+         } else {
+            try {
+               SetCloseOnExec(socket.native_handle());
+               SetNoDelay(socket);
+               handshake = std::make_shared<Handshake>(std::move(socket), _context->Get());
+               _handshakes.insert(handshake);
+            } catch (const Exception& e) {
+               _ready.push_back(Outcome{nullptr, std::shared_ptr<Exception>(e.Clone())});
+            }
+         }
+         // A failing acceptor (out of descriptors) fills the queue with failures and then
+         // rests until an accept takes one.
+         Pump();
+      }
+      if (handshake) StartHandshake(handshake);
+   }
+
+   void StartHandshake(const std::shared_ptr<Handshake>& handshake) {
       long long limit = _options.handshakeTimeoutMicroseconds;
-      Ref<ServerSocketImpl<Tcp>> self(this);
-      // Inside the connection's strand; the result leaves it, so that the callback may
-      // use the stream synchronously.
-      boost::asio::dispatch(handshake->stream.get_executor(), [handshake, limit, done, self] {
+      Ref<SslServerSocket> self(this);
+      boost::asio::dispatch(handshake->stream.get_executor(), [handshake, limit, self] {
          if (limit >= 0) {
             handshake->timer.expires_after(std::chrono::microseconds(limit));
             handshake->timer.async_wait([handshake](const boost::system::error_code& error) {
@@ -137,24 +274,71 @@ protected:
                handshake->stream.lowest_layer().close(ignored);
             });
          }
-         handshake->stream.async_handshake(
-             boost::asio::ssl::stream_base::server, [handshake, done](const boost::system::error_code& error) {
-                handshake->finished = true;
-                handshake->timer.cancel();
-                std::shared_ptr<Exception> failure;
-                Ref<SslGenericStream> stream;
-                if (error) {
-                   failure.reset(HandshakeFailure(error, handshake->stream));
-                } else {
-                   stream = MakeSslStream(std::move(handshake->stream));
-                }
-                boost::asio::post(GetPoolIoContext(), [done, failure, stream] { done(failure.get(), stream.Get()); });
-             });
+         handshake->stream.async_handshake(boost::asio::ssl::stream_base::server,
+                                           [handshake, self](const boost::system::error_code& error) {
+                                              self->HandshakeDone(handshake, error);
+                                           });
       });
    }
 
-private:
+   // On the connection's strand.
+   void HandshakeDone(const std::shared_ptr<Handshake>& handshake, const boost::system::error_code& error) {
+      handshake->finished = true;
+      handshake->timer.cancel();
+      Outcome outcome;
+      if (error) {
+         outcome.failure.reset(HandshakeFailure(error, handshake->stream));
+      } else {
+         outcome.stream = MakeSslStream(std::move(handshake->stream));
+      }
+      {
+         Synchronized lock(this);
+         _handshakes.erase(handshake);
+         if (!_closed) {
+            _ready.push_back(std::move(outcome));
+            Pump();
+            return;
+         }
+      }
+      if (outcome.stream) outcome.stream->Close();
+   }
+
+   // Under the lock. The callback runs on a pool thread, off every strand, so that it may
+   // use the stream synchronously. An outcome that meets a closed socket is dropped and
+   // the accept fails as Close promises.
+   void Deliver(const Callback& callback, Outcome&& outcome) {
+      Ref<SslServerSocket> self(this);
+      boost::asio::post(GetPoolIoContext(), [self, callback,
+                                             outcome = std::move(outcome)]() mutable {
+         bool closed;
+         {
+            Synchronized lock(self.Get());
+            closed = self->_closed;
+         }
+         if (closed && outcome.stream) {
+            outcome.stream->Close();
+            outcome = Outcome();
+         }
+         if (!outcome.stream && !outcome.failure) {
+            outcome.failure.reset(MakeStreamException(boost::asio::error::operation_aborted));
+         }
+         callback(self.Get(), outcome.failure.get(), outcome.stream.Get());
+      });
+   }
+
+   const ServerSocketOptions _options;
+   Tcp::acceptor _acceptor;
+   Ref<BindingInfo> _local;
    Ref<SslContextImpl> _context;
+   size_t _limit;
+   std::set<std::shared_ptr<Handshake>> _handshakes;
+   std::deque<Outcome> _ready;
+   Callback _waiter;
+   unsigned long long _ticket = 0;
+   bool _waiting = false;
+   bool _started = false;
+   bool _accepting = false;
+   bool _closed = false;
 };
 
 }  // namespace

@@ -7,10 +7,15 @@
 
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <cstdlib>
 #include <fstream>
+#include <map>
+#include <set>
+#include <sstream>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "tests/support/netFixture.h"
 
@@ -51,6 +56,34 @@ int CountDescriptors() {
    DIR* dir = ::opendir("/proc/self/fd");
    while (dirent* entry = ::readdir(dir)) {
       if (entry->d_name[0] != '.') ++count;
+   }
+   ::closedir(dir);
+   return count;
+}
+
+// This process's descriptors on IPv4 TCP sockets bound to local `port`: the listener and
+// the server ends of its connections.
+int CountPortDescriptors(int port) {
+   std::set<std::string> inodes;
+   std::ifstream table("/proc/net/tcp");
+   std::string line;
+   std::getline(table, line);
+   while (std::getline(table, line)) {
+      std::istringstream fields(line);
+      std::string slot, local, remote, state, queues, timer, retransmits, uid, timeout, inode;
+      fields >> slot >> local >> remote >> state >> queues >> timer >> retransmits >> uid >> timeout >> inode;
+      size_t colon = local.find(':');
+      if (colon != std::string::npos && std::stoi(local.substr(colon + 1), nullptr, 16) == port) {
+         inodes.insert("socket:[" + inode + "]");
+      }
+   }
+   int count = 0;
+   DIR* dir = ::opendir("/proc/self/fd");
+   while (dirent* entry = ::readdir(dir)) {
+      if (entry->d_name[0] == '.') continue;
+      char target[64] = {};
+      std::string path = std::string("/proc/self/fd/") + entry->d_name;
+      if (::readlink(path.c_str(), target, sizeof target - 1) > 0 && inodes.count(target) != 0) ++count;
    }
    ::closedir(dir);
    return count;
@@ -201,6 +234,158 @@ TEST_F(SslStreamTest, AStalledHandshakeTimesOutOnBothSides) {
                                     ClientContext("ca.pem").Get(), stream),
                 TimeoutException);
    plain->Close();
+}
+
+// Opens a TLS connection on another thread; the test waits for the server side first.
+class ClientThread {
+public:
+   ClientThread(int port, SslContext* context)
+       : _thread([this, port, context] {
+            try {
+               CreateSslConnection("127.0.0.1", port, 10000000, context, stream);
+            } catch (const Exception& e) {
+               failure = e.GetMessage();
+            }
+         }) {}
+   ~ClientThread() { Join(); }
+   void Join() {
+      if (_thread.joinable()) _thread.join();
+   }
+   Ref<Stream> stream;
+   std::string failure;
+
+private:
+   std::thread _thread;
+};
+
+TEST_F(SslStreamTest, ASilentClientHoldsUpOtherHandshakesOnlyAtTheLimit) {
+   using Clock = std::chrono::steady_clock;
+   Ref<SslContext> client = ClientContext("ca.pem");
+   // With room for more, a client that never sends a ClientHello does not delay the next
+   // one; with room for one, it takes the only slot until its handshake times out.
+   for (int limit : {4, 1}) {
+      SCOPED_TRACE("limit " + std::to_string(limit));
+      ServerSocketOptions options;
+      options.maxPendingAccepts = limit;
+      long long timeout = limit == 1 ? 200000 : 3000000;
+      options.handshakeTimeoutMicroseconds = timeout;
+      Ref<ServerSocket> socket;
+      CreateSslServerSocket("127.0.0.1", 0, options, serverContext.Get(), socket);
+      Ref<BindingInfo> listening;
+      socket->GetBindingInfo(listening);
+      Ref<Stream> silent;
+      CreateTcpConnection("127.0.0.1", listening->GetPort(), 5000000, silent);
+
+      auto started = Clock::now();
+      Completion first;
+      Ref<Stream> firstStream;
+      socket->AsyncAccept([&](ServerSocket*, Exception* error, Stream* stream) {
+         firstStream = stream;
+         first.Done(error, 0);
+      });
+      ClientThread tls(listening->GetPort(), client.Get());
+      ASSERT_TRUE(first.WaitCount(1));
+      if (limit > 1) {
+         EXPECT_FALSE(first.Failed()) << first.Error();
+         EXPECT_LT(Clock::now() - started, std::chrono::microseconds(timeout));
+      } else {
+         EXPECT_TRUE(first.Failed());
+         EXPECT_EQ(0u, first.Error().rfind("SSL error: ", 0)) << first.Error();
+         Ref<Stream> second;
+         socket->Accept(5000000, second);
+         EXPECT_TRUE(second);
+      }
+      tls.Join();
+      EXPECT_EQ("", tls.failure);
+      EXPECT_TRUE(tls.stream);
+      if (tls.stream) tls.stream->Close();
+      if (firstStream) firstStream->Close();
+      silent->Close();
+      socket->Close();
+   }
+}
+
+TEST_F(SslStreamTest, HandshakesFinishWithoutAWaitingAcceptAndQueue) {
+   // An accept that times out starts the background accepting and leaves it running.
+   Ref<Stream> none;
+   EXPECT_THROW(server->Accept(20000, none), TimeoutException);
+   Ref<SslContext> client = ClientContext("ca.pem");
+   std::map<int, Ref<Stream>> clients;  // by local port
+   for (int i = 0; i < 3; ++i) {
+      Ref<Stream> stream;
+      CreateSslConnection("127.0.0.1", port, 5000000, client.Get(), stream);
+      Ref<BindingInfo> local;
+      Ref<BindingInfo> peer;
+      stream->GetBindingInfo(typeid(InetBindingInfo), local, peer);
+      clients[local->GetPort()] = stream;
+   }
+   // Each queued stream is the server end of one of the clients, and works.
+   for (int i = 0; i < 3; ++i) {
+      Ref<Stream> accepted;
+      server->Accept(5000000, accepted);
+      ASSERT_TRUE(accepted);
+      Ref<BindingInfo> local;
+      Ref<BindingInfo> peer;
+      accepted->GetBindingInfo(typeid(InetBindingInfo), local, peer);
+      ASSERT_TRUE(peer);
+      auto match = clients.find(peer->GetPort());
+      ASSERT_NE(clients.end(), match) << peer->ToString();
+      match->second->Write("x", 1);
+      char byte = 0;
+      EXPECT_EQ(1, accepted->Read(&byte, 1));
+      EXPECT_EQ('x', byte);
+      accepted->Close();
+      match->second->Close();
+      clients.erase(match);
+   }
+}
+
+TEST_F(SslStreamTest, CloseEndsHandshakesAndDropsQueuedStreamsWithoutLeaks) {
+   Ref<SslContext> client = ClientContext("ca.pem");
+   Completion outstanding;
+   // One socket with a finished stream nobody took, one with an accept waiting; both
+   // with silent clients in handshake (the default time-out: far away).
+   Ref<ServerSocket> queued;
+   Ref<ServerSocket> waiting;
+   CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), serverContext.Get(), queued);
+   CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), serverContext.Get(), waiting);
+   Ref<BindingInfo> listening;
+   queued->GetBindingInfo(listening);
+   int queuedPort = listening->GetPort();
+   waiting->GetBindingInfo(listening);
+   int waitingPort = listening->GetPort();
+
+   Ref<Stream> none;
+   EXPECT_THROW(queued->Accept(1000, none), TimeoutException);
+   Ref<Stream> tls;
+   CreateSslConnection("127.0.0.1", queuedPort, 5000000, client.Get(), tls);
+   waiting->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { outstanding.Done(error, 0); });
+   std::vector<Ref<Stream>> silent(4);
+   for (size_t i = 0; i < silent.size(); ++i) {
+      CreateTcpConnection("127.0.0.1", i % 2 == 0 ? queuedPort : waitingPort, 5000000, silent[i]);
+   }
+   // Listener, the TLS stream and two in handshake; listener and two in handshake.
+   ASSERT_TRUE(NetTesting::WaitFor(
+       [&] { return CountPortDescriptors(queuedPort) == 4 && CountPortDescriptors(waitingPort) == 3; },
+       "connections accepted"))
+       << CountPortDescriptors(queuedPort) << " " << CountPortDescriptors(waitingPort);
+   EXPECT_EQ(0, outstanding.Count());
+
+   queued->Close();
+   waiting->Close();
+   EXPECT_THROW(queued->AsyncAccept([](ServerSocket*, Exception*, Stream*) {}), InvalidStateException);
+   EXPECT_TRUE(NetTesting::WaitFor(
+       [&] { return CountPortDescriptors(queuedPort) + CountPortDescriptors(waitingPort) == 0; },
+       "descriptors released"))
+       << CountPortDescriptors(queuedPort) << " " << CountPortDescriptors(waitingPort);
+   ASSERT_TRUE(outstanding.WaitCount(1));
+   EXPECT_TRUE(outstanding.Failed());
+   // The queued stream was closed, not just forgotten: its client hears the end.
+   char byte = 0;
+   EXPECT_EQ(0, tls->Read(&byte, 1));
+   tls->Close();
+   for (Ref<Stream>& stream : silent) stream->Close();
+   EXPECT_EQ(1, outstanding.Count());
 }
 
 TEST_F(SslStreamTest, BadSettingsAreSslExceptions) {

@@ -23,6 +23,11 @@ struct PELMORA_EXPORT ServerSocketOptions {
    Ref<WorkQueue> completionQueue;
    // TLS server sockets: a handshake taking longer fails the accept (negative: no limit).
    long long handshakeTimeoutMicroseconds = 30000000;
+   // TLS server sockets keep accepting while handshakes run, so that a silent client
+   // holds up nobody else. This bounds connections in handshake plus finished ones not
+   // yet taken by AsyncAccept or Accept; at the bound the socket stops taking
+   // connections and the backlog holds the rest. Values below 1 count as 1.
+   int maxPendingAccepts = 64;
 };
 
 class PELMORA_EXPORT ServerSocket : public virtual Object {

@@ -61,7 +61,10 @@ PELMORA_EXPORT void CreateSslClientContext(const SslClientOptions& options, Ref<
 
 // A TCP server socket whose accepts complete after the TLS handshake (within
 // `options.handshakeTimeoutMicroseconds`); a failed handshake completes that accept with
-// SslException. `context` must be a server context.
+// SslException. Once accepting has begun, handshakes run side by side, up to
+// `options.maxPendingAccepts`, and accepts get their outcomes in the order the handshakes
+// finished. Close ends handshakes in progress and closes streams nobody took.
+// `context` must be a server context.
 PELMORA_EXPORT void CreateSslServerSocket(const std::string& host, int port, const ServerSocketOptions& options,
                                           SslContext* context, Ref<ServerSocket>& out);
 // Connects and completes the handshake within `timeoutMicroseconds` in all.
