@@ -63,7 +63,8 @@ PELMORA_EXPORT void CreateSslClientContext(const SslClientOptions& options, Ref<
 // `options.handshakeTimeoutMicroseconds`); a failed handshake completes that accept with
 // SslException. Once accepting has begun, handshakes run side by side, up to
 // `options.maxPendingAccepts`, and accepts get their outcomes in the order the handshakes
-// finished. Close ends handshakes in progress and closes streams nobody took.
+// finished. Close ends handshakes in progress and closes streams nobody took; call it
+// when done, since the accepting in the background keeps the socket alive until then.
 // `context` must be a server context.
 PELMORA_EXPORT void CreateSslServerSocket(const std::string& host, int port, const ServerSocketOptions& options,
                                           SslContext* context, Ref<ServerSocket>& out);
