@@ -7,6 +7,7 @@
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/exception/panic.h"
 #include "pelmora/formatter/messageFormatter.h"
+#include "pelmora/object/weak.h"
 #include "pelmora/service/logMacros.h"
 #include "src/http/charBuffer.h"
 #include "src/http/httpLog.h"
@@ -34,7 +35,8 @@ enum ResponseState {
    RESPONSE_COMPLETE,
 };
 
-class ResponseImpl : public virtual Response, public System::LockableObjectImpl {
+// Weakly linkable so that its connection can refer to it without keeping it alive.
+class ResponseImpl : public virtual Response, public WeakLinkableImpl<System::LockableObjectImpl> {
 public:
    ResponseImpl(HttpConnection* connection, System::Stream* stream) : _connection(connection), _stream(stream) {}
 
@@ -256,7 +258,10 @@ void ResponseImpl::Complete() {
    switch (_currState) {
       case RESPONSE_BUFFERING:
          _header.RemoveField("Transfer-Encoding");
-         _header.SetContentLength(static_cast<long long>(_buffer->Filled()));
+         // A preset length with no body written answers HEAD: it tells the length GET would send.
+         _header.SetContentLength(_buffer->Filled() == 0 && _presetContentLength > 0
+                                      ? _presetContentLength
+                                      : static_cast<long long>(_buffer->Filled()));
          WriteSized(true);
          break;
       case RESPONSE_ACCEPT_WRITE_CHUNKED: {

@@ -134,6 +134,7 @@ TEST_F(DocumentHandlerTest, HeadSendsNoBodyAndChunkingFollowsTheSwitch) {
    client.Send("HEAD /hello.txt HTTP/1.1\r\nHost: x\r\n\r\nGET /hello.txt HTTP/1.1\r\nHost: x\r\n\r\n");
    std::string head = client.ReadResponse(true);
    EXPECT_NE(head.find("HTTP/1.1 200"), std::string::npos) << head;
+   EXPECT_NE(head.find("Content-Length: 11\r\n"), std::string::npos) << head;
    // The next response starts right after the header: no body came with HEAD.
    std::string get = client.ReadResponse();
    EXPECT_EQ(get.rfind("HTTP/1.1 200", 0), 0u) << get;

@@ -7,6 +7,7 @@
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/http/request.h"
 #include "pelmora/http/response.h"
+#include "pelmora/object/weak.h"
 #include "pelmora/system/socket.h"
 #include "tests/support/netFixture.h"
 #include "tests/support/watchdog.h"
@@ -151,6 +152,23 @@ TEST_F(ResponseTest, ClientNeedingContentLengthIsBufferedUpToTheMaximum) {
    std::string wire = WithoutDate(Received());
    std::string head = "HTTP/1.1 200 OK\r\nConnection: close\r\nContent-Length: 70000\r\n\r\n";
    EXPECT_EQ(wire, head + body);
+}
+
+// A connection may hold its response by a weak link, which sees the response go.
+TEST_F(ResponseTest, AWeakLinkSeesTheResponseGo) {
+   Ref<System::Stream> server, client;
+   System::CreateStreamPair(server, client);
+   Ref<Response> response;
+   CreateResponse(_connection.Get(), server.Get(), response);
+   auto* linkable = dynamic_cast<WeakLinkable*>(response.Get());
+   ASSERT_NE(linkable, nullptr);
+   Ref<WeakLink> link;
+   linkable->AttachWeakRef(link);
+   Ref<Object> promoted;
+   EXPECT_TRUE(link->Promote(promoted));
+   promoted.Reset();
+   response.Reset();
+   EXPECT_FALSE(link->Promote(promoted));
 }
 
 TEST_F(ResponseTest, ErrorsContinueAndStateRules) {
