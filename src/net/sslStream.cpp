@@ -27,6 +27,14 @@ namespace Pelmora::System {
 
 namespace {
 
+// OpenSSL frees its locks in an exit handler, while pool threads, which live until exit,
+// may still be dropping TLS objects then. Like the library's own singletons, OpenSSL's
+// state is kept until the process ends. The first initialisation decides, so this runs
+// ahead of every ordinary static initialiser (asio's among them).
+__attribute__((constructor(101))) void InitOpenSslWithoutExitCleanup() {
+   OPENSSL_init_ssl(OPENSSL_INIT_NO_ATEXIT, nullptr);
+}
+
 using Tcp = boost::asio::ip::tcp;
 using SslSocket = boost::asio::ssl::stream<Tcp::socket>;
 using SslGenericStream = GenericStream<SslSocket, true>;
