@@ -72,6 +72,7 @@ private:
    void StartChunked();
    // Puts the header in front of the buffered bytes, or on the wire when it does not fit.
    void PrependHeader();
+   void FrameBufferedChunk();
    void WriteChunk();
    void WriteSized(bool lastBlock);
    size_t BodyRoom() const;
@@ -210,8 +211,8 @@ void ResponseImpl::PrependHeader() {
    _headerSent = true;
 }
 
-void ResponseImpl::WriteChunk() {
-   PELMORA_VERIFY(_currState == RESPONSE_ACCEPT_WRITE_CHUNKED);
+// Wraps the buffered bytes, if any, as one chunk: size line in front, CR LF behind.
+void ResponseImpl::FrameBufferedChunk() {
    size_t dataLen = _buffer->Filled();
    if (dataLen > 0) {
       char sizeLine[24];
@@ -222,6 +223,11 @@ void ResponseImpl::WriteChunk() {
       numWritten = _buffer->Append("\r\n", footerLen);
       PELMORA_VERIFY(numWritten == footerLen);
    }
+}
+
+void ResponseImpl::WriteChunk() {
+   PELMORA_VERIFY(_currState == RESPONSE_ACCEPT_WRITE_CHUNKED);
+   FrameBufferedChunk();
    if (!_headerSent) PrependHeader();
    _buffer->WriteTo(_stream.Get());
 }
@@ -266,16 +272,7 @@ void ResponseImpl::Complete() {
          break;
       case RESPONSE_ACCEPT_WRITE_CHUNKED: {
          // The last data chunk and the terminal chunk leave in one write.
-         size_t dataLen = _buffer->Filled();
-         if (dataLen > 0) {
-            char sizeLine[24];
-            int lineLen = snprintf(sizeLine, sizeof sizeLine, "%lX\r\n", static_cast<unsigned long>(dataLen));
-            size_t numWritten = _buffer->Prepend(sizeLine, static_cast<size_t>(lineLen));
-            PELMORA_VERIFY(numWritten == static_cast<size_t>(lineLen));
-            const size_t footerLen = 2;
-            numWritten = _buffer->Append("\r\n", footerLen);
-            PELMORA_VERIFY(numWritten == footerLen);
-         }
+         FrameBufferedChunk();
          const int terminalChunkLen = sizeof kTerminalChunk - 1;
          size_t numWritten = _buffer->Append(kTerminalChunk, terminalChunkLen);
          PELMORA_VERIFY(numWritten == (size_t)terminalChunkLen);
