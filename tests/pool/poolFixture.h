@@ -16,6 +16,7 @@
 #include "pelmora/service.h"
 #include "pelmora/system.h"
 #include "src/pool/threadPoolFair.h"
+#include "tests/support/defaultLogCapture.h"
 
 namespace Pelmora::System::PoolTesting {
 
@@ -78,42 +79,18 @@ private:
 };
 
 // Keeps the lines of the pool's loggers. Installed on the default output for its life.
-class PoolLogCapture {
+class PoolLogCapture : public TestSupport::DefaultLogCapture {
 public:
-   PoolLogCapture() : _target(new Target()) {
-      Service::CreateLogWriter("poolTest", _target.Get(), "trivia", _writer);
-      Service::GetDefaultLogger()->GetLogOutput()->AddWriter("poolTest", _writer.Get());
-      for (const char* name : {"ThreadPool", "PriorityInfo.0", "PriorityInfo.5", "PriorityInfo.10"})
-         Service::GetDefaultLogManager()->SetLevel(name, "trivia", "none");
+   PoolLogCapture() : TestSupport::DefaultLogCapture("poolTest") {
+      for (const char* name : kLoggers) Service::GetDefaultLogManager()->SetLevel(name, "trivia", "none");
    }
    ~PoolLogCapture() {
-      Ref<Service::LogWriter> removed;
-      Service::GetDefaultLogger()->GetLogOutput()->RemoveWriter("poolTest", removed);
-      for (const char* name : {"ThreadPool", "PriorityInfo.0", "PriorityInfo.5", "PriorityInfo.10"})
-         Service::GetDefaultLogManager()->SetLevel(name, "info", "none");
+      for (const char* name : kLoggers) Service::GetDefaultLogManager()->SetLevel(name, "info", "none");
    }
-   std::string Text() { return _target->Text(); }
-   bool Contains(const std::string& text) { return Text().find(text) != std::string::npos; }
 
 private:
-   class Target : public virtual Writer, public ObjectImpl {
-   public:
-      void Write(const char* data, int length) override {
-         std::lock_guard<std::mutex> lock(_mutex);
-         _text.append(data, length);
-      }
-      void Close() override {}
-      std::string Text() {
-         std::lock_guard<std::mutex> lock(_mutex);
-         return _text;
-      }
-
-   private:
-      std::mutex _mutex;
-      std::string _text;
-   };
-   Ref<Target> _target;
-   Ref<Service::LogWriter> _writer;
+   static constexpr const char* kLoggers[] = {"ThreadPool", "PriorityInfo.0", "PriorityInfo.5",
+                                              "PriorityInfo.10"};
 };
 
 using Settings = std::map<std::string, std::string>;

@@ -14,6 +14,7 @@
 
 #include "pelmora/service.h"
 #include "pelmora/system.h"
+#include "tests/support/defaultLogCapture.h"
 
 namespace Pelmora::System::NetTesting {
 
@@ -29,38 +30,9 @@ inline ThreadPool* EnsurePool() {
 }
 
 // Keeps the default logger's lines while it lives.
-class DefaultLogCapture {
+class DefaultLogCapture : public TestSupport::DefaultLogCapture {
 public:
-   DefaultLogCapture() : _target(new Target()) {
-      Service::CreateLogWriter("netTest", _target.Get(), "trivia", _writer);
-      Service::GetDefaultLogger()->GetLogOutput()->AddWriter("netTest", _writer.Get());
-   }
-   ~DefaultLogCapture() {
-      Ref<Service::LogWriter> removed;
-      Service::GetDefaultLogger()->GetLogOutput()->RemoveWriter("netTest", removed);
-   }
-   std::string Text() { return _target->Text(); }
-   bool Contains(const std::string& text) { return Text().find(text) != std::string::npos; }
-
-private:
-   class Target : public virtual Writer, public ObjectImpl {
-   public:
-      void Write(const char* data, int length) override {
-         std::lock_guard<std::mutex> lock(_mutex);
-         _text.append(data, length);
-      }
-      void Close() override {}
-      std::string Text() {
-         std::lock_guard<std::mutex> lock(_mutex);
-         return _text;
-      }
-
-   private:
-      std::mutex _mutex;
-      std::string _text;
-   };
-   Ref<Target> _target;
-   Ref<Service::LogWriter> _writer;
+   DefaultLogCapture() : TestSupport::DefaultLogCapture("netTest") {}
 };
 
 // Polls `condition` every millisecond; fails the test naming `what` after `limit`.
