@@ -13,6 +13,10 @@ packages=(
   prometheus  # promtool checks the metrics export in the tests
   clang libclang-rt-14-dev clang-format
   openssl  # the TLS stream tests make throw-away certificates
+  curl python3  # real clients in the HTTP tests
+  python3-zeep  # a real SOAP client drives the SOAP tests
+  chromium chromium-driver python3-selenium  # the status page in a real browser
+  nginx  # a front proxy before two daemons
 )
 
 missing=()

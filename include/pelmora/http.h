@@ -13,3 +13,4 @@
 // The server: service, request handlers and the document handler.
 #include "pelmora/http/documentHandler.h"
 #include "pelmora/http/httpSvc.h"
+#include "pelmora/http/session.h"
