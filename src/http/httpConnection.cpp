@@ -5,6 +5,7 @@
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/logMacros.h"
 #include "src/http/httpSvcImpl.h"
+#include "src/http/sessionImpl.h"
 
 namespace Pelmora::Http {
 
@@ -69,6 +70,7 @@ public:
       });
    }
    void Close() override { _inner->Close(); }
+   bool IsSecure() const override { return _inner->IsSecure(); }
    // Bytes handed to the stream for writing so far.
    long long Written() const { return _written.load(std::memory_order_relaxed); }
 
@@ -334,7 +336,7 @@ bool HttpConnectionImpl::FinishRequest() {
          return false;
       }
    }
-   _authenticated = _response->IsUsingAuthenticatedTimeout();
+   _authenticated = IsAuthenticatedResponse(_response.Get());
    const HttpSvcConfig& config = GetHttpSvcConfig();
    _stream->SetReadTimeout(GetReadTimeout(), Logger::LOG_INFO, "Timed out reading between HTTP requests.");
    _stream->SetWriteTimeout(_authenticated ? config.authenticatedWriteTimeout : config.defaultWriteTimeout,

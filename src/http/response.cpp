@@ -63,6 +63,7 @@ public:
    void Close() override { _stream->Close(); }
    bool IsHeaderSent() const override { return _headerSent; }
    bool IsResponseComplete() const override { return _currState == RESPONSE_COMPLETE; }
+   bool IsSecure() const override { return _stream->IsSecure(); }
 
 private:
    void PrepareToWrite();

@@ -37,7 +37,13 @@ __attribute__((constructor(101))) void InitOpenSslWithoutExitCleanup() {
 
 using Tcp = boost::asio::ip::tcp;
 using SslSocket = boost::asio::ssl::stream<Tcp::socket>;
-using SslGenericStream = GenericStream<SslSocket, true>;
+
+// The TLS stream says so, for answers that depend on it (cookies marked Secure).
+class SslGenericStream final : public GenericStream<SslSocket, true> {
+public:
+   using GenericStream::GenericStream;
+   bool IsSecure() const override { return true; }
+};
 
 class SslContextImpl : public virtual SslContext, public ObjectImpl {
 public:

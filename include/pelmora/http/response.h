@@ -71,6 +71,8 @@ public:
    virtual void Close() = 0;
    virtual bool IsHeaderSent() const = 0;
    virtual bool IsResponseComplete() const = 0;
+   // Whether the response goes out over an encrypted stream.
+   virtual bool IsSecure() const { return false; }
 };
 
 // A response written to `stream` for `connection`, which must outlive it.

@@ -60,6 +60,8 @@ public:
                           const Functor<void, Stream*, Exception*, int>& callback) = 0;
    // Closes both directions for good; outstanding operations complete with a failure.
    virtual void Close() = 0;
+   // Whether the bytes travel encrypted (TLS); false unless a stream says otherwise.
+   virtual bool IsSecure() const { return false; }
 };
 
 // The length of one time-out tick: 5 seconds, unless shortened (tests do). Applies to
