@@ -13,4 +13,5 @@
 // The server: service, request handlers and the document handler.
 #include "pelmora/http/documentHandler.h"
 #include "pelmora/http/httpSvc.h"
+#include "pelmora/http/prometheusHandler.h"
 #include "pelmora/http/session.h"
