@@ -136,8 +136,10 @@ public:
       CreateCookie(_config.cookieName, std::string(kIdLength, '0'), probe);
       probe->SetPath(_config.cookiePath);
    }
+   // Sessions still referred to elsewhere end with their service.
    ~SessionServiceImpl() override {
       if (_timer) _timer->Cancel();
+      for (auto& [id, session] : _sessions) session->End();
    }
 
    void StartTimer() {
@@ -168,12 +170,14 @@ public:
 
 private:
    // The live session named `id`, its clock restarted; one found idle past the
-   // time-out is taken out into `expired` instead. Under _mutex.
-   bool FindLocked(const std::string& id, long long now, Ref<SessionImpl>& out, Ref<SessionImpl>& expired) {
+   // time-out is taken out into `expired` instead, to be ended outside the lock.
+   // Under _mutex.
+   bool FindLocked(const std::string& id, long long now, Ref<SessionImpl>& out,
+                   std::vector<Ref<SessionImpl>>& expired) {
       auto at = _sessions.find(id);
       if (at == _sessions.end()) return false;
       if (IsIdle(at->second.Get(), now)) {
-         expired = std::move(at->second);
+         expired.push_back(std::move(at->second));
          _sessions.erase(at);
          return false;
       }
@@ -228,7 +232,8 @@ void SessionImpl::Invalidate() {
 bool SessionServiceImpl::ResolveSession(Request* request, Response* response, Ref<Session>& out) {
    out.Reset();
    long long now = Now();
-   Ref<SessionImpl> found, expired;
+   Ref<SessionImpl> found;
+   std::vector<Ref<SessionImpl>> expired;
    RefList<Cookie> cookies;
    request->GetCookieList(cookies);
    {
@@ -238,7 +243,7 @@ bool SessionServiceImpl::ResolveSession(Request* request, Response* response, Re
          if (FindLocked(cookie->GetValue(), now, found, expired)) break;
       }
    }
-   if (expired) expired->End();
+   for (const Ref<SessionImpl>& session : expired) session->End();
    if (found) {
       out = found;
       return true;
@@ -282,12 +287,13 @@ bool SessionServiceImpl::ResolveSession(Request* request, Response* response, Re
 bool SessionServiceImpl::LookupSession(const std::string& id, Ref<Session>& out) {
    out.Reset();
    if (!IsSessionIdShape(id)) return false;
-   Ref<SessionImpl> found, expired;
+   Ref<SessionImpl> found;
+   std::vector<Ref<SessionImpl>> expired;
    {
       std::lock_guard<std::mutex> lock(_mutex);
       FindLocked(id, Now(), found, expired);
    }
-   if (expired) expired->End();
+   for (const Ref<SessionImpl>& session : expired) session->End();
    out = found;
    return found.Get() != nullptr;
 }

@@ -251,12 +251,12 @@ TEST_F(SessionTest, IdleSessionsExpireOnTheTimerWhileUsedOnesStay) {
    service->Shutdown();
 }
 
-TEST_F(SessionTest, IdleSessionsDoNotResolveBeforeTheTimerRuns) {
+TEST_F(SessionTest, IdleSessionsEndOnLookupAndOnExplicitExpiry) {
    SessionServiceConfig config;
    config.idleTimeout = 30000;
    config.expiryInterval = 0;  // no timer: only explicit expiry and lookups
    Ref<SessionService> service = MakeService(config);
-   std::vector<Ref<Session>> sessions(3);
+   std::vector<Ref<Session>> sessions(4);
    std::vector<std::unique_ptr<Exchange>> exchanges;
    for (auto& session : sessions) {
       exchanges.emplace_back(new Exchange());
@@ -265,13 +265,30 @@ TEST_F(SessionTest, IdleSessionsDoNotResolveBeforeTheTimerRuns) {
    auto made = std::chrono::steady_clock::now();
    ASSERT_TRUE(WaitFor([&] { return std::chrono::steady_clock::now() - made > std::chrono::milliseconds(40); },
                        "idle time passed"));
-   EXPECT_EQ(service->GetSessionCount(), 3u);
-   Ref<Session> out;
-   EXPECT_FALSE(service->LookupSession(sessions[0]->GetId(), out));
+   EXPECT_EQ(service->GetSessionCount(), 4u);
+   // Every idle session a request names ends, not only the last one.
+   Exchange both("pelmora_session=" + sessions[0]->GetId() + "; pelmora_session=" + sessions[1]->GetId());
+   Ref<Session> fresh, out;
+   ASSERT_TRUE(service->ResolveSession(both.request.Get(), both.response.Get(), fresh));
    EXPECT_FALSE(sessions[0]->IsValid());
-   EXPECT_EQ(service->ExpireIdleSessions(), 2u);
-   EXPECT_EQ(service->ExpireIdleSessions(), 0u);
-   EXPECT_EQ(service->GetSessionCount(), 0u);
+   EXPECT_FALSE(sessions[1]->IsValid());
+   EXPECT_EQ(both.SetCookies().size(), 1u);
+   EXPECT_FALSE(service->LookupSession(sessions[2]->GetId(), out));
+   EXPECT_FALSE(sessions[2]->IsValid());
+   EXPECT_TRUE(sessions[3]->IsValid());  // nobody asked for it yet
+   size_t ended = service->ExpireIdleSessions();
+   EXPECT_FALSE(sessions[3]->IsValid());
+   EXPECT_EQ(ended, fresh->IsValid() ? 1u : 2u);  // `fresh` too when this thread stalled
+   EXPECT_EQ(service->GetSessionCount(), fresh->IsValid() ? 1u : 0u);
+
+   // Sessions still held elsewhere end with a service dropped without Shutdown.
+   Ref<SessionService> dropped = MakeService();
+   Exchange e0;
+   Ref<Session> orphan;
+   ASSERT_TRUE(dropped->ResolveSession(e0.request.Get(), e0.response.Get(), orphan));
+   dropped.Reset();
+   EXPECT_FALSE(orphan->IsValid());
+   orphan->Invalidate();
 
    // A negative time-out never expires.
    config.idleTimeout = -1;

@@ -48,6 +48,7 @@ public:
    // one whose cookie is added to the response. False, with `out` null, when a new
    // session would pass the maximum count.
    virtual bool ResolveSession(Request* request, Response* response, Ref<Session>& out) = 0;
+   // The live session named `id`, its idle clock restarted as by ResolveSession.
    virtual bool LookupSession(const std::string& id, Ref<Session>& out) = 0;
    virtual size_t GetSessionCount() = 0;
    // Ends every session idle longer than the time-out; returns how many ended.
