@@ -15,6 +15,7 @@
 #include "pelmora/http/request.h"
 #include "pelmora/http/response.h"
 #include "pelmora/object/weak.h"
+#include "pelmora/perfCounter/registry.h"
 #include "pelmora/service/logMacros.h"
 #include "pelmora/system/threadPool.h"
 #include "src/http/httpLog.h"
@@ -52,6 +53,24 @@ std::string NewId() {
    }
    return id;
 }
+
+// What a service counts, read by the counter registry; kept apart from the service so
+// that the registry does not hold it.
+class SessionStats : public virtual PerfCounter::GroupPublisher, public ObjectImpl {
+public:
+   enum { ACTIVE, CREATED, EXPIRED, REFUSED, COUNT };
+   static constexpr const char* kNames[COUNT] = {"Active", "Created", "Expired", "Refused"};
+
+   void CollectValues(RefVector<PerfCounter::Metadata>&, std::vector<PerfCounter::Value>& values) override {
+      values.clear();
+      for (const auto& value : _values) values.emplace_back(value.load(std::memory_order_relaxed));
+   }
+   void Add(int which, long long n) { _values[which].fetch_add(n, std::memory_order_relaxed); }
+   void Set(int which, long long n) { _values[which].store(n, std::memory_order_relaxed); }
+
+private:
+   std::atomic<long long> _values[COUNT] = {};
+};
 
 class SessionServiceImpl;
 
@@ -135,10 +154,12 @@ public:
       Ref<Cookie> probe;
       CreateCookie(_config.cookieName, std::string(kIdLength, '0'), probe);
       probe->SetPath(_config.cookiePath);
+      PublishStats();
    }
    // Sessions still referred to elsewhere end with their service.
    ~SessionServiceImpl() override {
       if (_timer) _timer->Cancel();
+      if (_statsItem) _statsItem->Unregister();
       for (auto& [id, session] : _sessions) session->End();
    }
 
@@ -165,6 +186,7 @@ public:
       if (at != _sessions.end() && at->second.Get() == session) {
          held = std::move(at->second);
          _sessions.erase(at);
+         _stats->Set(SessionStats::ACTIVE, static_cast<long long>(_sessions.size()));
       }
    }
 
@@ -179,11 +201,29 @@ private:
       if (IsIdle(at->second.Get(), now)) {
          expired.push_back(std::move(at->second));
          _sessions.erase(at);
+         _stats->Add(SessionStats::EXPIRED, 1);
+         _stats->Set(SessionStats::ACTIVE, static_cast<long long>(_sessions.size()));
          return false;
       }
       at->second->Touch(now);
       out = at->second;
       return true;
+   }
+   // Under "/Http/Sessions/Cookie='<name>'/" in the process's registry. A second service
+   // with the same cookie name goes without.
+   void PublishStats() {
+      RefVector<PerfCounter::Metadata> metadata;
+      for (int i = 0; i < SessionStats::COUNT; ++i) {
+         metadata.push_back(new PerfCounter::Metadata(
+             "/Http/Sessions/Cookie='" + _config.cookieName + "'/" + SessionStats::kNames[i],
+             i == SessionStats::ACTIVE ? PerfCounter::Metadata::TYPE_GAUGE : PerfCounter::Metadata::TYPE_COUNTER));
+      }
+      try {
+         PerfCounter::GetCounterRegistry()->RegisterGroup(metadata, _stats.Get(), _statsItem);
+      } catch (const Exception& e) {
+         PELMORA_LOG_VERBOSE(_logger.Get(), "Sessions of cookie %1 publish no counters: %2", _config.cookieName,
+                             e.GetMessage());
+      }
    }
    bool IsIdle(SessionImpl* session, long long now) const {
       return _config.idleTimeout >= 0 && now - session->GetLastAccess() > _config.idleTimeout;
@@ -210,6 +250,8 @@ private:
 
    const SessionServiceConfig _config;
    Ref<Service::Logger> _logger;
+   Ref<SessionStats> _stats{new SessionStats()};
+   Ref<PerfCounter::RegistryItem> _statsItem;
 
    std::mutex _timerMutex;  // taken before _mutex
    bool _stopped = false;
@@ -256,6 +298,7 @@ bool SessionServiceImpl::ResolveSession(Request* request, Response* response, Re
       if (_sessions.size() >= _config.maxSessionCount) {
          logRefusal = !_refusing;
          _refusing = true;
+         _stats->Add(SessionStats::REFUSED, 1);
       } else {
          std::string id;
          do {
@@ -264,6 +307,8 @@ bool SessionServiceImpl::ResolveSession(Request* request, Response* response, Re
          made = new SessionImpl(id, this, now);
          _sessions.emplace(id, made);
          _refusing = false;
+         _stats->Add(SessionStats::CREATED, 1);
+         _stats->Set(SessionStats::ACTIVE, static_cast<long long>(_sessions.size()));
       }
    }
    if (!made) {
@@ -311,6 +356,8 @@ size_t SessionServiceImpl::ExpireIdleSessions() {
             ++at;
          }
       }
+      _stats->Add(SessionStats::EXPIRED, static_cast<long long>(expired.size()));
+      _stats->Set(SessionStats::ACTIVE, static_cast<long long>(_sessions.size()));
    }
    for (const Ref<SessionImpl>& session : expired) session->End();
    if (!expired.empty()) {
@@ -327,10 +374,14 @@ void SessionServiceImpl::Shutdown() {
       _timer.Reset();
    }
    std::unordered_map<std::string, Ref<SessionImpl>> ended;
+   Ref<PerfCounter::RegistryItem> statsItem;
    {
       std::lock_guard<std::mutex> lock(_mutex);
       ended.swap(_sessions);
+      statsItem = std::move(_statsItem);
+      _stats->Set(SessionStats::ACTIVE, 0);
    }
+   if (statsItem) statsItem->Unregister();
    for (auto& [id, session] : ended) session->End();
 }
 

@@ -19,6 +19,7 @@
 #include "pelmora/http/httpSvc.h"
 #include "pelmora/http/session.h"
 #include "pelmora/object/weak.h"
+#include "pelmora/perfCounter/registry.h"
 #include "pelmora/service/config.h"
 #include "pelmora/system/ssl.h"
 #include "tests/support/httpClient.h"
@@ -84,6 +85,16 @@ Ref<SessionService> MakeService(const SessionServiceConfig& config = SessionServ
    Ref<SessionService> service;
    CreateSessionService(config, TestLogger().Get(), service);
    return service;
+}
+
+// The value of a session counter of the process's registry; -1 when there is none.
+long long CounterValue(const std::string& cookieName, const std::string& counter) {
+   std::vector<std::string> names{"/Http/Sessions/Cookie='" + cookieName + "'/" + counter};
+   Ref<PerfCounter::Query> query;
+   PerfCounter::GetCounterRegistry()->CreateNamesQuery(names, query);
+   PerfCounter::QueryResults results;
+   query->Execute(results);
+   return results.empty() ? -1 : results[0].value.Get();
 }
 
 size_t Count(const std::string& text, const std::string& what) {
@@ -181,6 +192,7 @@ TEST_F(SessionTest, MaximumCountRefusesWithOneWarningPerBurst) {
    DefaultLogCapture log;
    SessionServiceConfig config;
    config.maxSessionCount = 2;
+   config.cookieName = "limited_session";
    Ref<SessionService> service = MakeService(config);
    Ref<Session> a, b, refused;
    Exchange ea, eb;
@@ -199,7 +211,7 @@ TEST_F(SessionTest, MaximumCountRefusesWithOneWarningPerBurst) {
    const std::string warning = "Refusing new HTTP sessions: 2 sessions exist, the maximum";
    EXPECT_EQ(Count(log.Text(), warning), 1u) << log.Text();
    // Existing sessions still resolve while new ones are refused.
-   Exchange existing("pelmora_session=" + a->GetId());
+   Exchange existing("limited_session=" + a->GetId());
    Ref<Session> found;
    ASSERT_TRUE(service->ResolveSession(existing.request.Get(), existing.response.Get(), found));
    EXPECT_EQ(found, a);
@@ -211,7 +223,12 @@ TEST_F(SessionTest, MaximumCountRefusesWithOneWarningPerBurst) {
    ASSERT_TRUE(service->ResolveSession(ec.request.Get(), ec.response.Get(), c));
    EXPECT_FALSE(service->ResolveSession(ed.request.Get(), ed.response.Get(), refused));
    EXPECT_EQ(Count(log.Text(), warning), 2u) << log.Text();
+   EXPECT_EQ(CounterValue("limited_session", "Created"), 3);
+   EXPECT_EQ(CounterValue("limited_session", "Refused"), 4);
+   EXPECT_EQ(CounterValue("limited_session", "Active"), 2);
+   EXPECT_EQ(CounterValue("limited_session", "Expired"), 0);
    service->Shutdown();
+   EXPECT_EQ(CounterValue("limited_session", "Created"), -1);  // unregistered
 }
 
 TEST_F(SessionTest, IdleSessionsExpireOnTheTimerWhileUsedOnesStay) {
@@ -255,6 +272,7 @@ TEST_F(SessionTest, IdleSessionsEndOnLookupAndOnExplicitExpiry) {
    SessionServiceConfig config;
    config.idleTimeout = 30000;
    config.expiryInterval = 0;  // no timer: only explicit expiry and lookups
+   config.cookieName = "idle_session";
    Ref<SessionService> service = MakeService(config);
    std::vector<Ref<Session>> sessions(4);
    std::vector<std::unique_ptr<Exchange>> exchanges;
@@ -267,7 +285,7 @@ TEST_F(SessionTest, IdleSessionsEndOnLookupAndOnExplicitExpiry) {
                        "idle time passed"));
    EXPECT_EQ(service->GetSessionCount(), 4u);
    // Every idle session a request names ends, not only the last one.
-   Exchange both("pelmora_session=" + sessions[0]->GetId() + "; pelmora_session=" + sessions[1]->GetId());
+   Exchange both("idle_session=" + sessions[0]->GetId() + "; idle_session=" + sessions[1]->GetId());
    Ref<Session> fresh, out;
    ASSERT_TRUE(service->ResolveSession(both.request.Get(), both.response.Get(), fresh));
    EXPECT_FALSE(sessions[0]->IsValid());
@@ -280,6 +298,7 @@ TEST_F(SessionTest, IdleSessionsEndOnLookupAndOnExplicitExpiry) {
    EXPECT_FALSE(sessions[3]->IsValid());
    EXPECT_EQ(ended, fresh->IsValid() ? 1u : 2u);  // `fresh` too when this thread stalled
    EXPECT_EQ(service->GetSessionCount(), fresh->IsValid() ? 1u : 0u);
+   EXPECT_EQ(CounterValue("idle_session", "Expired"), fresh->IsValid() ? 4 : 5);
 
    // Sessions still held elsewhere end with a service dropped without Shutdown.
    Ref<SessionService> dropped = MakeService();
