@@ -113,4 +113,8 @@ void AppImpl::Reload() {
    PELMORA_LOG_INFO(log.Get(), "Reopened log files");
 }
 
+void ReloadApp() {
+   if (Ref<AppImpl> app = GetAppImpl()) app->Reload();
+}
+
 }  // namespace Pelmora::Service

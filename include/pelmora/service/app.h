@@ -96,6 +96,11 @@ PELMORA_EXPORT void InitApp(Config* defaults, const std::string& configFile);
 PELMORA_EXPORT void InitApp(const std::string& logName, const std::string& logDirectory,
                             const std::string& configFile);
 
+// What SIGHUP does when the application handles signals: refreshes the configuration
+// (applying changed log levels) and reopens the log files. For a program that takes the
+// signals itself ("pelmora/daemon/handleSignals" false). Nothing before Init.
+PELMORA_EXPORT void ReloadApp();
+
 // Stores the program's identity record; null is a panic.
 PELMORA_EXPORT void SetAppInfo(AppInfo* info);
 
