@@ -37,6 +37,21 @@ function filterCounters(counters) {
   return counters.filter((c) => pattern.test(c.name));
 }
 
+// One row per work queue of the pool, from its counters.
+function workQueues(counters) {
+  const queues = new Map();
+  const pattern = /^\/ThreadPool\/Pelmora\/WorkQueue\/([^/]+)\/(\w+)$/;
+  for (const c of counters) {
+    const m = pattern.exec(c.name);
+    if (!m) continue;
+    if (!queues.has(m[1])) queues.set(m[1], {});
+    queues.get(m[1])[m[2]] = c.value;
+  }
+  const cell = (v) => [v === undefined ? "–" : v.toLocaleString("en-US"), "num"];
+  return [...queues].map(([name, q]) => [[name.replace(/^Default|Queue$/g, "")],
+    cell(q.currentConcurrency ?? q.CurrentConcurrency), cell(q.QueueSize), cell(q.TotalExecionCount)]);
+}
+
 function show(status) {
   const state = $("state");
   state.textContent = status.state;
@@ -51,7 +66,7 @@ function show(status) {
   const pool = status.pool || {};
   $("poolThreads").textContent = pool.minThreads + " to " + pool.maxThreads;
   $("poolRatio").textContent = pool.reservationRatio;
-  fillTable($("poolStats"), (pool.stats || []).map((s) => [[s.key], [s.value, "num"]]));
+  fillTable($("queues"), workQueues(status.counters));
   const threadRows = [];
   for (const t of status.threads) {
     for (const text of t.states) threadRows.push([[String(t.thread)], [text]]);
