@@ -1,6 +1,7 @@
 # Front door: every target installs what is missing, configures and builds as needed.
 PREFIX ?= /usr/local
 FUZZ_SECONDS ?= 60
+PELMORAD_ARGS ?=
 
 .PHONY: all deps build test run asan tsan analyze bench fuzz install format clean
 
@@ -16,8 +17,13 @@ build: deps
 test: build
 	ctest --preset default
 
-run: build
-	./build/default/examples/core_tour
+# The management daemon in the foreground on its compiled-in defaults; it prints the URL
+# to open (http://127.0.0.1:8080/). Ctrl-C stops it. PELMORAD_ARGS adds flags
+# (make run PELMORAD_ARGS="--port 9090").
+run: deps
+	cmake --preset default
+	cmake --build --preset default --target pelmorad
+	./build/default/tools/pelmorad/pelmorad --state-dir build/pelmorad-state $(PELMORAD_ARGS)
 
 asan: deps
 	cmake --preset asan
