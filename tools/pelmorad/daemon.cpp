@@ -97,6 +97,18 @@ std::string ErrorJson(const std::string& message) {
    return json.Text();
 }
 
+// A line on the calling thread's board for as long as it lives.
+class ThreadStateEntry {
+public:
+   explicit ThreadStateEntry(const std::string& text) : _index(System::AddThreadState(text.c_str())) {}
+   ~ThreadStateEntry() { System::RemoveThreadState(_index); }
+   ThreadStateEntry(const ThreadStateEntry&) = delete;
+   ThreadStateEntry& operator=(const ThreadStateEntry&) = delete;
+
+private:
+   unsigned _index;
+};
+
 }  // namespace
 
 // Requests answered per endpoint, published as "/Pelmorad/Endpoint='name'/Requests", with
@@ -206,9 +218,10 @@ void Daemon::Start() {
 }
 
 void Daemon::Run() {
-   unsigned board = System::AddThreadState("main: running the pool's main-thread queue");
-   Service::GetApp()->Run();
-   System::RemoveThreadState(board);
+   {
+      ThreadStateEntry board("main: running the pool's main-thread queue");
+      Service::GetApp()->Run();
+   }
    // The pool may have been stopped another way; the service goes all the same.
    Stop();
 }
@@ -274,17 +287,18 @@ void Daemon::RegisterEndpoints() {
       _documents->RegisterURIHandler(path, [this, endpoint, handler](Http::Request* request, Http::Response* response) {
          _counters->Count(endpoint);
          std::string state = "serving " + request->GetPath();
-         unsigned board = System::AddThreadState(state.c_str());
+         ThreadStateEntry board(state);
+         std::string failure;
          try {
             handler(request, response);
+            return;
          } catch (const Exception& e) {
-            PELMORA_LOG_ERROR(DaemonLogger(), "%1 failed: %2", request->GetPath(), e.GetMessage());
-            if (!response->IsHeaderSent()) {
-               response->Reset();
-               ReplyJson(response, Http::ResponseCode::InternalServerError, ErrorJson(e.GetMessage()));
-            }
+            failure = e.GetMessage();
+         } catch (const std::exception& e) {
+            failure = e.what();
          }
-         System::RemoveThreadState(board);
+         PELMORA_LOG_ERROR(DaemonLogger(), "%1 failed: %2", request->GetPath(), failure);
+         if (!response->IsHeaderSent()) response->SendError(Http::ResponseCode::InternalServerError, failure);
       });
    };
    for (const char* file : {"/", "/index.html", "/style.css", "/app.js"}) {

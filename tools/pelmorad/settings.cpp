@@ -148,6 +148,10 @@ void LoadConfiguration(const Options& options, Ref<Service::Config>& out, std::s
    fallback->Set("pelmorad/stateDir", stateDir);
    std::string logDir = GetOr(view.Get(), "log/directory", Environment("LOGS_DIRECTORY"));
    if (logDir.empty()) logDir = stateDir + "/log";
+   // An empty value in the file (the printed defaults have one) means the default too,
+   // which lives in the defaults tree: the empty one would hide it.
+   std::string given;
+   if (view->Get("log/directory", &given) && given.empty()) view->Unset("log/directory");
    fallback->Set("log/directory", MakeDirectory(logDir, "log directory"));
    out = config;
    stateDirOut = stateDir;
