@@ -8,12 +8,6 @@
 
 using namespace Pelmora;
 
-static void Answer(Http::Response* response, const std::string& type, const std::string& body) {
-   response->GetHeader().SetContentType(type);
-   response->Write(body.data(), static_cast<int>(body.size()));
-   response->Complete();
-}
-
 int main(int argc, char** argv) {
    Ref<Service::Config> config;  // settings in memory; a file works the same (InitApp(path))
    Service::CreateScratchConfig(config);
@@ -24,18 +18,19 @@ int main(int argc, char** argv) {
 
    Ref<Http::DocumentHandler> pages;
    Http::CreateHTTPDocRequestHandler(std::map<std::string, std::string>{}, nullptr, pages);
-   pages->RegisterURIHandler("/", [](Http::Request*, Http::Response* r) { Answer(r, "text/plain", "hello\n"); });
-   pages->RegisterURIHandler("/metrics", [](Http::Request*, Http::Response* r) {
-      Ref<StringWriter> text;
-      CreateStringWriter(text);
-      PerfCounter::WritePrometheusText(PerfCounter::GetCounterRegistry(), text.Get());
-      Answer(r, "text/plain; version=0.0.4", text->GetString());
+   pages->RegisterURIHandler("/", [](Http::Request*, Http::Response* r) {
+      r->GetHeader().SetContentType("text/plain");
+      r->Write("hello\n", 6);
+      r->Complete();
    });
    Ref<System::ServerSocket> socket;
    System::CreateTcpServerSocket("127.0.0.1", argc > 1 ? std::stoi(argv[1]) : 8081, {}, socket);
    Ref<Http::HttpSvc> http;
    Http::CreateHttpSvc(socket.Get(), nullptr, http);
    http->SetRequestHandler(pages.Get());
+   Ref<Http::RequestHandler> metrics;  // every counter, for Prometheus
+   Http::CreatePrometheusRequestHandler(nullptr, metrics);
+   http->AddRequestHandler("/metrics", metrics.Get());
    http->Start();
 
    Service::StartSignalThread([&](int signal) {

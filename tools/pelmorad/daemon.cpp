@@ -10,9 +10,9 @@
 #include <thread>
 
 #include "pelmora/exception/exceptions.h"
+#include "pelmora/http/prometheusHandler.h"
 #include "pelmora/http/url.h"
 #include "pelmora/io/writers.h"
-#include "pelmora/perfCounter/prometheus.h"
 #include "pelmora/perfCounter/registry.h"
 #include "pelmora/service/app.h"
 #include "pelmora/service/daemon.h"
@@ -341,11 +341,14 @@ void Daemon::RegisterEndpoints() {
       json.EndObject();
       ReplyJson(response, Http::ResponseCode::Ok, json.Text());
    });
-   serve("/metrics", kMetrics, [](Http::Request*, Http::Response* response) {
-      Ref<StringWriter> text;
-      CreateStringWriter(text);
-      PerfCounter::WritePrometheusText(PerfCounter::GetCounterRegistry(), text.Get());
-      Reply(response, Http::ResponseCode::Ok, "text/plain; version=0.0.4; charset=utf-8", text->GetString());
+   Ref<Http::RequestHandler> metrics;
+   Http::CreatePrometheusRequestHandler(PerfCounter::GetCounterRegistry(), metrics);
+   serve("/metrics", kMetrics, [metrics](Http::Request* request, Http::Response* response) {
+      if (request->GetMethod() == Http::RequestHeader::HEAD) {
+         metrics->HandleHead(request, response);
+      } else {
+         metrics->HandleGet(request, response);
+      }
    });
    serve("/healthz", kHealth, [this](Http::Request*, Http::Response* response) {
       if (IsStopping()) {
