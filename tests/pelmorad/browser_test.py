@@ -1,6 +1,7 @@
 """The status page in headless Chromium through Selenium: it renders without JavaScript
 errors, the counters table fills in, and screenshots at desktop and phone width are
 written to OUTPUT_DIR. Exits 77 (skipped) when no browser can be started.
+$PELMORAD_CHROMIUM and $PELMORAD_CHROMEDRIVER name other binaries.
 
 usage: browser_test.py PELMORAD_BINARY OUTPUT_DIR
 """
@@ -25,17 +26,19 @@ def start_browser():
         from selenium.webdriver.chrome.service import Service
     except ImportError as e:
         skip("selenium is not installed (python3-selenium): %s" % e)
-    for path in ("/usr/bin/chromium", "/usr/bin/chromedriver"):
+    chromium = os.environ.get("PELMORAD_CHROMIUM", "/usr/bin/chromium")
+    driver = os.environ.get("PELMORAD_CHROMEDRIVER", "/usr/bin/chromedriver")
+    for path in (chromium, driver):
         if not os.path.exists(path):
             skip("%s is missing (chromium, chromium-driver)" % path)
     options = webdriver.ChromeOptions()
-    options.binary_location = "/usr/bin/chromium"
+    options.binary_location = chromium
     for arg in ("--headless=new", "--no-sandbox", "--disable-gpu", "--disable-dev-shm-usage",
                 "--window-size=1280,1000"):
         options.add_argument(arg)
     options.set_capability("goog:loggingPrefs", {"browser": "ALL"})
     try:
-        return webdriver.Chrome(service=Service("/usr/bin/chromedriver"), options=options)
+        return webdriver.Chrome(service=Service(driver), options=options)
     except Exception as e:  # no display libraries, a driver of another version ...
         skip("the browser did not start: %s" % str(e).splitlines()[0])
 
