@@ -25,7 +25,7 @@ TEST_CONFIG = """<?xml version="1.0"?>
 
 class Daemon:
     def __init__(self, binary, extra_args=(), config_text=None, config_name="test.xml",
-                 drain_ms=0, deadline_ms=5000):
+                 drain_ms=0, deadline_ms=5000, env=None):
         self.dir = tempfile.mkdtemp(prefix="pelmorad-test-")
         self.state = os.path.join(self.dir, "state")
         self.config = os.path.join(self.dir, config_name)
@@ -36,7 +36,7 @@ class Daemon:
             f.write(config_text)
         args = [binary, "--port", "0", "--state-dir", self.state, "--config", self.config]
         self.proc = subprocess.Popen(args + list(extra_args), stdout=subprocess.PIPE,
-                                     stderr=subprocess.PIPE)
+                                     stderr=subprocess.PIPE, env=env)
         self.url = self._read_url(timeout=20)
 
     def _read_url(self, timeout):

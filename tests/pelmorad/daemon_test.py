@@ -219,6 +219,41 @@ class ReloadTest(unittest.TestCase):
             d.close()
 
 
+class ServiceManagerTest(unittest.TestCase):
+    def test_ready_once_serving_watchdog_fed_and_stopping_told(self):
+        import socket
+        import tempfile
+        sock_dir = tempfile.mkdtemp(prefix="pelmorad-notify-")
+        path = os.path.join(sock_dir, "notify")
+        listener = socket.socket(socket.AF_UNIX, socket.SOCK_DGRAM)
+        listener.bind(path)
+        listener.settimeout(10)
+        env = dict(os.environ, NOTIFY_SOCKET=path, WATCHDOG_USEC="100000")
+        d = None
+        try:
+            d = Daemon(BINARY, env=env)
+            messages = []
+
+            def receive_until(word):
+                while not any(word in m for m in messages):
+                    messages.append(listener.recv(4096).decode())
+
+            receive_until("READY=1")
+            # Ready means serving.
+            self.assertEqual(d.get("/healthz")[0], 200)
+            ready = next(m for m in messages if "READY=1" in m)
+            self.assertIn("MAINPID=%d" % d.proc.pid, ready)
+            receive_until("WATCHDOG=1")
+            d.signal(signal.SIGTERM)
+            receive_until("STOPPING=1")
+            self.assertEqual(d.wait(timeout=15), 0)
+        finally:
+            listener.close()
+            if d:
+                d.close()
+            subprocess.run(["rm", "-rf", sock_dir])
+
+
 class CommandLineTest(unittest.TestCase):
     def assertOneLineError(self, args, *needles):
         r = run(args)

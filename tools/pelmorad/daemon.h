@@ -39,6 +39,10 @@ public:
    bool IsStopping() const { return _stopping.load(); }
    long long GetUptimeSeconds() const;
 
+   // The file given with --config (empty: the compiled-in defaults only), where
+   // configuration changes are written back.
+   const std::string& GetConfigFile() const { return _options.configFile; }
+   const std::string& GetStateDir() const { return _stateDir; }
    // Where more endpoints are added (a path prefix per handler).
    Http::HttpSvc* GetHttpService() const { return _svc.Get(); }
    Http::DocumentHandler* GetDocumentHandler() const { return _documents.Get(); }
