@@ -288,6 +288,14 @@ class CommandLineTest(unittest.TestCase):
             with open(flat, "w") as f:
                 f.write("this is not a setting\n")
             self.assertOneLineError(["--config", flat], flat)
+            # A value of the wrong kind is found once the daemon reads it; the key is named.
+            port = os.path.join(tmp, "port.conf")
+            with open(port, "w") as f:
+                f.write('pelmorad/http/port = "eighty"\nlog/outputToConsole = "false"\n')
+            r = run(["--config", port, "--state-dir", os.path.join(tmp, "state")])
+            self.assertEqual(r.returncode, 2, r.stderr)
+            self.assertEqual(r.stderr.splitlines(), [r.stderr.strip()])
+            self.assertRegex(r.stderr, r"^pelmorad: bad value for pelmorad/http/port in the configuration: ")
         finally:
             subprocess.run(["rm", "-rf", tmp])
 

@@ -22,6 +22,7 @@
 #include "pelmora/system/threadState.h"
 #include "tools/pelmorad/embedded.h"
 #include "tools/pelmorad/json.h"
+#include "tools/pelmorad/settings.h"
 #include "tools/pelmorad/statusApi.h"
 
 namespace Pelmora::Daemon {
@@ -182,13 +183,20 @@ void Daemon::Start() {
    config->GetView("pelmora/http", httpView);
    std::string address = "127.0.0.1", docroot;
    int port = 8080;
-   view->Get("pelmorad/http/address", &address);
-   view->Get("pelmorad/http/port", &port);
-   view->Get("pelmorad/docroot", &docroot);
-   view->Get("pelmorad/status/logLines", &_logLines);
-   view->Get("pelmorad/debug/sleepEndpoint", &_sleepEndpoint);
-   view->Get("pelmorad/debug/maxSleepMs", &_maxSleepMs);
-   view->Get("pelmorad/shutdown/drainDelayMs", &_drainDelayMs);
+   auto read = [&view](const std::string& key, auto* value) {
+      try {
+         view->Get(key, value);
+      } catch (const Exception& e) {
+         throw ConfigError("bad value for " + key + " in the configuration: " + e.GetMessage());
+      }
+   };
+   read("pelmorad/http/address", &address);
+   read("pelmorad/http/port", &port);
+   read("pelmorad/docroot", &docroot);
+   read("pelmorad/status/logLines", &_logLines);
+   read("pelmorad/debug/sleepEndpoint", &_sleepEndpoint);
+   read("pelmorad/debug/maxSleepMs", &_maxSleepMs);
+   read("pelmorad/shutdown/drainDelayMs", &_drainDelayMs);
    if (!_options.listen.empty()) address = _options.listen;
    if (_options.port >= 0) port = _options.port;
 
@@ -211,8 +219,13 @@ void Daemon::Start() {
    Http::CreateHttpSvc(socket.Get(), nullptr, httpView.Get(), _svc);
    _svc->SetRequestHandler(_documents.Get());
    _svc->Start();
-   Service::StartSignalThread([this](int number) { OnSignal(number); });
-   _signalsTaken = true;
+   try {
+      Service::StartSignalThread([this](int number) { OnSignal(number); });
+      _signalsTaken = true;
+   } catch (const AlreadyInitializedException&) {
+      PELMORA_LOG_WARNING(DaemonLogger(), "pelmora/daemon/handleSignals is on: a stop will not let "
+                                          "requests in progress finish");
+   }
    PELMORA_LOG_INFO(DaemonLogger(), "Serving %1 (state in %2%3%4)", _url, _stateDir,
                     docroot.empty() ? "" : ", documents from ", docroot);
 }

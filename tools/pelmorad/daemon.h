@@ -26,7 +26,8 @@ public:
    Daemon& operator=(const Daemon&) = delete;
 
    // Binds the listening socket, registers the endpoints, starts serving and takes the
-   // signals. The socket's exceptions leave it (an address in use).
+   // signals. ConfigError for a malformed setting; the socket's exceptions leave it (an
+   // address in use).
    void Start();
    // "http://127.0.0.1:8080/", with the port actually bound.
    const std::string& GetUrl() const { return _url; }

@@ -38,11 +38,16 @@ int main(int argc, char** argv) {
       Daemon::Daemon daemon(options, stateDir);
       try {
          daemon.Start();
+      } catch (const Daemon::ConfigError& e) {
+         std::fprintf(stderr, "pelmorad: %s\n", e.what());
+         status = 2;
       } catch (const Exception& e) {
          std::fprintf(stderr, "pelmorad: cannot serve: %s\n", e.GetMessage().c_str());
-         Service::GetApp()->Stop();
+         status = 1;
+      }
+      if (status != 0) {
          Service::GetApp()->Exit();
-         Service::QuickExit(1);
+         Service::QuickExit(status);
       }
       std::printf("pelmorad %s: serving %s - open it in a browser; Ctrl-C stops\n", PELMORAD_VERSION,
                   daemon.GetUrl().c_str());
