@@ -365,6 +365,19 @@ class ConfigurationTest(unittest.TestCase):
         finally:
             d.close()
 
+    def test_flags_win_over_the_file(self):
+        text = ("<config><pelmorad><http><address>127.0.0.3</address><port>1</port></http>"
+                "<stateDir>/nonexistent/elsewhere</stateDir></pelmorad></config>\n")
+        d = Daemon(BINARY, config_text=text, extra_args=["--listen=127.0.0.2"])
+        try:
+            self.assertTrue(d.url.startswith("http://127.0.0.2:"), d.url)
+            self.assertNotEqual(d.url, "http://127.0.0.2:1/")
+            self.assertEqual(json.loads(d.get("/api/status")[2])["stateDir"], d.state)
+            self.assertTrue(os.path.exists(d.log_path))
+            self.assertEqual(d.stop(), 0)
+        finally:
+            d.close()
+
     def test_documents_come_from_a_configured_root_without_escaping_it(self):
         import tempfile
         root = tempfile.mkdtemp(prefix="pelmorad-docroot-")
