@@ -35,8 +35,11 @@ class Daemon:
         with open(self.config, mode) as f:
             f.write(config_text)
         args = [binary, "--port", "0", "--state-dir", self.state, "--config", self.config]
-        self.proc = subprocess.Popen(args + list(extra_args), stdout=subprocess.PIPE,
-                                     stderr=subprocess.PIPE, env=env)
+        # Standard error goes to a file: a pipe nobody reads would stall a chatty daemon.
+        self.stderr_path = os.path.join(self.dir, "stderr.txt")
+        with open(self.stderr_path, "wb") as err:
+            self.proc = subprocess.Popen(args + list(extra_args), stdout=subprocess.PIPE,
+                                         stderr=err, env=env)
         self.url = self._read_url(timeout=20)
 
     def _read_url(self, timeout):
@@ -54,7 +57,7 @@ class Daemon:
                     if "serving http://" in text:
                         return text.split("serving ", 1)[1].split()[0]
                     line = b""
-        err = self.proc.stderr.read1(4096) if self.proc.poll() is not None else b""
+        err = self.stderr()
         self.close()
         raise AssertionError("pelmorad did not print its URL: %r %r" % (line, err))
 
@@ -69,6 +72,10 @@ class Daemon:
         except FileNotFoundError:
             return ""
 
+    def stderr(self):
+        with open(self.stderr_path, errors="replace") as f:
+            return f.read()
+
     def get(self, path, timeout=10):
         """(status, headers, body bytes) of GET path."""
         try:
@@ -80,27 +87,38 @@ class Daemon:
     def signal(self, number):
         self.proc.send_signal(number)
 
-    def wait(self, timeout):
-        return self.proc.wait(timeout=timeout)
-
     def stop(self, timeout=20):
         """SIGTERM, then the exit status; killed when it does not end in time."""
         if self.proc.poll() is None:
             self.proc.send_signal(signal.SIGTERM)
         try:
-            return self.proc.wait(timeout=timeout)
+            status = self.proc.wait(timeout=timeout)
         except subprocess.TimeoutExpired:
             self.proc.kill()
             self.proc.wait()
             raise
+        self.check_sanitizers()
+        return status
+
+    def wait(self, timeout):
+        status = self.proc.wait(timeout=timeout)
+        self.check_sanitizers()
+        return status
+
+    def check_sanitizers(self):
+        """A sanitizer build reports through standard error and may still exit 0."""
+        text = self.stderr()
+        for marker in ("ERROR: AddressSanitizer", "WARNING: ThreadSanitizer",
+                       "runtime error:", "ERROR: LeakSanitizer"):
+            if marker in text:
+                raise AssertionError("sanitizer report from pelmorad:\n" + text[-6000:])
 
     def close(self):
         if self.proc.poll() is None:
             self.proc.kill()
             self.proc.wait()
-        for stream in (self.proc.stdout, self.proc.stderr):
-            if stream:
-                stream.close()
+        if self.proc.stdout:
+            self.proc.stdout.close()
         shutil.rmtree(self.dir, ignore_errors=True)
 
 
