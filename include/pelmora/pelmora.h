@@ -9,5 +9,6 @@
 #include "pelmora/object.h"
 #include "pelmora/perfCounter.h"
 #include "pelmora/service.h"
+#include "pelmora/soap.h"
 #include "pelmora/system.h"
 #include "pelmora/xml.h"
