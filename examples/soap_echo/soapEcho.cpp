@@ -3,7 +3,11 @@
 // standard input/output (--stdio) or as a CGI program (--cgi, or when GATEWAY_INTERFACE
 // is set).
 //
-//   soap_echo [--host H] [--port N] [--wsdl-root DIR] [--config FILE] [--stdio | --cgi]
+//   soap_echo [--host H] [--port N] [--wsdl-root DIR] [--config FILE] [--max-sessions N]
+//             [--stdio | --cgi]
+//
+// --max-sessions sets "pelmora/soap/maxSessionCount"; 0 serves without sessions, as a load
+// generator that never sends cookies back needs.
 
 #include <signal.h>
 
@@ -24,7 +28,9 @@ using namespace Pelmora;
 namespace {
 
 int Usage(const char* program) {
-   std::fprintf(stderr, "usage: %s [--host H] [--port N] [--wsdl-root DIR] [--config FILE] [--stdio | --cgi]\n",
+   std::fprintf(stderr,
+                "usage: %s [--host H] [--port N] [--wsdl-root DIR] [--config FILE] [--max-sessions N] "
+                "[--stdio | --cgi]\n",
                 program);
    return 2;
 }
@@ -47,7 +53,7 @@ void ServeOneRequest(bool cgi) {
 }  // namespace
 
 int main(int argc, char** argv) {
-   std::string host = "127.0.0.1", wsdlRoot = PELMORA_SOAP_ECHO_WSDL_DIR, configFile;
+   std::string host = "127.0.0.1", wsdlRoot = PELMORA_SOAP_ECHO_WSDL_DIR, configFile, maxSessions;
    int port = 18490;
    bool stdio = false, cgi = std::getenv("GATEWAY_INTERFACE") != nullptr;
    for (int i = 1; i < argc; ++i) {
@@ -66,6 +72,8 @@ int main(int argc, char** argv) {
          wsdlRoot = argv[++i];
       } else if (option == "--config") {
          configFile = argv[++i];
+      } else if (option == "--max-sessions") {
+         maxSessions = argv[++i];
       } else {
          return Usage(argv[0]);
       }
@@ -89,14 +97,17 @@ int main(int argc, char** argv) {
       Ref<System::ThreadPool> pool;
       System::CreateThreadPool(nullptr, pool);
       System::SetThreadPool(pool.Get());
-      Ref<Service::Config::View> httpView, soapView;
+      Ref<Service::Config> config;
       if (!configFile.empty()) {
-         Ref<Service::Config> config;
          Service::CreateXmlFileConfig(configFile, 0, 0, config);
          config->Load();
-         config->GetView("pelmora/http", httpView);
-         config->GetView("pelmora/soap", soapView);
+      } else {
+         Service::CreateScratchConfig(config);
       }
+      Ref<Service::Config::View> httpView, soapView;
+      config->GetView("pelmora/http", httpView);
+      config->GetView("pelmora/soap", soapView);
+      if (!maxSessions.empty()) soapView->Set("maxSessionCount", maxSessions.c_str());
       System::ServerSocketOptions options;
       options.backlog = 1024;
       Ref<System::ServerSocket> socket;

@@ -33,16 +33,16 @@ bool IsSoapElement(const Xml::ElementNode* element, const char* localName) {
 // Unlinks `element` from its parent after copying onto it every namespace declaration in
 // scope there that it does not make itself. The caller holds a reference to it.
 void Detach(Xml::ElementNode* element) {
-   std::map<std::string, std::string> own;
-   element->GetAttributes(own);
+   std::map<std::string, std::string> attributes;
+   std::string ignored;
    for (Xml::Node* up = element->GetParent(); up != nullptr; up = up->GetParent()) {
+      if (up->GetNodeType() != Xml::kElementNode) break;
       auto* ancestor = dynamic_cast<Xml::ElementNode*>(up);
-      if (ancestor == nullptr) break;
-      std::map<std::string, std::string> attributes;
       ancestor->GetAttributes(attributes);
       for (const auto& [name, value] : attributes) {
-         bool declaration = name == "xmlns" || name.compare(0, 6, "xmlns:") == 0;
-         if (declaration && own.emplace(name, value).second) element->DefineAttribute(name, value);
+         bool declaration = name.compare(0, 5, "xmlns") == 0 && (name.size() == 5 || name[5] == ':');
+         // Nearer declarations were copied first and win.
+         if (declaration && !element->GetAttribute(name, ignored)) element->DefineAttribute(name, value);
       }
    }
    element->GetParent()->RemoveChild(element);
