@@ -20,6 +20,8 @@ namespace Pelmora::Soap {
 
 namespace {
 
+constexpr char kSessionCookie[] = "norvex_soap_session";
+
 std::string MakeUuid() {
    unsigned char bytes[16];
    size_t got = 0;
@@ -116,7 +118,12 @@ public:
          maxBytes = _settings.maxRequestBytes;
       }
       SoapRequestImpl::Fields fields;
-      // SESSION_STEP
+      if (sessions && !Http::ResolveSession(sessions.Get(), request, response, fields.session)) {
+         PELMORA_LOG_WARNING(_logger.Get(), "No SOAP session to be had for %1: the session limit is reached",
+                             request->GetPath());
+         response->SendError(Http::ResponseCode::ServiceUnavailable);
+         return;
+      }
       const Http::RequestHeader& header = request->GetHeader();
       fields.hasUserAgent = header.GetField("User-Agent", fields.userAgent);
       fields.hasClient = header.GetField("norvex_client", fields.client);
@@ -234,6 +241,20 @@ public:
          _view->Get("wsdlRoot", &settings.wsdlRoot);
       }
       _handler->SetSettings(settings);
+      if (settings.maxSessionCount > 0) {
+         Http::SessionServiceConfig sessionConfig;
+         sessionConfig.cookieName = kSessionCookie;
+         sessionConfig.maxSessionCount = static_cast<size_t>(settings.maxSessionCount);
+         sessionConfig.idleTimeout = settings.sessionTimeoutSeconds > 0 ? settings.sessionTimeoutSeconds * 1000000 : -1;
+         // Short time-outs (tests, kiosks) are looked for as often as they can run out.
+         if (sessionConfig.idleTimeout > 0 && sessionConfig.idleTimeout < sessionConfig.expiryInterval)
+            sessionConfig.expiryInterval = sessionConfig.idleTimeout;
+         Ref<Http::SessionService> sessions;
+         Http::CreateSessionService(sessionConfig, _logger.Get(), sessions);
+         _handler->SetSessionService(sessions.Get());
+      }
+      PELMORA_LOG_INFO(_logger.Get(), "maxSessionCount: %1, sessionTimeout: %2 s", settings.maxSessionCount,
+                       settings.sessionTimeoutSeconds);
       _httpSvc->AddRequestHandler(settings.path, _handler.Get());
       _httpSvc->AddRequestHandler(settings.serviceStatePath, _handler.Get());
       _paths = {settings.path, settings.serviceStatePath};

@@ -43,6 +43,8 @@ public:
          request->GetSoapAction(action);
          request->GetUserAgent(agent);
          request->GetNorvexClient(client);
+         Ref<Http::Session> session;
+         sessionId = request->GetSession(session) ? session->GetId() : "(none)";
       }
       std::string text, repeat;
       Xml::EvaluateSimplePath(body, "*/in", text);
@@ -60,7 +62,7 @@ public:
       reply->WriteReply(response.Get());
    }
    std::mutex mutex;
-   std::string action, agent, client;
+   std::string action, agent, client, sessionId;
 };
 
 // Answers what the SOAP service does not serve.
@@ -160,6 +162,45 @@ TEST_F(SoapSvcOnHttpTest, RequestFieldsReachTheHandler) {
    std::lock_guard<std::mutex> lock(_echo->mutex);
    EXPECT_EQ(_echo->action, "(none)");
    EXPECT_EQ(_echo->client, "(none)");
+}
+
+TEST_F(SoapSvcOnHttpTest, CallsKeepTheirSessionByCookieUntilTheLimit) {
+   Start({{"maxSessionCount", "1"}});
+   std::string response = Exchange(Post(kRequest));
+   EXPECT_EQ(response.rfind("HTTP/1.1 200 OK", 0), 0u) << response;
+   size_t at = response.find("Set-Cookie: norvex_soap_session=");
+   ASSERT_NE(at, std::string::npos) << response;
+   std::string id = response.substr(at + 32, 32);
+   {
+      std::lock_guard<std::mutex> lock(_echo->mutex);
+      EXPECT_EQ(_echo->sessionId, id);
+   }
+   // The cookie brings the same session back, on another connection, and sets nothing new.
+   response = Exchange(Post(kRequest, "Cookie: norvex_soap_session=" + id + "\r\n"));
+   EXPECT_EQ(response.rfind("HTTP/1.1 200 OK", 0), 0u) << response;
+   EXPECT_EQ(response.find("Set-Cookie"), std::string::npos) << response;
+   {
+      std::lock_guard<std::mutex> lock(_echo->mutex);
+      EXPECT_EQ(_echo->sessionId, id);
+   }
+   // A caller without the cookie would need a second session.
+   response = Exchange(Post(kRequest));
+   EXPECT_EQ(response.rfind("HTTP/1.1 503 ", 0), 0u) << response;
+   Ref<Http::SessionService> sessions;
+   _soap->GetSessionService(sessions);
+   ASSERT_TRUE(sessions);
+   EXPECT_EQ(sessions->GetSessionCount(), 1u);
+}
+
+TEST_F(SoapSvcOnHttpTest, NoSessionsWhenTheCountIsZero) {
+   Start({{"maxSessionCount", "0"}});
+   for (int i = 0; i < 3; ++i) {
+      std::string response = Exchange(Post(kRequest));
+      EXPECT_EQ(response.rfind("HTTP/1.1 200 OK", 0), 0u) << response;
+      EXPECT_EQ(response.find("Set-Cookie"), std::string::npos);
+   }
+   std::lock_guard<std::mutex> lock(_echo->mutex);
+   EXPECT_EQ(_echo->sessionId, "(none)");
 }
 
 TEST_F(SoapSvcOnHttpTest, UnacceptableEnvelopesGetClientFaults) {

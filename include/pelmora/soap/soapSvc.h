@@ -110,8 +110,8 @@ public:
 // SOAP over HTTP. Settings under "pelmora/soap" (docs/soap.md): "path" (default "/soap")
 // and "serviceStatePath" (default "/serviceState") are the paths Start registers with the
 // HTTP service; "enableChunkedResponses" (false); "maxRequestBytes" (10 MiB);
-// "maxSessionCount" (10000) and "sessionTimeout" (seconds, 1800; 0 or less: never) for the
-// sessions named by the cookie "norvex_soap_session"; "wsdlRoot" (none).
+// "maxSessionCount" (10000; 0: no sessions) and "sessionTimeout" (seconds, 1800; 0 or less:
+// never) for the sessions named by the cookie "norvex_soap_session"; "wsdlRoot" (none).
 class PELMORA_EXPORT HttpSoapSvc : public virtual SoapSvc {
 public:
    // The directory whose documents GET ".../name?wsdl" serves; empty: none.
