@@ -13,19 +13,14 @@ namespace {
 
 using namespace PoolTesting;
 
-class PollSchedulerTest : public testing::Test {
+class PollSchedulerTest : public PoolTest {
 protected:
-   PollSchedulerTest() : control(new TestThreadControl(true)) {}
-   // Shuts down before the test's locals, which callbacks may still use, go away.
-   void Finish() {
-      if (pool) ShutDown(pool.Get());
-      pool.Reset();
-   }
+   // The pool stops polling before the descriptors close.
    ~PollSchedulerTest() override {
       Finish();
       for (int fd : fds) close(fd);
    }
-   void Start() { pool = MakePool({{"minThreads", "2"}}, control.Get()); }
+   void Start() { Pool({{"minThreads", "2"}}); }
    void Pipe(int& readFd, int& writeFd) {
       int pair[2];
       ASSERT_EQ(0, pipe(pair));
@@ -35,8 +30,6 @@ protected:
       fds.push_back(writeFd);
    }
 
-   Ref<TestThreadControl> control;
-   Ref<ThreadPoolFair> pool;
    std::vector<int> fds;
 };
 

@@ -132,4 +132,23 @@ inline void ShutDown(ThreadPool* pool) {
    EXPECT_TRUE(pool->WaitShutdown(10000000)) << "pool threads did not leave";
 }
 
+// A test on a pool whose threads start at once. Tests call Finish before their locals,
+// which items may still use, go away; the destructor catches the rest.
+class PoolTest : public testing::Test {
+protected:
+   ~PoolTest() override { Finish(); }
+   Ref<ThreadPoolFair> Pool(const Settings& settings,
+                            long long shrinkPeriod = ThreadPoolFair::kShrinkPeriodMicroseconds) {
+      pool = MakePool(settings, control.Get(), shrinkPeriod);
+      return pool;
+   }
+   void Finish() {
+      if (pool) ShutDown(pool.Get());
+      pool.Reset();
+   }
+
+   Ref<TestThreadControl> control{new TestThreadControl(true)};
+   Ref<ThreadPoolFair> pool;
+};
+
 }  // namespace Pelmora::System::PoolTesting

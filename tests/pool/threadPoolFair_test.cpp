@@ -56,23 +56,7 @@ private:
    std::atomic<int>* _living;
 };
 
-class ThreadPoolFairTest : public testing::Test {
-protected:
-   Ref<ThreadPoolFair> Pool(const Settings& settings,
-                            long long shrinkPeriod = ThreadPoolFair::kShrinkPeriodMicroseconds) {
-      pool = MakePool(settings, control.Get(), shrinkPeriod);
-      return pool;
-   }
-   // Shuts down before the test's locals, which items may still use, go away.
-   void Finish() {
-      if (pool) ShutDown(pool.Get());
-      pool.Reset();
-   }
-   void TearDown() override { Finish(); }
-
-   Ref<TestThreadControl> control{new TestThreadControl(true)};
-   Ref<ThreadPoolFair> pool;
-};
+using ThreadPoolFairTest = PoolTest;
 
 TEST_F(ThreadPoolFairTest, StackSizesAreClampedWithWarnings) {
    const std::pair<const char*, long long> cases[] = {{"0", 256}, {"10", 32}, {"4096", 2048}, {"100", 100}};

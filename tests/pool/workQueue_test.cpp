@@ -17,20 +17,9 @@ namespace {
 
 using namespace PoolTesting;
 
-class WorkQueueTest : public testing::Test {
+class WorkQueueTest : public PoolTest {
 protected:
-   WorkQueueTest() : control(new TestThreadControl(true)) {
-      pool = MakePool({{"minThreads", "4"}, {"maxThreads", "8"}}, control.Get());
-   }
-   // Shuts down before the test's locals, which items may still use, go away.
-   void Finish() {
-      if (pool) ShutDown(pool.Get());
-      pool.Reset();
-   }
-   ~WorkQueueTest() override { Finish(); }
-
-   Ref<TestThreadControl> control;
-   Ref<ThreadPoolFair> pool;
+   WorkQueueTest() { Pool({{"minThreads", "4"}, {"maxThreads", "8"}}); }
 };
 
 // Many items on two serial queues of one level, posted from two threads: each queue
