@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "pelmora/exception/exceptions.h"
+#include "pelmora/io/writers.h"
 #include "pelmora/perfCounter.h"
 
 namespace Pelmora::PerfCounter::Testing {
@@ -41,6 +42,14 @@ inline Ref<RegistryItem> AddGroup(Registry* registry, const std::vector<std::str
    registry->RegisterGroup(metadata, publisher.Get(), item);
    if (out) *out = publisher;
    return item;
+}
+
+// The builder's text, one line per key.
+inline std::string Serialized(const LwStatsBuilder& builder) {
+   Ref<StringWriter> writer;
+   CreateStringWriter(writer);
+   builder.Serialize(writer.Get());
+   return writer->GetString();
 }
 
 // A private registry whose groups added through Add are unregistered after the test.

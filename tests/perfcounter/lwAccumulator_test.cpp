@@ -1,4 +1,3 @@
-#include "pelmora/io/writers.h"
 #include "tests/perfcounter/fixture.h"
 #include "tests/support/logCapture.h"
 
@@ -6,7 +5,6 @@ namespace Pelmora::PerfCounter::Testing {
 namespace {
 
 using testing::ElementsAre;
-using testing::HasSubstr;
 
 TEST(ValidateStatsScopeTest, KeysFollowTheScopeGrammar) {
    for (const char* key : {"Pool/Thread='io'/Busy", "A", "A='x'", "A/B='1'/C", "Zed='a b'/Q"}) {

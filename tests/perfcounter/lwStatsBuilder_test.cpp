@@ -1,4 +1,3 @@
-#include "pelmora/io/writers.h"
 #include "tests/perfcounter/fixture.h"
 #include "tests/support/logCapture.h"
 
@@ -6,14 +5,6 @@ namespace Pelmora::PerfCounter::Testing {
 namespace {
 
 using testing::ElementsAre;
-using testing::HasSubstr;
-
-std::string Serialized(const LwStatsBuilder& builder) {
-   Ref<StringWriter> writer;
-   CreateStringWriter(writer);
-   builder.Serialize(writer.Get());
-   return writer->GetString();
-}
 
 TEST(LwStatsBuilderTest, NamespacesMakeKeysAndAccumulatorsAccumulate) {
    Ref<LwStatsBuilder> builder, other;

@@ -1,4 +1,3 @@
-#include "pelmora/io/writers.h"
 #include "tests/perfcounter/fixture.h"
 #include "pelmora/object/scoreboard.h"
 
@@ -6,13 +5,6 @@ namespace Pelmora::PerfCounter::Testing {
 namespace {
 
 using testing::HasSubstr;
-
-std::string Serialized(const LwStatsBuilder& builder) {
-   Ref<StringWriter> writer;
-   CreateStringWriter(writer);
-   builder.Serialize(writer.Get());
-   return writer->GetString();
-}
 
 class Tracked : public ObjectImpl {};
 
