@@ -5,11 +5,9 @@
 
 #include <chrono>
 #include <csignal>
-#include <dirent.h>
-#include <fstream>
+#include <filesystem>
 #include <map>
 #include <random>
-#include <sstream>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -27,47 +25,14 @@ using namespace Pelmora::TestSupport;
 using Tree = std::map<std::string, std::string>;
 
 // Everything under `root`, hidden files included: a leftover temporary or kept copy counts.
-void Scan(const std::string& root, const std::string& rel, Tree& out) {
-   DIR* dir = ::opendir((root + rel).c_str());
-   if (!dir) return;
-   while (dirent* e = ::readdir(dir)) {
-      std::string name = e->d_name;
-      if (name == "." || name == "..") continue;
-      std::string path = rel + "/" + name;
-      struct stat st;
-      ::lstat((root + path).c_str(), &st);
-      if (S_ISDIR(st.st_mode)) {
-         out[path] = "/";
-         Scan(root, path, out);
-      } else {
-         out[path] = ReadAll(root + path);
-      }
-   }
-   ::closedir(dir);
-}
-
 Tree Snapshot(const std::string& root) {
    Tree tree;
-   Scan(root, "", tree);
-   return tree;
-}
-
-void RemoveTree(const std::string& path) {
-   struct stat st;
-   if (::lstat(path.c_str(), &st) != 0) return;
-   if (S_ISDIR(st.st_mode)) {
-      Tree children;
-      if (DIR* dir = ::opendir(path.c_str())) {
-         while (dirent* e = ::readdir(dir)) {
-            std::string name = e->d_name;
-            if (name != "." && name != "..") RemoveTree(path + "/" + name);
-         }
-         ::closedir(dir);
-      }
-      ::rmdir(path.c_str());
-   } else {
-      ::unlink(path.c_str());
+   std::error_code error;
+   for (const auto& entry : std::filesystem::recursive_directory_iterator(root, error)) {
+      const bool directory = std::filesystem::is_directory(entry.symlink_status());
+      tree[entry.path().string().substr(root.size())] = directory ? "/" : ReadAll(entry.path());
    }
+   return tree;
 }
 
 class FileOpsJournalTest : public testing::Test {
@@ -79,7 +44,7 @@ protected:
       _journal = _dir + "/journal";
       ::mkdir(_root.c_str(), 0755);
    }
-   void TearDown() override { RemoveTree(_dir); }
+   void TearDown() override { std::filesystem::remove_all(_dir); }
 
    Ref<BasicFileOpsJournal> Open(bool create) {
       Ref<BasicFileOpsJournal> journal;

@@ -38,6 +38,9 @@ std::string HeaderBytes(JrnlHeader& header) {
    return writer->GetString();
 }
 
+const std::string tooSmall = "Buffer is too small to have a full record. Journal might be corrupt";
+const std::string unexpected = "Unexpected character found in the header. Perhaps corrupt journal";
+
 std::string Message(const std::function<void()>& f) {
    try {
       f();
@@ -85,8 +88,6 @@ TEST(JournalEntryTest, EntriesReadBackWhatWasWritten) {
 }
 
 TEST(JournalEntryTest, MalformedRecordsAreRefused) {
-   const std::string tooSmall = "Buffer is too small to have a full record. Journal might be corrupt";
-   const std::string unexpected = "Unexpected character found in the header. Perhaps corrupt journal";
    // A string whose length runs past the record.
    EXPECT_EQ(Message([&] { Parse<JrnlDirEntry>(U32(4) + std::string(1, '\1') + U32(9) + "ab"); }), tooSmall);
    // A string without its zero byte, and one with a zero inside.
@@ -132,19 +133,18 @@ TEST(JournalHeaderTest, LayoutAndLength) {
 }
 
 TEST(JournalHeaderTest, MalformedHeadersAreRefused) {
-   const std::string tooSmall = "Buffer is too small to have a full record. Journal might be corrupt";
-   const std::string unexpected = "Unexpected character found in the header. Perhaps corrupt journal";
    JrnlHeader header;
-   std::string twenty(20, '\0');
-   EXPECT_EQ(Message([&] { header.Deserialize(twenty.data(), 20); }), tooSmall);
-   std::string b = U32(1) + U32(2) + U32(3) + U32(50) + U32(3) + std::string("id\0", 3);
-   EXPECT_EQ(Message([&] { header.Deserialize(b.data(), unsigned(b.size())); }), tooSmall);
-   b = U32(1) + U32(2) + U32(3) + U32(0) + U32(3) + std::string("idx", 3);
-   EXPECT_EQ(Message([&] { header.Deserialize(b.data(), unsigned(b.size())); }), unexpected);
-   b = U32(1) + U32(2) + U32(3) + U32(0) + U32(3) + std::string("i\0\0", 3);
-   EXPECT_EQ(Message([&] { header.Deserialize(b.data(), unsigned(b.size())); }), unexpected);
-   b = U32(1) + U32(2) + U32(3) + U32(0) + U32(0) + std::string("\0", 1);
-   EXPECT_EQ(Message([&] { header.Deserialize(b.data(), unsigned(b.size())); }), unexpected);
+   const std::string head = U32(1) + U32(2) + U32(3);
+   const std::pair<std::string, std::string> cases[] = {
+       {std::string(20, '\0'), tooSmall},
+       {head + U32(50) + U32(3) + std::string("id\0", 3), tooSmall},  // data past the end
+       {head + U32(0) + U32(3) + std::string("idx", 3), unexpected},   // no zero byte
+       {head + U32(0) + U32(3) + std::string("i\0\0", 3), unexpected},
+       {head + U32(0) + U32(0) + std::string("\0", 1), unexpected}};  // no id
+   for (const auto& [bytes, error] : cases) {
+      EXPECT_EQ(Message([&] { header.Deserialize(bytes.data(), unsigned(bytes.size())); }), error)
+          << testing::PrintToString(bytes);
+   }
    JrnlHeader noId(1, 2, 3, "");
    EXPECT_EQ(Message([&] { HeaderBytes(noId); }), "Serializing Invalid Header");
 }
