@@ -14,11 +14,8 @@ namespace {
 
 TEST(NodeFilterTest, SkipWsAndCommentsRejectsBlankTextAndComments) {
    SkipWsAndCommentsFilter filter;
-   EXPECT_FALSE(filter.Accept(Text("   \n").Get()));
-   EXPECT_FALSE(filter.Accept(Text("\t\r\n ").Get()));
-   EXPECT_FALSE(filter.Accept(Text("").Get()));
-   EXPECT_TRUE(filter.Accept(Text(" x ").Get()));
-   EXPECT_TRUE(filter.Accept(Text("\xc2\xa0").Get()));
+   for (const char* blank : {"   \n", "\t\r\n ", ""}) EXPECT_FALSE(filter.Accept(Text(blank).Get())) << blank;
+   for (const char* text : {" x ", "\xc2\xa0"}) EXPECT_TRUE(filter.Accept(Text(text).Get())) << text;
    EXPECT_FALSE(filter.Accept(Comment("c").Get()));
    EXPECT_TRUE(filter.Accept(Element("e").Get()));
 }
