@@ -559,19 +559,17 @@ TEST_F(ManagerTest, ConcurrentChecksSeeEitherTheOldOrTheNewPermission) {
    EXPECT_EQ(0, wrong.load());
 }
 
-TEST(ManagerDeathTest, InitWithoutAProviderPanics) {
-   Ref<AuthorizeManager> manager;
-   CreateAuthorizeManager(manager);
-   Ref<FakeDirectory> directory(new FakeDirectory());
-   Ref<MemoryStorage> storage(new MemoryStorage());
-   Ref<EntityTree> tree;
-   CreateEntityTree("root", tree);
-   EXPECT_DEATH(manager->Init(nullptr, storage.Get(), tree.Get(), nullptr), "Assert Failed: \"userDirectory != __null\"");
-   EXPECT_DEATH(manager->Init(directory.Get(), nullptr, tree.Get(), nullptr), "Assert Failed: \"storageProvider != __null\"");
-   EXPECT_DEATH(manager->Init(directory.Get(), storage.Get(), nullptr, nullptr), "Assert Failed: \"appModelProvider != __null\"");
+using ManagerDeathTest = ManagerTest;
+
+TEST_F(ManagerDeathTest, InitWithoutAProviderPanics) {
+   Ref<AuthorizeManager> made;
+   CreateAuthorizeManager(made);
+   EXPECT_DEATH(made->Init(nullptr, storage.Get(), tree.Get(), nullptr), "Assert Failed: \"userDirectory != __null\"");
+   EXPECT_DEATH(made->Init(directory.Get(), nullptr, tree.Get(), nullptr), "Assert Failed: \"storageProvider != __null\"");
+   EXPECT_DEATH(made->Init(directory.Get(), storage.Get(), nullptr, nullptr), "Assert Failed: \"appModelProvider != __null\"");
 }
 
-TEST_F(ManagerTest, InheritedAccessOutsideTheLockPanics) {
+TEST_F(ManagerDeathTest, InheritedAccessOutsideTheLockPanics) {
    Start();
    EXPECT_DEATH(manager->FindParentAccess("alice", nullptr, "vm", nullptr),
                 "Assert Failed: \"IsReadLocked\\(\\) \\|\\| IsWriteLocked\\(\\)\"");
