@@ -12,6 +12,7 @@
 #include <boost/asio/connect.hpp>
 
 #include "src/net/socketImpl.h"
+#include "src/net/tcpStream.h"
 
 namespace Pelmora::System {
 
@@ -36,8 +37,12 @@ protected:
       auto remote = socket.remote_endpoint(error);
       Ref<BindingInfo> peer = error ? Ref<BindingInfo>() : MakeBindingInfo(remote);
       std::string description = DescribeStream(_kind, local.Get(), peer.Get());
-      Ref<GenericStream<typename Protocol::socket>> stream = new GenericStream<typename Protocol::socket>(
-          std::move(socket), this->_options.completionQueue.Get(), description);
+      Ref<GenericStream<typename Protocol::socket>> stream;
+      if constexpr (std::is_same_v<Protocol, Tcp>)
+         stream = new TcpStream(std::move(socket), this->_options.completionQueue.Get(), description);
+      else
+         stream = new GenericStream<typename Protocol::socket>(std::move(socket),
+                                                               this->_options.completionQueue.Get(), description);
       stream->SetBindings(local, peer);
       done(nullptr, stream.Get());
    }
@@ -65,7 +70,11 @@ void FinishConnection(Socket&& socket, const char* kind, Ref<Stream>& out) {
    auto remote = socket.remote_endpoint(error);
    Ref<BindingInfo> peer = error ? Ref<BindingInfo>() : MakeBindingInfo(remote);
    std::string description = DescribeStream(kind, local.Get(), peer.Get());
-   Ref<GenericStream<Socket>> stream = new GenericStream<Socket>(std::move(socket), nullptr, description);
+   Ref<GenericStream<Socket>> stream;
+   if constexpr (std::is_same_v<Socket, Tcp::socket>)
+      stream = new TcpStream(std::move(socket), nullptr, description);
+   else
+      stream = new GenericStream<Socket>(std::move(socket), nullptr, description);
    stream->SetBindings(local, peer);
    out = stream;
 }

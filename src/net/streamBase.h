@@ -92,6 +92,22 @@ protected:
    virtual void CloseIo() = 0;
    // The transport finished an operation of that direction (`error` null on success).
    void CompleteIO(bool isWrite, Exception* error, int bytes);
+   // Runs `start` with the lock held as the write direction's operation (a file sent by
+   // the transport, say): the write time-out and Close apply to it as to a write, and it
+   // ends through CompleteIO(true, ...), which calls `callback`.
+   template <class Start>
+   void AsyncWriteOperation(Start&& start, const Functor<void, Stream*, Exception*>& callback) {
+      Synchronized lock(this);
+      CheckAsyncStateBeforeIO(_write);
+      _writeFun = callback;
+      try {
+         start();
+      } catch (...) {
+         _write.state = STATE_IDLE;
+         _writeFun.Reset();
+         throw;
+      }
+   }
 
    void SetBindings(Ref<BindingInfo> local, Ref<BindingInfo> peer);
    void FinalDecRef(const std::type_info& type) override;
