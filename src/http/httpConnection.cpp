@@ -4,6 +4,7 @@
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/logMacros.h"
+#include "pelmora/system/streamFileSender.h"
 #include "src/http/httpSvcImpl.h"
 #include "src/http/sessionImpl.h"
 
@@ -18,9 +19,30 @@ const ResponseCode::Info kHeaderFieldsTooLarge = {431, "Request Header Fields To
 
 // Passes everything to the accepted stream and tells the connection when request bytes
 // arrive, so that a client trickling a header is caught by the request deadline.
-class WatchedStream : public virtual System::Stream, public ObjectImpl {
+class WatchedStream : public virtual System::Stream, public virtual System::FileSender, public ObjectImpl {
 public:
-   WatchedStream(System::Stream* inner, HttpConnectionImpl* connection) : _inner(inner), _connection(connection) {}
+   WatchedStream(System::Stream* inner, HttpConnectionImpl* connection)
+       : _inner(inner), _sender(dynamic_cast<System::FileSender*>(inner)), _connection(connection) {}
+
+   bool CanSendFile() override { return _sender != nullptr && _sender->CanSendFile(); }
+   long long TrySendFile(int fd, long long offset, long long length) override {
+      long long n = Sender()->TrySendFile(fd, offset, length);
+      _written.fetch_add(n, std::memory_order_relaxed);
+      return n;
+   }
+   void AsyncSendFile(int fd, long long offset, long long length,
+                      const System::Functor<void, System::Stream*, Exception*, long long>& callback) override {
+      Ref<WatchedStream> self(this);
+      Sender()->AsyncSendFile(fd, offset, length, [self, callback](System::Stream*, Exception* e, long long n) {
+         self->_written.fetch_add(n, std::memory_order_relaxed);
+         callback(self.Get(), e, n);
+      });
+   }
+   long long SendFile(int fd, long long offset, long long length) override {
+      long long n = Sender()->SendFile(fd, offset, length);
+      _written.fetch_add(n, std::memory_order_relaxed);
+      return n;
+   }
 
    void Lock() override { _inner->Lock(); }
    void Unlock() override { _inner->Unlock(); }
@@ -57,17 +79,30 @@ public:
       _inner->AsyncWrite(buffer, length, [self, callback](System::Stream*, Exception* e) { callback(self.Get(), e); });
    }
    int Read(char* buffer, int length) override {
-      int n = _inner->Read(buffer, length);
-      if (n > 0) _connection->BytesArrived();
+      _connection->ReadBegins();
+      int n;
+      try {
+         n = _inner->Read(buffer, length);
+      } catch (...) {
+         _connection->ReadEnds(0);
+         throw;
+      }
+      _connection->ReadEnds(n);
       return n;
    }
    void AsyncRead(char* buffer, int length,
                   const System::Functor<void, System::Stream*, Exception*, int>& callback) override {
       Ref<WatchedStream> self(this);
-      _inner->AsyncRead(buffer, length, [self, callback](System::Stream*, Exception* e, int n) {
-         if (n > 0) self->_connection->BytesArrived();
-         callback(self.Get(), e, n);
-      });
+      _connection->ReadBegins();
+      try {
+         _inner->AsyncRead(buffer, length, [self, callback](System::Stream*, Exception* e, int n) {
+            self->_connection->ReadEnds(n);
+            callback(self.Get(), e, n);
+         });
+      } catch (...) {
+         _connection->ReadEnds(0);
+         throw;
+      }
    }
    void Close() override { _inner->Close(); }
    bool IsSecure() const override { return _inner->IsSecure(); }
@@ -75,7 +110,13 @@ public:
    long long Written() const { return _written.load(std::memory_order_relaxed); }
 
 private:
+   System::FileSender* Sender() {
+      if (_sender == nullptr) throw NotSupportedException();
+      return _sender;
+   }
+
    Ref<System::Stream> _inner;
+   System::FileSender* _sender;  // the inner stream's side, when it has one
    std::atomic<long long> _written{0};
    HttpConnectionImpl* _connection;  // owns this stream
 };
@@ -103,6 +144,7 @@ HttpConnectionImpl::HttpConnectionImpl(HttpSvcImpl* svc, System::Stream* stream)
    _stream = new WatchedStream(stream, this);
    svc->GetLogger()->CreateLogger("HttpConnection", _logger);
    CreateRequest(_stream.Get(), _request);
+   _request->SetMaxBodyBytes(svc->GetConfig().maxRequestBodyBytes);
    CreateResponse(this, _stream.Get(), _response);
 }
 
@@ -114,9 +156,15 @@ long long HttpConnectionImpl::GetReadTimeout() const {
 
 long long HttpConnectionImpl::GetMaxBufferedResponseBytes() { return GetHttpSvcConfig().maxBufferedResponseBytes; }
 
-void HttpConnectionImpl::BytesArrived() {
+void HttpConnectionImpl::ReadBegins() {
    std::lock_guard<std::mutex> lock(_mutex);
-   if (_state == WAITING && !_haveFirstByte) {
+   ++_readsPending;
+}
+
+void HttpConnectionImpl::ReadEnds(int count) {
+   std::lock_guard<std::mutex> lock(_mutex);
+   --_readsPending;
+   if (count > 0 && _state == WAITING && !_haveFirstByte) {
       _haveFirstByte = true;
       _firstByte = std::chrono::steady_clock::now();
    }
@@ -129,7 +177,10 @@ bool HttpConnectionImpl::IsIdle() {
 
 bool HttpConnectionImpl::IsOverdue(std::chrono::steady_clock::time_point now, long long limit) {
    std::lock_guard<std::mutex> lock(_mutex);
-   return _state == WAITING && _haveFirstByte && now - _firstByte > std::chrono::microseconds(limit);
+   // The deadline runs from the first byte of a request until its header is in and,
+   // while the handler waits for body bytes, until the body is in as well.
+   return _haveFirstByte && (_state == WAITING || (_state == BUSY && _readsPending > 0)) &&
+          now - _firstByte > std::chrono::microseconds(limit);
 }
 
 HttpConnectionImpl::State HttpConnectionImpl::GetState() {
@@ -218,7 +269,7 @@ bool HttpConnectionImpl::Process(Exception* error, bool gotRequest) {
       _state = BUSY;
    }
    if (error == nullptr && !_svc->IsRunning()) {
-      PELMORA_LOG_INFO(_logger.Get(), "Ignored pending request. State: %1", 0);
+      PELMORA_LOG_INFO(_logger.Get(), "Ignored pending request. State: %1", _svc->GetOpState());
       End();
       return false;
    }
@@ -243,18 +294,62 @@ bool HttpConnectionImpl::Process(Exception* error, bool gotRequest) {
    }
    _firstRequest = false;
    _completed = false;
-   auto began = std::chrono::steady_clock::now();
-   auto* watched = dynamic_cast<WatchedStream*>(_stream.Get());
-   long long writtenBefore = watched->Written();
+   _deferred = false;
+   if (GetHttpSvcConfig().accessLog) {
+      _began = std::chrono::steady_clock::now();
+      _writtenBefore = dynamic_cast<WatchedStream*>(_stream.Get())->Written();
+   }
    bool next = Dispatch();
+   if (_deferred) {
+      std::lock_guard<std::mutex> lock(_mutex);
+      if (!_deferredDone) {
+         // ResponseFinished carries on once the rest of the answer is out.
+         _awaitingDeferred = true;
+         _nextAfterDeferred = next;
+         return false;
+      }
+      next = next && !_deferredFailed;
+   }
+   return AfterResponse(next);
+}
+
+bool HttpConnectionImpl::DeferResponse() {
+   std::lock_guard<std::mutex> lock(_mutex);
+   _deferred = true;
+   _deferredDone = false;
+   _deferredFailed = false;
+   _awaitingDeferred = false;
+   return true;
+}
+
+void HttpConnectionImpl::ResponseFinished(Exception* error) {
+   bool next;
+   {
+      std::lock_guard<std::mutex> lock(_mutex);
+      _deferredFailed = error != nullptr;
+      if (!_awaitingDeferred) {
+         _deferredDone = true;
+         return;
+      }
+      _awaitingDeferred = false;
+      next = _nextAfterDeferred && error == nullptr;
+   }
+   if (error != nullptr)
+      PELMORA_LOG_INFO(_logger.Get(), "Sending the response on stream %1 failed: %2", StreamName(_stream.Get()),
+                       *error);
+   if (AfterResponse(next)) Next();
+}
+
+// The access line, then the wait for the next request or the end of the connection.
+bool HttpConnectionImpl::AfterResponse(bool next) {
    if (GetHttpSvcConfig().accessLog) {
       long long micros =
-          std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::steady_clock::now() - began).count();
+          std::chrono::duration_cast<std::chrono::microseconds>(std::chrono::steady_clock::now() - _began).count();
       Ref<System::BindingInfo> local, peer;
       _stream->GetBindingInfo(typeid(System::BindingInfo), local, peer);
       PELMORA_LOG_INFO(_logger.Get(), "%1 %2 %3 %4 %5 %6", MethodName(_request->GetMethod()), _request->GetPath(),
                        _response->GetHeader().GetResponseCode().code,
-                       watched->Written() - writtenBefore, micros,
+                       dynamic_cast<WatchedStream*>(_stream.Get())->Written() - _writtenBefore, micros,
                        peer ? peer->GetAddress() + ":" + std::to_string(peer->GetPort()) : std::string("-"));
    }
    if (next) next = FinishRequest();
@@ -307,9 +402,10 @@ bool HttpConnectionImpl::Dispatch() {
       if (!_response->IsResponseComplete()) _response->Complete();
    } catch (const Exception& e) {
       PELMORA_LOG_WARNING(_logger.Get(), "HTTP Transaction failed on stream %1 with error %2", stream, e);
+      bool tooLarge = dynamic_cast<const RequestBodyTooLargeException*>(&e) != nullptr;
       if (!_response->IsHeaderSent() && !_response->IsResponseComplete()) {
          try {
-            _response->SendError(ResponseCode::InternalServerError);
+            _response->SendError(tooLarge ? ResponseCode::RequestEntityTooLarge : ResponseCode::InternalServerError);
          } catch (const Exception&) {
          }
       }

@@ -22,7 +22,7 @@ void ReadTimeout(Logger* logger, Service::Config::View* view, const char* key, l
    if (view == nullptr || !view->Get(key, &ms)) ms = out / 1000;
    out = ms > 0 ? ms * 1000 : ms;
    if (ms < 0)
-      PELMORA_LOG_INFO(logger, "Setting %1 to %2 %3", key, "disabled", "");
+      PELMORA_LOG_INFO(logger, "Setting %1 to %2 %3", key, ms, "disabled");
    else
       PELMORA_LOG_INFO(logger, "Setting %1 to %2 %3", key, ms, "ms");
 }
@@ -145,6 +145,7 @@ HttpSvcImpl::HttpSvcImpl(System::ServerSocket* socket, Logger* logger, Service::
       }()),
       _config(_logger.Get(), view),
       _socket(socket) {
+   if (socket != nullptr) _listeners.push_back(MakeListener(socket));
    CompileAgents(view);
 }
 
@@ -213,7 +214,7 @@ bool HttpSvcImpl::NeedsContentLength(const std::string& agent) const {
 
 void HttpSvcImpl::Start() {
    std::unique_lock<std::mutex> lock(_mutex);
-   if (!_socket) throw InvalidStateException("ServerSocket not set");
+   if (_listeners.empty()) throw InvalidStateException("ServerSocket not set");
    if (!_defaultHandler) throw InvalidStateException("No RequestHandler has been set");
    if (_opState == STARTED) {
       lock.unlock();
@@ -225,39 +226,71 @@ void HttpSvcImpl::Start() {
    // The watcher keeps the service alive until Stop, as the pending accept does.
    if (!_watcher.joinable()) _watcher = std::thread([self = Ref<HttpSvcImpl>(this)] { self->Watch(); });
    lock.unlock();
-   IssueAccept();
+   IssueAccepts();
    PELMORA_LOG_INFO(_logger.Get(), "Http Service started: %1", ToString());
 }
 
-void HttpSvcImpl::IssueAccept() {
-   Ref<System::ServerSocket> socket;
+void HttpSvcImpl::AddServerSocket(System::ServerSocket* socket) {
+   if (socket == nullptr) throw InvalidArgumentException("null server socket");
    {
       std::lock_guard<std::mutex> lock(_mutex);
-      if (_opState != STARTED || _acceptPending || !_socket) return;
+      if (!_socket) _socket = socket;
+      _listeners.push_back(MakeListener(socket));
+   }
+   IssueAccepts();
+}
+
+void HttpSvcImpl::IssueAccepts() {
+   std::vector<std::shared_ptr<Listener>> listeners;
+   {
+      std::lock_guard<std::mutex> lock(_mutex);
+      listeners = _listeners;
+   }
+   for (const auto& listener : listeners) IssueAccept(listener);
+}
+
+void HttpSvcImpl::IssueAccept(const std::shared_ptr<Listener>& listener) {
+   {
+      std::lock_guard<std::mutex> lock(_mutex);
+      if (_opState != STARTED || listener->pending || listener->retryScheduled) return;
       if (static_cast<int>(_connections.size()) >= _config.maxConnections) return;
-      _acceptPending = true;
-      socket = _socket;
+      listener->pending = true;
    }
    Ref<HttpSvcImpl> self(this);
    try {
-      socket->AsyncAccept([self](System::ServerSocket* s, Exception* e, System::Stream* stream) {
-         self->AcceptHttpConn(s, e, stream);
+      listener->socket->AsyncAccept([self, listener](System::ServerSocket*, Exception* e, System::Stream* stream) {
+         self->AcceptHttpConn(listener, e, stream);
       });
    } catch (const Exception& e) {
       {
          std::lock_guard<std::mutex> lock(_mutex);
-         _acceptPending = false;
+         listener->pending = false;
       }
       PELMORA_LOG_INFO(_logger.Get(), "Socket closed, not issuing another Accept");
    }
 }
 
-void HttpSvcImpl::AcceptHttpConn(System::ServerSocket*, Exception* error, System::Stream* stream) {
+void HttpSvcImpl::AcceptHttpConn(const std::shared_ptr<Listener>& listener, Exception* error,
+                                 System::Stream* stream) {
    bool running;
+   bool firstFailure = false;
+   long long recovered = 0;
    {
       std::lock_guard<std::mutex> lock(_mutex);
-      _acceptPending = false;
+      listener->pending = false;
       running = _opState == STARTED;
+      if (running && error != nullptr) {
+         // Out of descriptors or memory the next accept fails at once as well: pause,
+         // doubling up to a second, and log the burst once.
+         firstFailure = listener->backoff == 0;
+         listener->backoff =
+             firstFailure ? kFirstAcceptBackoff : std::min(listener->backoff * 2, kLastAcceptBackoff);
+         listener->retryScheduled = true;
+         listener->retryAt = std::chrono::steady_clock::now() + std::chrono::microseconds(listener->backoff);
+      } else if (running && stream != nullptr) {
+         recovered = listener->backoff;
+         listener->backoff = 0;
+      }
    }
    if (!running) {
       if (stream != nullptr) stream->Close();
@@ -265,13 +298,15 @@ void HttpSvcImpl::AcceptHttpConn(System::ServerSocket*, Exception* error, System
       return;
    }
    if (error != nullptr) {
-      PELMORA_LOG_ERROR(_logger.Get(), "accept failure %1 on stream %2", *error, static_cast<const void*>(stream));
-      IssueAccept();
+      if (firstFailure)
+         PELMORA_LOG_ERROR(_logger.Get(), "accept failure %1 on stream %2", *error, static_cast<const void*>(stream));
+      _changed.notify_all();
       return;
    }
+   if (recovered != 0) PELMORA_LOG_INFO(_logger.Get(), "Accepting again after failed accepts");
    if (stream == nullptr) {
       PELMORA_LOG_ERROR(_logger.Get(), "stream is NULL - no read scheduled");
-      IssueAccept();
+      IssueAccept(listener);
       return;
    }
    stream->SetReadTimeout(_config.defaultReadTimeout, Logger::LOG_INFO, "HTTP client never sent a request.");
@@ -283,7 +318,7 @@ void HttpSvcImpl::AcceptHttpConn(System::ServerSocket*, Exception* error, System
    }
    // The next accept goes out before the first read so that accepting never waits on a
    // client.
-   IssueAccept();
+   IssueAccept(listener);
    connection->Begin();
 }
 
@@ -293,12 +328,17 @@ void HttpSvcImpl::ConnectionEnded(HttpConnectionImpl* connection) {
       _connections.erase(Ref<HttpConnectionImpl>(connection));
    }
    _changed.notify_all();
-   IssueAccept();
+   IssueAccepts();
 }
 
 int HttpSvcImpl::GetConnectionCount() {
    std::lock_guard<std::mutex> lock(_mutex);
    return static_cast<int>(_connections.size());
+}
+
+int HttpSvcImpl::GetOpState() {
+   std::lock_guard<std::mutex> lock(_mutex);
+   return static_cast<int>(_opState);
 }
 
 bool HttpSvcImpl::IsRunning() {
@@ -311,34 +351,51 @@ void HttpSvcImpl::Watch() {
    auto period = std::chrono::microseconds(limit > 0 ? std::clamp(limit / 10, 10000LL, 1000000LL) : 1000000LL);
    std::unique_lock<std::mutex> lock(_mutex);
    while (!_watcherStop) {
-      _changed.wait_for(lock, period);
-      if (_watcherStop || limit < 0) continue;
-      std::vector<Ref<HttpConnectionImpl>> overdue;
+      auto wake = std::chrono::steady_clock::now() + period;
+      for (const auto& listener : _listeners)
+         if (listener->retryScheduled) wake = std::min(wake, listener->retryAt);
+      _changed.wait_until(lock, wake);
+      if (_watcherStop) continue;
       auto now = std::chrono::steady_clock::now();
-      for (const auto& connection : _connections)
-         if (connection->IsOverdue(now, limit)) overdue.push_back(connection);
+      std::vector<std::shared_ptr<Listener>> retry;
+      for (const auto& listener : _listeners) {
+         if (listener->retryScheduled && listener->retryAt <= now) {
+            listener->retryScheduled = false;
+            retry.push_back(listener);
+         }
+      }
+      std::vector<Ref<HttpConnectionImpl>> overdue;
+      if (limit >= 0)
+         for (const auto& connection : _connections)
+            if (connection->IsOverdue(now, limit)) overdue.push_back(connection);
       lock.unlock();
+      for (const auto& listener : retry) IssueAccept(listener);
       for (auto& connection : overdue) {
          PELMORA_LOG_WARNING(_logger.Get(), "Request not complete within %1 ms; closing stream %2", limit / 1000,
                              static_cast<const void*>(connection->GetStream()));
          connection->Close("deadline");
       }
+      retry.clear();
       overdue.clear();
       lock.lock();
    }
 }
 
 void HttpSvcImpl::Stop() {
-   Ref<System::ServerSocket> socket;
+   std::vector<std::shared_ptr<Listener>> listeners;
    std::vector<Ref<HttpConnectionImpl>> connections;
    {
       std::lock_guard<std::mutex> lock(_mutex);
       if (_opState != STARTED) return;
-      _opState = STOPPED;
-      socket = _socket;
+      _opState = STOPPING;
+      listeners = _listeners;
+      for (const auto& listener : _listeners) {
+         listener->retryScheduled = false;
+         listener->backoff = 0;
+      }
       connections.assign(_connections.begin(), _connections.end());
    }
-   if (socket) socket->Close();
+   for (const auto& listener : listeners) listener->socket->Close();
    PELMORA_LOG_INFO(_logger.Get(), "Stopped HTTP service");
    StopWatcher();
    for (auto& connection : connections)
@@ -357,6 +414,7 @@ void HttpSvcImpl::Stop() {
       _changed.wait_until(lock, std::min(deadline, std::chrono::steady_clock::now() + std::chrono::milliseconds(20)));
    }
    connections.assign(_connections.begin(), _connections.end());
+   if (_opState == STOPPING) _opState = STOPPED;
    lock.unlock();
    for (auto& connection : connections) {
       PELMORA_LOG_WARNING(_logger.Get(), "Closing stream %1 at shutdown with a request in progress",

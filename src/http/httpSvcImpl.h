@@ -8,6 +8,7 @@
 #include <regex>
 #include <set>
 #include <thread>
+#include <vector>
 
 #include "pelmora/http/httpSvc.h"
 
@@ -31,6 +32,8 @@ public:
    void GetClientCapabilities(ClientCapabilities& out) override { out = _capabilities; }
    long long GetMaxBufferedResponseBytes() override;
    void ResponseCompleted(bool keepAlive) override;
+   bool DeferResponse() override;
+   void ResponseFinished(Exception* error) override;
    // Closes the stream; the pending read ends the connection.
    void Close(const char* why);
    // Whether the connection waits with no part of a request received.
@@ -39,14 +42,16 @@ public:
    bool IsOverdue(std::chrono::steady_clock::time_point now, long long limit);
    State GetState();
    System::Stream* GetStream() const { return _stream.Get(); }
-   // The stream wrapper reports received bytes here.
-   void BytesArrived();
+   // The stream wrapper reports each read here: before it and with its byte count after.
+   void ReadBegins();
+   void ReadEnds(int count);
 
 private:
    void Next();
    void HeaderDone(Exception* error, bool gotRequest);
    bool Process(Exception* error, bool gotRequest);
    bool Dispatch();
+   bool AfterResponse(bool next);
    bool FinishRequest();
    void End();
 
@@ -60,6 +65,9 @@ private:
    bool _firstRequest = true;
    bool _completed = false;
    bool _completedKeepAlive = false;
+   bool _deferred = false;  // the response finishes after its handler returned
+   std::chrono::steady_clock::time_point _began;
+   long long _writtenBefore = 0;
 
    std::mutex _mutex;
    State _state = WAITING;
@@ -69,6 +77,11 @@ private:
    bool _syncGot = false;
    std::chrono::steady_clock::time_point _firstByte;
    bool _haveFirstByte = false;
+   int _readsPending = 0;
+   bool _deferredDone = false;
+   bool _deferredFailed = false;
+   bool _awaitingDeferred = false;
+   bool _nextAfterDeferred = false;
 };
 
 class HttpSvcImpl : public virtual HttpSvc, public ObjectImpl {
@@ -77,6 +90,7 @@ public:
    ~HttpSvcImpl() override;
 
    void Start() override;
+   void AddServerSocket(System::ServerSocket* socket) override;
    void Stop() override;
    void SetRequestHandler(RequestHandler* handler) override;
    void GetRequestHandler(Ref<RequestHandler>& out) override;
@@ -92,6 +106,8 @@ public:
    const HttpSvcConfig& GetConfig() const { return _config; }
    Service::Logger* GetLogger() const { return _logger.Get(); }
    bool IsRunning();
+   // 0 stopped, 1 started, 2 stopping (Stop lets requests in progress finish).
+   int GetOpState();
    // The handler for `path` and whether it is the default one.
    bool FindHandler(const std::string& path, Ref<RequestHandler>& out);
    void ConnectionEnded(HttpConnectionImpl* connection);
@@ -99,9 +115,28 @@ public:
    bool IsNonChunkingAgent(const std::string& agent) const;
    bool NeedsContentLength(const std::string& agent) const;
 
+   // The first pause after a failed accept and the longest one.
+   static constexpr long long kFirstAcceptBackoff = 10000;
+   static constexpr long long kLastAcceptBackoff = 1000000;
+
 private:
-   void IssueAccept();
-   void AcceptHttpConn(System::ServerSocket* socket, Exception* error, System::Stream* stream);
+   // One listening socket with its accept state.
+   struct Listener {
+      Ref<System::ServerSocket> socket;
+      bool pending = false;            // an accept is issued
+      long long backoff = 0;           // microseconds; 0 while accepts succeed
+      bool retryScheduled = false;     // the watcher issues the next accept at retryAt
+      std::chrono::steady_clock::time_point retryAt;
+   };
+   static std::shared_ptr<Listener> MakeListener(System::ServerSocket* socket) {
+      auto listener = std::make_shared<Listener>();
+      listener->socket = socket;
+      return listener;
+   }
+
+   void IssueAccept(const std::shared_ptr<Listener>& listener);
+   void IssueAccepts();
+   void AcceptHttpConn(const std::shared_ptr<Listener>& listener, Exception* error, System::Stream* stream);
    void Watch();
    void StopWatcher();
    void CompileAgents(Service::Config::View* view);
@@ -114,11 +149,11 @@ private:
    bool _haveNeedsLength = false;
 
    std::mutex _mutex;
-   Ref<System::ServerSocket> _socket;
+   Ref<System::ServerSocket> _socket;  // the first listener's, for ToString
+   std::vector<std::shared_ptr<Listener>> _listeners;
    Ref<RequestHandler> _defaultHandler;
    RequestHandlerMap _handlers;
-   enum OpState { STOPPED = 0, STARTED = 1 } _opState = STOPPED;
-   bool _acceptPending = false;
+   enum OpState { STOPPED = 0, STARTED = 1, STOPPING = 2 } _opState = STOPPED;
    std::set<Ref<HttpConnectionImpl>> _connections;
    std::condition_variable _changed;
    std::thread _watcher;

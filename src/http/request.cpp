@@ -35,6 +35,7 @@ public:
    int Read(char* buffer, int length) override;
    void AsyncRead(char* buffer, unsigned int length, const ReadCallback& callback) override;
    void ResetStream(System::Stream* stream) override;
+   void SetMaxBodyBytes(long long limit) override { _maxBody = limit; }
    void Close() override { _stream->Close(); }
 
 private:
@@ -63,6 +64,8 @@ private:
    int _leftover = 0;          // first body byte not handed out yet
    int _leftoverCount = 0;
    long long _bodyLeft = 0;    // of a sized body
+   long long _bodyDecoded = 0; // of a chunked body
+   long long _maxBody = -1;
    bool _chunked = false;
    bool _keepAlive = true;
    bool _headerDone = false;
@@ -168,7 +171,11 @@ int RequestImpl::TryReadBuffered(char* buffer, int length) {
                                        static_cast<size_t>(length), produced);
          _leftover += static_cast<int>(used);
          _leftoverCount -= static_cast<int>(used);
-         if (produced > 0) return static_cast<int>(produced);
+         if (produced > 0) {
+            _bodyDecoded += static_cast<long long>(produced);
+            if (_maxBody >= 0 && _bodyDecoded > _maxBody) throw RequestBodyTooLargeException(_maxBody);
+            return static_cast<int>(produced);
+         }
       }
       return 0;
    }
@@ -273,6 +280,7 @@ void RequestImpl::ResetStream(System::Stream* stream) {
    _leftover = 0;
    _leftoverCount = 0;
    _bodyLeft = 0;
+   _bodyDecoded = 0;
    _chunked = false;
    _keepAlive = true;
    _headerDone = false;

@@ -1,14 +1,21 @@
 #include "pelmora/http/response.h"
 
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
 #include <atomic>
+#include <cerrno>
 #include <cstdio>
 #include <memory>
+#include <vector>
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/exception/panic.h"
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/object/weak.h"
 #include "pelmora/service/logMacros.h"
+#include "pelmora/system/streamFileSender.h"
 #include "src/http/charBuffer.h"
 #include "src/http/httpLog.h"
 
@@ -55,6 +62,7 @@ public:
    void Write(const char* data, int length) override;
    void FlushToStream() override;
    void Complete() override;
+   void SendFile(int fd, long long offset, long long length) override;
    void SendError(const ResponseCode::Info& info) override;
    void SendError(const ResponseCode::Info& info, const std::string& text) override;
    void SendContinue() override;
@@ -76,6 +84,7 @@ private:
    void FrameBufferedChunk();
    void WriteChunk();
    void WriteSized(bool lastBlock);
+   void CopyFile(int fd, long long offset, long long length);
    size_t BodyRoom() const;
 
    HttpConnection* _connection;
@@ -288,6 +297,75 @@ void ResponseImpl::Complete() {
    }
    _currState = RESPONSE_COMPLETE;
    _connection->ResponseCompleted(_header.GetKeepAlive());
+}
+
+void ResponseImpl::SendFile(int fd, long long offset, long long length) {
+   if (IsResponseComplete()) throw InvalidStateException("Response already complete");
+   if (_headerSent || (_prepared && _buffer->Filled() > 0)) throw InvalidStateException("Body already written");
+   if (offset < 0 || length < 0) throw InvalidArgumentException("negative file offset or length");
+   auto* sender = dynamic_cast<System::FileSender*>(_stream.Get());
+   if (sender == nullptr || !sender->CanSendFile() || length == 0) {
+      CopyFile(fd, offset, length);
+      return;
+   }
+   if (!_prepared) PrepareToWrite();
+   _header.RemoveField("Transfer-Encoding");
+   _header.SetContentLength(length);
+   std::string head = _header.ToString();
+   _stream->Write(head.data(), static_cast<int>(head.size()));
+   _headerSent = true;
+   _currState = RESPONSE_ACCEPT_WRITE_SIZED;
+   long long sent = sender->TrySendFile(fd, offset, length);
+   if (sent < length) {
+      int own = _connection->DeferResponse() ? ::fcntl(fd, F_DUPFD_CLOEXEC, 0) : -1;
+      if (own < 0) {
+         sent += sender->SendFile(fd, offset + sent, length - sent);
+      } else {
+         // The rest goes out on the stream's I/O service; the connection carries on
+         // when it is done.
+         long long left = length - sent;
+         Ref<ResponseImpl> self(this);
+         Ref<HttpConnection> connection(_connection);
+         _currState = RESPONSE_COMPLETE;
+         _connection->ResponseCompleted(_header.GetKeepAlive());
+         try {
+            sender->AsyncSendFile(own, offset + sent, left,
+                                  [self, connection, own, left](System::Stream*, Exception* error, long long n) {
+                                     ::close(own);
+                                     if (error == nullptr && n < left) {
+                                        Exception shorter("File ended before its length");
+                                        connection->ResponseFinished(&shorter);
+                                     } else {
+                                        connection->ResponseFinished(error);
+                                     }
+                                  });
+         } catch (Exception& e) {
+            ::close(own);
+            connection->ResponseFinished(&e);
+         }
+         return;
+      }
+   }
+   if (sent < length) throw Exception("File ended before its length");
+   _currState = RESPONSE_COMPLETE;
+   _connection->ResponseCompleted(_header.GetKeepAlive());
+}
+
+// The file's bytes through the body buffer, for streams that cannot send files.
+void ResponseImpl::CopyFile(int fd, long long offset, long long length) {
+   SetContentLength(length);
+   std::vector<char> piece(std::min<long long>(std::max<long long>(length, 1), 65536));
+   while (length > 0) {
+      ssize_t n = ::pread(fd, piece.data(), static_cast<size_t>(std::min<long long>(length, piece.size())),
+                          static_cast<off_t>(offset));
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) throw SystemException(errno);
+      if (n == 0) throw Exception("File ended before its length");
+      Write(piece.data(), static_cast<int>(n));
+      offset += n;
+      length -= n;
+   }
+   Complete();
 }
 
 void ResponseImpl::SendError(const ResponseCode::Info& info) {

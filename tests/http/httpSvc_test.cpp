@@ -1,8 +1,13 @@
 #include <gtest/gtest.h>
+#include <fcntl.h>
+#include <sys/resource.h>
+#include <sys/stat.h>
 
 #include <atomic>
 #include <chrono>
+#include <filesystem>
 #include <fstream>
+#include <iostream>
 #include <memory>
 #include <thread>
 #include <vector>
@@ -10,6 +15,7 @@
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/http/httpSvc.h"
 #include "pelmora/service/config.h"
+#include "pelmora/system/ssl.h"
 #include "src/http/httpSvcImpl.h"
 #include "tests/support/httpClient.h"
 #include "tests/support/netFixture.h"
@@ -33,6 +39,20 @@ public:
          std::this_thread::sleep_for(std::chrono::milliseconds(300));
       }
       if (request->GetPath() == "/fail") throw InvalidStateException("handler broke");
+      if (request->GetPath() == "/file") {
+         int fd = ::open(file.c_str(), O_RDONLY | O_CLOEXEC);
+         if (fd < 0) throw SystemException(errno);
+         struct stat info {};
+         ::fstat(fd, &info);
+         try {
+            response->SendFile(fd, 0, info.st_size);
+         } catch (...) {
+            ::close(fd);
+            throw;
+         }
+         ::close(fd);
+         return;
+      }
       std::string text = _name + " " + request->GetPath();
       response->GetHeader().SetContentType("text/plain");
       response->Write(text.data(), static_cast<int>(text.size()));
@@ -47,6 +67,7 @@ public:
       response->Complete();
    }
    std::atomic<bool> started{false};
+   std::string file;  // served at /file
 
 private:
    std::string _name;
@@ -160,7 +181,8 @@ TEST(HttpSvcConfigTest, DefaultsAndOverrides) {
    EXPECT_EQ(set.maxBufferedResponseBytes, 4096);
    EXPECT_EQ(set.xFrameOptions, "ALLOW-FROM https://a.example");
    EXPECT_FALSE(set.xFrameOptionsEnabled);
-   EXPECT_TRUE(log.Contains("Setting readTimeoutMs to disabled"));
+   // The line is exactly the format's: the value, then its unit or "disabled".
+   EXPECT_TRUE(log.Contains("Setting readTimeoutMs to -1 disabled\n"));
    EXPECT_TRUE(log.Contains("Setting writeTimeoutMs to 0 ms"));
    EXPECT_TRUE(log.Contains("Setting authenticatedReadTimeoutMs to 250 ms"));
    EXPECT_TRUE(log.Contains("Max buffered response size is 4096 bytes"));
@@ -310,6 +332,19 @@ TEST_F(HttpSvcTest, BadRequestsEndTheirConnectionOnly) {
       EXPECT_NE(client.ReadResponse().find("HTTP/1.1 413"), std::string::npos);
    }
    {
+      // A chunked body has no length to refuse up front: it is cut when it passes the
+      // limit while the handler reads it.
+      RawClient client(_port);
+      std::string chunk(60, 'c');
+      client.Send("POST / HTTP/1.1\r\nTransfer-Encoding: chunked\r\n\r\n3c\r\n" + chunk + "\r\n3c\r\n" + chunk +
+                  "\r\n0\r\n\r\n");
+      EXPECT_NE(client.ReadResponse().find("HTTP/1.1 413"), std::string::npos);
+      EXPECT_TRUE(client.Closed());
+      RawClient small(_port);
+      small.Send("POST / HTTP/1.1\r\nTransfer-Encoding: chunked\r\n\r\n3c\r\n" + chunk + "\r\n0\r\n\r\n");
+      EXPECT_NE(small.ReadResponse().find("posted 60 cccc"), std::string::npos);
+   }
+   {
       RawClient client(_port);
       client.Send("GET /caf\xC3 HTTP/1.1\r\n\r\n");
       EXPECT_NE(client.ReadResponse().find("HTTP/1.1 400"), std::string::npos);
@@ -364,21 +399,84 @@ TEST_F(HttpSvcTest, IdleClientsTimeOut) {
 TEST_F(HttpSvcTest, SlowlorisIsClosedWhileOthersAreServed) {
    DefaultLogCapture log;
    StartServer({{"requestDeadlineMs", "300"}});
-   RawClient slow(_port, 3000);
-   std::string request = "GET /slowly HTTP/1.1\r\nHost: x\r\nX-Padding: aaaaaaaaaaaaaaaaaaaaaaaaaaaaaaaa\r\n\r\n";
-   auto began = std::chrono::steady_clock::now();
-   bool cut = false;
-   for (char c : request) {
-      if (!slow.Send(std::string(1, c))) {
-         cut = true;
-         break;
+   // Sends `text` a byte every 100 ms, serving another client meanwhile; true when the
+   // server cut the connection within two seconds.
+   auto trickle = [&](RawClient& slow, const std::string& text) {
+      auto began = std::chrono::steady_clock::now();
+      for (char c : text) {
+         if (!slow.Send(std::string(1, c))) return true;
+         EXPECT_NE(Get("/other").find("default /other"), std::string::npos);
+         std::this_thread::sleep_for(std::chrono::milliseconds(100));
+         if (std::chrono::steady_clock::now() - began > std::chrono::seconds(2)) break;
       }
-      EXPECT_NE(Get("/other").find("default /other"), std::string::npos);
-      std::this_thread::sleep_for(std::chrono::milliseconds(100));
-      if (std::chrono::steady_clock::now() - began > std::chrono::seconds(2)) break;
-   }
-   EXPECT_TRUE(cut || slow.Closed());
+      return slow.Closed();
+   };
+   RawClient header(_port, 3000);
+   EXPECT_TRUE(trickle(header, "GET /slowly HTTP/1.1\r\nHost: x\r\nX-Padding: aaaaaaaaaaaaaaaaaaaaaaaaaaaaaa\r\n\r\n"));
    EXPECT_TRUE(log.Contains("Request not complete within 300 ms; closing stream"));
+
+   // The deadline covers the body too, while the handler waits for it.
+   RawClient body(_port, 3000);
+   body.Send("POST /up HTTP/1.1\r\nContent-Length: 64\r\n\r\n");
+   EXPECT_TRUE(trickle(body, std::string(64, 'b')));
+   EXPECT_EQ(_svc->GetConnectionCount(), 0);
+
+   // A handler busy after its body is in is not cut.
+   RawClient busy(_port);
+   busy.Send("GET /slow HTTP/1.1\r\n\r\n");
+   EXPECT_NE(busy.ReadResponse().find("default /slow"), std::string::npos);
+}
+
+TEST_F(HttpSvcTest, FailedAcceptsBackOffAndRecover) {
+   DefaultLogCapture log;
+   StartServer();
+   // The client's socket is made before the descriptors run out; it connects after.
+   int client = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+   ASSERT_GE(client, 0);
+   rlimit saved{};
+   ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &saved), 0);
+   int highest = 0;
+   for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd"))
+      highest = std::max(highest, std::stoi(entry.path().filename().string()));
+   rlimit lowered = saved;
+   lowered.rlim_cur = static_cast<rlim_t>(highest + 16);
+   ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &lowered), 0);
+   std::vector<int> filler;
+   for (int fd; (fd = ::open("/dev/null", O_RDONLY | O_CLOEXEC)) >= 0;) filler.push_back(fd);
+   rusage before{}, after{};
+   ::getrusage(RUSAGE_SELF, &before);
+
+   sockaddr_in address{};
+   address.sin_family = AF_INET;
+   address.sin_port = htons(static_cast<uint16_t>(_port));
+   address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+   EXPECT_EQ(::connect(client, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+   EXPECT_TRUE(WaitFor([&] { return log.Contains("accept failure "); }, "accept failure"));
+   std::this_thread::sleep_for(std::chrono::milliseconds(300));
+   ::getrusage(RUSAGE_SELF, &after);
+   for (int fd : filler) ::close(fd);
+   ::setrlimit(RLIMIT_NOFILE, &saved);
+
+   std::string text = log.Text();
+   size_t failures = 0;
+   for (size_t at = 0; (at = text.find("accept failure ", at)) != std::string::npos; ++at) ++failures;
+   EXPECT_EQ(failures, 1u) << "one line per burst";
+   auto cpu = [](const rusage& r) {
+      return (r.ru_utime.tv_sec + r.ru_stime.tv_sec) * 1000000LL + r.ru_utime.tv_usec + r.ru_stime.tv_usec;
+   };
+   EXPECT_LT(cpu(after) - cpu(before), 150000) << "accepts retried in a busy loop";
+
+   // With descriptors back the waiting client is served.
+   std::string request = "GET /back HTTP/1.1\r\nConnection: close\r\n\r\n";
+   ASSERT_EQ(::send(client, request.data(), request.size(), MSG_NOSIGNAL), static_cast<ssize_t>(request.size()));
+   timeval tv{5, 0};
+   ::setsockopt(client, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
+   std::string answer;
+   char piece[4096];
+   for (ssize_t n; (n = ::recv(client, piece, sizeof piece, 0)) > 0;) answer.append(piece, static_cast<size_t>(n));
+   ::close(client);
+   EXPECT_NE(answer.find("default /back"), std::string::npos) << answer;
+   EXPECT_TRUE(log.Contains("Accepting again after failed accepts"));
 }
 
 TEST_F(HttpSvcTest, ConnectionLimitMakesNewClientsWait) {
@@ -404,11 +502,20 @@ TEST_F(HttpSvcTest, StopFinishesRequestsInFlightAndClosesIdleAtOnce) {
    StartServer({{"shutdownDeadlineMs", "3000"}});
    RawClient idle(_port);
    RawClient busy(_port);
+   RawClient late(_port);
+   late.Send("GET /late HTTP/1.1\r\n");
    busy.Send("GET /slow HTTP/1.1\r\n\r\n");
    ASSERT_TRUE(WaitFor([&] { return _default->started.load(); }, "slow request started"));
    auto began = std::chrono::steady_clock::now();
-   _svc->Stop();
+   std::thread stopper([&] { _svc->Stop(); });
+   ASSERT_TRUE(WaitFor([&] { return log.Contains("Stopped HTTP service"); }, "stop begun"));
+   // A request completed while the service stops is not served; the line names the
+   // state (stopping).
+   late.Send("\r\n");
+   EXPECT_TRUE(late.Closed());
+   stopper.join();
    EXPECT_LT(std::chrono::steady_clock::now() - began, std::chrono::seconds(2));
+   EXPECT_TRUE(log.Contains("Ignored pending request. State: 2\n"));
    EXPECT_NE(busy.ReadResponse().find("default /slow"), std::string::npos);
    EXPECT_TRUE(idle.Closed());
    EXPECT_TRUE(log.Contains("Stopped HTTP service"));
@@ -425,6 +532,68 @@ TEST_F(HttpSvcTest, StopPastItsDeadlineClosesWithALogLine) {
    _svc->Stop();
    EXPECT_TRUE(log.Contains("at shutdown with a request in progress"));
    EXPECT_TRUE(WaitFor([&] { return _svc->GetConnectionCount() == 0; }, "connection gone"));
+}
+
+TEST_F(HttpSvcTest, ServesSeveralListenersOverTcpUnixAndTls) {
+   StartServer();
+   std::string dir = ::testing::TempDir() + "httpsvc_listeners_" + std::to_string(::getpid());
+   std::filesystem::remove_all(dir);
+   std::filesystem::create_directories(dir);
+   std::string content;
+   for (int i = 0; i < 300000; ++i) content += static_cast<char>('a' + i * 7 % 26);
+   std::ofstream(dir + "/file.bin", std::ios::binary) << content;
+   _default->file = dir + "/file.bin";
+   auto fetchFile = [&](const std::string& curl) {
+      return RunCommand(curl + " -o " + dir + "/got.bin && cmp -s " + dir + "/got.bin " + dir + "/file.bin && echo same");
+   };
+   std::vector<std::string> urls;  // curl arguments naming each listener, /file appended
+
+   urls.push_back(Url(""));
+   Ref<System::ServerSocket> v6;
+   try {
+      System::CreateTcpServerSocket("::1", 0, System::ServerSocketOptions(), v6);
+   } catch (const Exception& e) {
+      std::cout << "[  SKIPPED ] IPv6 listener: no ::1 on this machine (" << e.GetMessage() << ")\n";
+   }
+   if (v6) {
+      Ref<System::BindingInfo> local;
+      v6->GetBindingInfo(local);
+      _svc->AddServerSocket(v6.Get());
+      urls.push_back("-g http://[::1]:" + std::to_string(local->GetPort()));
+   }
+
+   std::string path = dir + "/http.sock";
+   Ref<System::ServerSocket> unix;
+   System::CreateLocalServerSocket(path, System::ServerSocketOptions(), unix);
+   _svc->AddServerSocket(unix.Get());
+   urls.push_back("--unix-socket " + path + " http://local");
+
+   RunCommand("cd " + dir +
+              " && openssl req -x509 -newkey ec -pkeyopt ec_paramgen_curve:prime256v1 -nodes -keyout key.pem"
+              " -out cert.pem -days 2 -subj /CN=localhost 2>/dev/null");
+   System::SslServerOptions options;
+   options.certificateChainFile = dir + "/cert.pem";
+   options.privateKeyFile = dir + "/key.pem";
+   Ref<System::SslContext> context;
+   System::CreateSslServerContext(options, context);
+   Ref<System::ServerSocket> tls;
+   System::CreateSslServerSocket("127.0.0.1", 0, System::ServerSocketOptions(), context.Get(), tls);
+   Ref<System::BindingInfo> tlsLocal;
+   tls->GetBindingInfo(tlsLocal);
+   _svc->AddServerSocket(tls.Get());
+   urls.push_back("-k https://127.0.0.1:" + std::to_string(tlsLocal->GetPort()));
+
+   // Plain TCP sends the file with sendfile, TLS and Unix streams copy it: every one
+   // gets the same bytes.
+   for (const std::string& url : urls) {
+      SCOPED_TRACE(url);
+      EXPECT_EQ(RunCommand("curl -s --max-time 5 " + url + "/where"), "default /where");
+      EXPECT_EQ(fetchFile("curl -s --max-time 10 " + url + "/file"), "same\n");
+   }
+   _svc->Stop();
+   for (const std::string& url : urls)
+      EXPECT_EQ(RunCommand("curl -s --max-time 2 " + url + "/after"), "") << url;
+   std::filesystem::remove_all(dir);
 }
 
 TEST_F(HttpSvcTest, RealClientsReuseConnectionsAndUploadChunked) {

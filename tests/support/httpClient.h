@@ -31,6 +31,8 @@ public:
    RawClient& operator=(const RawClient&) = delete;
 
    bool Connected() const { return _connected; }
+   // Shrinks the receive buffer, so that a client that does not read holds the server up.
+   void SetReceiveBuffer(int bytes) { ::setsockopt(_fd, SOL_SOCKET, SO_RCVBUF, &bytes, sizeof bytes); }
    bool Send(const std::string& text) {
       size_t done = 0;
       while (done < text.size()) {

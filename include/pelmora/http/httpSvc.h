@@ -80,6 +80,9 @@ public:
    // Begins accepting. InvalidStateException "ServerSocket not set" or "No RequestHandler
    // has been set" when it cannot.
    virtual void Start() = 0;
+   // Listens on `socket` as well (the service may listen on several: TCP, Unix, TLS).
+   // A socket added while the service runs starts accepting at once; Stop closes it.
+   virtual void AddServerSocket(System::ServerSocket* socket) = 0;
    // Stops accepting, closes idle connections at once and lets requests in progress
    // finish until the shutdown deadline; what is left then is closed and logged.
    virtual void Stop() = 0;

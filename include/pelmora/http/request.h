@@ -16,6 +16,14 @@
 
 namespace Pelmora::Http {
 
+// A chunked request body grew past the limit set with Request::SetMaxBodyBytes.
+class PELMORA_EXPORT RequestBodyTooLargeException : public Exception {
+public:
+   explicit RequestBodyTooLargeException(long long limit)
+       : Exception("Request body exceeds " + std::to_string(limit) + " bytes") {}
+   PELMORA_EXCEPTION_CLONE(RequestBodyTooLargeException)
+};
+
 class PELMORA_EXPORT Request : public virtual Object {
 public:
    // The request, the failure (null on success) and whether a request was read: false
@@ -46,6 +54,10 @@ public:
    // Body bytes into `buffer`, waiting for the stream when none are at hand; 0 at the end
    // of the body. Exception "Malformed chunk header." for a broken chunked body.
    virtual int Read(char* buffer, int length) = 0;
+   // The most body bytes Read and AsyncRead hand out (negative: no limit); a chunked body
+   // that goes past it fails with RequestBodyTooLargeException. A sized body is refused
+   // by its length before it is read. Kept across ResetStream.
+   virtual void SetMaxBodyBytes(long long limit) = 0;
    // As Read, completing through `callback`; `buffer` must live until then.
    virtual void AsyncRead(char* buffer, unsigned int length, const ReadCallback& callback) = 0;
    // Rearms the request for the next one on `stream`. Bytes that followed a fully read

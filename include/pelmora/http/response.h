@@ -30,6 +30,12 @@ public:
    virtual long long GetMaxBufferedResponseBytes() = 0;
    // The response went out; `keepAlive` tells whether the connection may be reused.
    virtual void ResponseCompleted(bool keepAlive) = 0;
+   // A response is about to finish after its handler returns (a file still going out):
+   // true when the connection then waits for ResponseFinished, false to have the response
+   // finish before the handler gets control back.
+   virtual bool DeferResponse() { return false; }
+   // The deferred response went out whole (`error` null) or failed.
+   virtual void ResponseFinished(Exception* error) { (void)error; }
 };
 
 class PELMORA_EXPORT Response : public virtual System::LockableObject {
@@ -58,6 +64,13 @@ public:
    virtual void FlushToStream() = 0;
    // Ends the response. Calling it twice is a fault.
    virtual void Complete() = 0;
+   // Sends `length` bytes of the open file `fd` from `offset` as the whole body with a
+   // Content-Length, and ends the response. On a stream that sends files itself the bytes
+   // go straight from the page cache, and what the stream cannot take at once goes out in
+   // the background when the connection defers (on a descriptor of the response's own);
+   // other streams get them read and written. Exception when the file ends early;
+   // InvalidStateException when body bytes were written already.
+   virtual void SendFile(int fd, long long offset, long long length) = 0;
    // Replaces whatever was written with an error answer and closes the connection after
    // it. IOException "Header already sent to client." when it is too late.
    virtual void SendError(const ResponseCode::Info& info) = 0;
