@@ -5,7 +5,10 @@
 
 #include <filesystem>
 #include <fstream>
+#include <memory>
 #include <string>
+#include <thread>
+#include <vector>
 
 #include "pelmora/http/documentHandler.h"
 #include "pelmora/service/config.h"
@@ -154,6 +157,138 @@ TEST_F(DocumentHandlerTest, LargeFilesAreSizedWhenChunkingIsOff) {
    EXPECT_NE(big.find("Content-Length: 100000"), std::string::npos) << big.substr(0, 300);
    EXPECT_EQ(big.find("Transfer-Encoding"), std::string::npos);
    EXPECT_EQ(big.size() - big.find("\r\n\r\n") - 4, 100000u);
+}
+
+// The value of `field` in a response header, empty when absent.
+std::string FieldOf(const std::string& response, const std::string& field) {
+   size_t at = response.find("\r\n" + field + ": ");
+   if (at == std::string::npos) return "";
+   at += field.size() + 4;
+   return response.substr(at, response.find("\r\n", at) - at);
+}
+
+std::string BodyOf(const std::string& response) { return response.substr(response.find("\r\n\r\n") + 4); }
+
+TEST_F(DocumentHandlerTest, ConditionalRequestsAreAnsweredNotModified) {
+   Serve(false);
+   std::string first = Fetch("/hello.txt");
+   std::string tag = FieldOf(first, "ETag");
+   std::string modified = FieldOf(first, "Last-Modified");
+   ASSERT_FALSE(tag.empty()) << first;
+   ASSERT_FALSE(modified.empty()) << first;
+   EXPECT_EQ(FieldOf(first, "Accept-Ranges"), "bytes");
+
+   RawClient client(_port);
+   auto ask = [&](const std::string& fields) {
+      client.Send("GET /hello.txt HTTP/1.1\r\nHost: x\r\n" + fields + "\r\n");
+      // A 304 has no body: what follows on the connection is the next answer.
+      return client.ReadResponse(true);
+   };
+   std::string answer = ask("If-None-Match: " + tag + "\r\n");
+   EXPECT_EQ(answer.rfind("HTTP/1.1 304", 0), 0u) << answer;
+   EXPECT_EQ(FieldOf(answer, "ETag"), tag);
+   answer = ask("If-None-Match: \"other\", W/" + tag + "\r\n");
+   EXPECT_EQ(answer.rfind("HTTP/1.1 304", 0), 0u) << answer;
+   answer = ask("If-Modified-Since: " + modified + "\r\n");
+   EXPECT_EQ(answer.rfind("HTTP/1.1 304", 0), 0u) << answer;
+   // A tag that does not match wins over a date that does.
+   client.Send("GET /hello.txt HTTP/1.1\r\nIf-None-Match: \"other\"\r\nIf-Modified-Since: " + modified + "\r\n\r\n");
+   answer = client.ReadResponse();
+   EXPECT_EQ(answer.rfind("HTTP/1.1 200", 0), 0u) << answer;
+   EXPECT_EQ(BodyOf(answer), "hello there");
+   client.Send("GET /hello.txt HTTP/1.1\r\nIf-Modified-Since: Thu, 01 Jan 1998 00:00:00 GMT\r\n\r\n");
+   EXPECT_EQ(BodyOf(client.ReadResponse()), "hello there");
+
+   std::string url = "http://127.0.0.1:" + std::to_string(_port) + "/hello.txt";
+   EXPECT_EQ(RunCommand("curl -s -o /dev/null -w '%{http_code}' --max-time 5 -H 'If-None-Match: " + tag + "' " + url),
+             "304");
+   EXPECT_EQ(RunCommand("curl -s -o /dev/null -w '%{http_code}' --max-time 5 -z '" + modified + "' " + url), "304");
+
+   // Rewritten, the file gets a new tag and the old one no longer matches.
+   WriteFile(_dir / "www/hello.txt", "hello again, longer");
+   answer = Fetch("/hello.txt");
+   EXPECT_NE(FieldOf(answer, "ETag"), tag);
+   EXPECT_EQ(RunCommand("curl -s --max-time 5 -H 'If-None-Match: " + tag + "' " + url), "hello again, longer");
+}
+
+TEST_F(DocumentHandlerTest, SingleRangesArePartialAndOthersWhole) {
+   std::string content;
+   for (int i = 0; i < 10000; ++i) content += std::to_string(i % 10);
+   WriteFile(_dir / "www/digits.txt", content);
+   Serve(false);
+   auto ranged = [&](const std::string& range, const std::string& extra = "") {
+      RawClient client(_port);
+      client.Send("GET /digits.txt HTTP/1.1\r\nHost: x\r\nConnection: close\r\nRange: " + range + "\r\n" + extra +
+                  "\r\n");
+      return client.ReadResponse();
+   };
+   std::string answer = ranged("bytes=3-12");
+   EXPECT_EQ(answer.rfind("HTTP/1.1 206", 0), 0u) << answer;
+   EXPECT_EQ(FieldOf(answer, "Content-Range"), "bytes 3-12/10000");
+   EXPECT_EQ(BodyOf(answer), content.substr(3, 10));
+   answer = ranged("bytes=9995-");
+   EXPECT_EQ(FieldOf(answer, "Content-Range"), "bytes 9995-9999/10000");
+   EXPECT_EQ(BodyOf(answer), "56789");
+   answer = ranged("bytes=-3");
+   EXPECT_EQ(FieldOf(answer, "Content-Range"), "bytes 9997-9999/10000");
+   EXPECT_EQ(BodyOf(answer), "789");
+   answer = ranged("bytes=9990-20000");
+   EXPECT_EQ(FieldOf(answer, "Content-Range"), "bytes 9990-9999/10000");
+
+   answer = ranged("bytes=10000-");
+   EXPECT_EQ(answer.rfind("HTTP/1.1 416", 0), 0u) << answer;
+   EXPECT_EQ(FieldOf(answer, "Content-Range"), "bytes */10000");
+   EXPECT_EQ(ranged("bytes=-0").rfind("HTTP/1.1 416", 0), 0u);
+
+   // Several ranges, a malformed one and a stale If-Range get the whole file.
+   for (const char* range : {"bytes=0-1,5-6", "bytes=7-2", "lines=1-2", "bytes=x-"}) {
+      answer = ranged(range);
+      EXPECT_EQ(answer.rfind("HTTP/1.1 200", 0), 0u) << range << "\n" << answer;
+      EXPECT_EQ(BodyOf(answer), content) << range;
+   }
+   EXPECT_EQ(ranged("bytes=0-1", "If-Range: \"stale\"\r\n").rfind("HTTP/1.1 200", 0), 0u);
+   std::string tag = FieldOf(Fetch("/digits.txt"), "ETag");
+   EXPECT_EQ(BodyOf(ranged("bytes=0-1", "If-Range: " + tag + "\r\n")), "01");
+
+   std::string url = "http://127.0.0.1:" + std::to_string(_port) + "/digits.txt";
+   EXPECT_EQ(RunCommand("curl -s --max-time 5 -r 100-104 " + url), "01234");
+   EXPECT_EQ(RunCommand("curl -s -o /dev/null -w '%{http_code}' --max-time 5 -r 20000-30000 " + url), "416");
+}
+
+TEST_F(DocumentHandlerTest, LargeFilesAndRangesArriveExactlyEvenToSlowReaders) {
+   std::string content(5 << 20, '\0');
+   unsigned int state = 7;
+   for (char& c : content) {
+      state = state * 1103515245u + 12345u;
+      c = static_cast<char>(state >> 16);
+   }
+   WriteFile(_dir / "www/large.bin", content);
+   Serve(false);
+   std::string url = "http://127.0.0.1:" + std::to_string(_port) + "/large.bin";
+   std::string copy = (_dir / "copy.bin").string();
+   RunCommand("curl -s --max-time 20 -o " + copy + " " + url);
+   EXPECT_EQ(RunCommand("cmp " + copy + " " + (_dir / "www/large.bin").string() + " && echo same"), "same\n");
+   RunCommand("curl -s --max-time 20 -r 1000000-3999999 -o " + copy + " " + url);
+   std::ifstream part(copy, std::ios::binary);
+   std::string got((std::istreambuf_iterator<char>(part)), std::istreambuf_iterator<char>());
+   EXPECT_TRUE(got == content.substr(1000000, 3000000)) << "range differs, " << got.size() << " bytes";
+
+   // Readers that take nothing for a while: the rest of their file waits on the I/O
+   // service, other requests are answered, and each gets every byte in the end.
+   std::vector<std::unique_ptr<RawClient>> stalled;
+   for (int i = 0; i < 12; ++i) {
+      stalled.push_back(std::make_unique<RawClient>(_port, 10000));
+      int size = 65536;
+      stalled.back()->SetReceiveBuffer(size);
+      stalled.back()->Send("GET /large.bin HTTP/1.1\r\nHost: x\r\nConnection: close\r\n\r\n");
+   }
+   std::this_thread::sleep_for(std::chrono::milliseconds(100));
+   EXPECT_NE(Fetch("/hello.txt").find("hello there"), std::string::npos);
+   for (auto& reader : stalled) {
+      std::string answer = reader->ReadResponse();
+      ASSERT_NE(answer.find("\r\n\r\n"), std::string::npos);
+      EXPECT_TRUE(BodyOf(answer) == content) << "a stalled reader got other bytes";
+   }
 }
 
 TEST_F(DocumentHandlerTest, SubHandlersComeBeforeFiles) {
