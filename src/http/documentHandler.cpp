@@ -193,7 +193,7 @@ private:
          root = dir;
          rest = path.substr(prefix.size());
       }
-      if (found && (rest.empty() || rest[0] != '/')) rest.insert(0, "/");
+      if (found && (rest.empty() || rest[0] != '/')) rest = "/" + rest;
       return found;
    }
 
@@ -290,13 +290,13 @@ private:
       response->SetContentLength(length);
       if (isHead) {
          response->Complete();
-         PELMORA_LOG_VERBOSE(GetHttpLogger(), "Sent response for HEAD %1 (from %2)", path, file);
+         PELMORA_LOG_TRIVIA(GetHttpLogger(), "Sent response for HEAD %1 (from %2)", path, file);
          return;
       }
       if (!chunked) {
          // Sized answers leave the page cache without a copy where the stream allows.
          response->SendFile(fd, offset, length);
-         PELMORA_LOG_VERBOSE(GetHttpLogger(), "Sent response for %1 %2 (from %3)", method, path, file);
+         PELMORA_LOG_TRIVIA(GetHttpLogger(), "Sent response for %1 %2 (from %3)", method, path, file);
          return;
       }
       std::vector<char> buffer(65536);
@@ -310,7 +310,7 @@ private:
          response->Write(buffer.data(), static_cast<int>(n));
       }
       response->Complete();
-      PELMORA_LOG_VERBOSE(GetHttpLogger(), "Sent response for %1 %2 (from %3)", method, path, file);
+      PELMORA_LOG_TRIVIA(GetHttpLogger(), "Sent response for %1 %2 (from %3)", method, path, file);
    }
 
    // Whether the client's copy is current: If-None-Match decides when present, else
@@ -339,7 +339,7 @@ std::string GetMimeType(const std::string& path, Service::Logger* logger) {
    for (char& c : extension) c = static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
    auto found = MimeTable().find(extension);
    if (found != MimeTable().end()) return found->second;
-   PELMORA_LOG_VERBOSE(logger != nullptr ? logger : GetHttpLogger(), "Unknown file extension: %1", extension);
+   PELMORA_LOG_TRIVIA(logger != nullptr ? logger : GetHttpLogger(), "Unknown file extension: %1", extension);
    return "application/octet-stream";
 }
 

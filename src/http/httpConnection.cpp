@@ -247,11 +247,19 @@ void HttpConnectionImpl::InitClientCapabilities() {
    std::string agent;
    if (!header.GetField("User-Agent", agent)) agent = "No-User-Agent";
    PELMORA_LOG_TRIVIA(_logger.Get(), "User agent is '%1'", agent);
-   if (_svc->IsNonChunkingAgent(agent)) {
+   // A client sends the same agent on every request of a connection: the expressions
+   // run once per agent, not per request.
+   if (!_agentKnown || agent != _agent) {
+      _agent = agent;
+      _agentKnown = true;
+      _agentNonChunking = _svc->IsNonChunkingAgent(agent);
+      _agentNeedsLength = _svc->NeedsContentLength(agent);
+   }
+   if (_agentNonChunking) {
       _capabilities.understandsChunking = false;
       PELMORA_LOG_VERBOSE(_logger.Get(), "User agent '%1' is non-chunking: %2", agent, true);
    }
-   if (_svc->NeedsContentLength(agent)) {
+   if (_agentNeedsLength) {
       _capabilities.needsContentLength = true;
       PELMORA_LOG_VERBOSE(_logger.Get(), "User agent '%1' needs Content-Length: %2", agent, true);
    }
@@ -259,7 +267,7 @@ void HttpConnectionImpl::InitClientCapabilities() {
 
 // True when the next request should be read.
 bool HttpConnectionImpl::Process(Exception* error, bool gotRequest) {
-   std::string stream = StreamName(_stream.Get());
+   auto stream = [this] { return StreamName(_stream.Get()); };
    if (error == nullptr && !gotRequest) {
       End();
       return false;
@@ -282,12 +290,12 @@ bool HttpConnectionImpl::Process(Exception* error, bool gotRequest) {
          } catch (const Exception&) {
          }
       } else if (dynamic_cast<MalformedHeaderException*>(error) != nullptr) {
-         PELMORA_LOG_WARNING(_logger.Get(), "Ill-formed header on stream %1: %2", stream, *error);
+         PELMORA_LOG_WARNING(_logger.Get(), "Ill-formed header on stream %1: %2", stream(), *error);
       } else if (_firstRequest) {
-         PELMORA_LOG_INFO(_logger.Get(), "First read failed on stream %1: %2", stream, *error);
+         PELMORA_LOG_INFO(_logger.Get(), "First read failed on stream %1: %2", stream(), *error);
       } else {
          PELMORA_LOG_INFO(_logger.Get(), "Connection lost while waiting for the next request on stream %1: %2",
-                          stream, *error);
+                          stream(), *error);
       }
       End();
       return false;
@@ -359,12 +367,12 @@ bool HttpConnectionImpl::AfterResponse(bool next) {
 
 // Runs the handler for the request just read; true when the connection stays open.
 bool HttpConnectionImpl::Dispatch() {
-   std::string stream = StreamName(_stream.Get());
+   auto stream = [this] { return StreamName(_stream.Get()); };
    const HttpSvcConfig& config = GetHttpSvcConfig();
    const RequestHeader& header = _request->GetHeader();
    try {
       if (config.maxHeaderFields >= 0 && static_cast<long long>(header.GetFields().size()) > config.maxHeaderFields) {
-         PELMORA_LOG_WARNING(_logger.Get(), "Request on stream %1 has %2 header fields, more than %3", stream,
+         PELMORA_LOG_WARNING(_logger.Get(), "Request on stream %1 has %2 header fields, more than %3", stream(),
                              static_cast<long long>(header.GetFields().size()), config.maxHeaderFields);
          _response->SendError(kHeaderFieldsTooLarge);
          return false;
@@ -372,14 +380,14 @@ bool HttpConnectionImpl::Dispatch() {
       long long length = 0;
       if (config.maxRequestBodyBytes >= 0 && _request->GetContentLength(length) &&
           length > config.maxRequestBodyBytes) {
-         PELMORA_LOG_WARNING(_logger.Get(), "Request body of %1 bytes on stream %2 exceeds %3", length, stream,
+         PELMORA_LOG_WARNING(_logger.Get(), "Request body of %1 bytes on stream %2 exceeds %3", length, stream(),
                              config.maxRequestBodyBytes);
          _response->SendError(ResponseCode::RequestEntityTooLarge);
          return false;
       }
       const std::string& path = _request->GetPath();
       if (!IsValidUtf8(path)) {
-         PELMORA_LOG_WARNING(_logger.Get(), "HTTP Transaction failed on stream %1 with error %2", stream,
+         PELMORA_LOG_WARNING(_logger.Get(), "HTTP Transaction failed on stream %1 with error %2", stream(),
                              "Invalid UTF-8");
          _response->SendError(ResponseCode::BadRequest, "Invalid UTF-8");
          return false;
@@ -401,7 +409,7 @@ bool HttpConnectionImpl::Dispatch() {
       // A handler that wrote its answer without ending it still gets it sent.
       if (!_response->IsResponseComplete()) _response->Complete();
    } catch (const Exception& e) {
-      PELMORA_LOG_WARNING(_logger.Get(), "HTTP Transaction failed on stream %1 with error %2", stream, e);
+      PELMORA_LOG_WARNING(_logger.Get(), "HTTP Transaction failed on stream %1 with error %2", stream(), e);
       bool tooLarge = dynamic_cast<const RequestBodyTooLargeException*>(&e) != nullptr;
       if (!_response->IsHeaderSent() && !_response->IsResponseComplete()) {
          try {

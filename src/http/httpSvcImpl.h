@@ -65,6 +65,10 @@ private:
    bool _firstRequest = true;
    bool _completed = false;
    bool _completedKeepAlive = false;
+   std::string _agent;  // the last User-Agent and what the expressions said of it
+   bool _agentKnown = false;
+   bool _agentNonChunking = false;
+   bool _agentNeedsLength = false;
    bool _deferred = false;  // the response finishes after its handler returned
    std::chrono::steady_clock::time_point _began;
    long long _writtenBefore = 0;

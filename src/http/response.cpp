@@ -108,7 +108,9 @@ private:
 void ResponseImpl::PrepareToWrite() {
    ClientCapabilities capabilities;
    _connection->GetClientCapabilities(capabilities);
-   PELMORA_LOG_VERBOSE(GetHttpLogger(),
+   // Per-response lines are trivia: the in-memory log keeps verbose ones, and formatting
+   // them for every response costs more than the rest of a small answer.
+   PELMORA_LOG_TRIVIA(GetHttpLogger(),
                        "HTTP Response: Client: NeedsContentLength: %1 UnderstandsChunking: %2 CanKeepAlive: %3 "
                        "(PresetContentLength %4)",
                        capabilities.needsContentLength, capabilities.understandsChunking,
@@ -210,7 +212,7 @@ void ResponseImpl::PrependHeader() {
    std::string head = _header.ToString();
    size_t headLen = head.size();
    PELMORA_VERIFY(headLen > 0);
-   PELMORA_LOG_VERBOSE(GetHttpLogger(), "HTTP Response: Header size is %1", headLen);
+   PELMORA_LOG_TRIVIA(GetHttpLogger(), "HTTP Response: Header size is %1", headLen);
    if (headLen <= _buffer->PrependPosition()) {
       size_t numWritten = _buffer->Prepend(head.data(), headLen);
       PELMORA_VERIFY(numWritten == headLen);
