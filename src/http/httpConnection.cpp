@@ -17,8 +17,9 @@ namespace {
 // 431 is not in the shared table; the server is the only one that sends it.
 const ResponseCode::Info kHeaderFieldsTooLarge = {431, "Request Header Fields Too Large"};
 
-// Passes everything to the accepted stream and tells the connection when request bytes
-// arrive, so that a client trickling a header is caught by the request deadline.
+// Passes everything to the accepted stream, counts the bytes going out and tells the
+// connection when a read starts and ends, so that a client trickling a request (header
+// or body) is caught by the request deadline.
 class WatchedStream : public virtual System::Stream, public virtual System::FileSender, public ObjectImpl {
 public:
    WatchedStream(System::Stream* inner, HttpConnectionImpl* connection)
