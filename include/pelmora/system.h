@@ -12,6 +12,7 @@
 #include "pelmora/system/socket.h"
 #include "pelmora/system/ssl.h"
 #include "pelmora/system/stream.h"
+#include "pelmora/system/streamFileSender.h"
 #include "pelmora/system/systemFactory.h"
 #include "pelmora/system/thread.h"
 #include "pelmora/system/threadPool.h"
