@@ -3,9 +3,10 @@
 // Everything that needs the allocator or the dynamic loader (formatting, resolving the
 // backtrace) happens before the fork; the child is made with the C library's fork so
 // that the allocator is usable in it. Logging locks that other threads held at fork time
-// stay held in the child, so the dying process waits for the child a bounded time; past
-// it, it kills the child and writes the prepared report to standard error itself,
-// without locks or allocation, before it dumps core.
+// stay held in the child; the logging locks take them over there (InReportChild). For
+// whatever else may hang, the dying process waits for the child a bounded time; past it,
+// it kills the child and writes the prepared report to standard error itself, without
+// locks or allocation, before it dumps core.
 
 #include <signal.h>
 #include <sys/mman.h>
@@ -33,6 +34,7 @@ namespace {
 
 std::atomic<long> g_reportChildMs{30000};
 std::atomic<bool> g_mayFork{true};
+std::atomic<bool> g_inReportChild{false};
 thread_local bool t_panicking = false;
 
 // Set by the report child once the first line is logged; shared with the dying process.
@@ -103,6 +105,7 @@ void WriteReport(const std::string& text, bool wanted, const char* message) {
       if (shared != MAP_FAILED) g_reportLogged = static_cast<volatile sig_atomic_t*>(shared);
       pid_t child = fork();
       if (child == 0) {
+         g_inReportChild.store(true, std::memory_order_relaxed);
          WriteReport(text, wanted, message);
          _exit(-1);
       }
@@ -123,6 +126,7 @@ namespace Internal {
 void SetPanicReportTimeout(std::chrono::milliseconds limit) {
    g_reportChildMs.store(static_cast<long>(limit.count()), std::memory_order_relaxed);
 }
+bool InReportChild() { return g_inReportChild.load(std::memory_order_relaxed); }
 }  // namespace Internal
 
 std::string FormatPanicMessage(const char* prefix, const char* expr, const char* file, int line) {

@@ -35,4 +35,9 @@ ReportSink& GetReportSink();
 // child and writes the report to standard error itself. 30 s unless changed.
 void SetPanicReportTimeout(std::chrono::milliseconds limit);
 
+// True in a panic's report child. It runs the panicking thread alone: a lock another
+// thread held at fork time is never given back there, so the logging locks take such a
+// lock over instead of waiting for it.
+bool InReportChild();
+
 }  // namespace Pelmora::Internal

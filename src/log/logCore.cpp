@@ -187,6 +187,11 @@ void LogOutputLock::ReadLock() {
    }
    uint32_t state = _state.load(std::memory_order_relaxed);
    for (;;) {
+      if ((state & kWriter) && Internal::InReportChild()) {
+         // A writer that held it at fork time does not run in a report child.
+         _state.store(1, std::memory_order_relaxed);
+         return;
+      }
       if (state & kWriter) {
          state = Await(state);
       } else if (_state.compare_exchange_weak(state, state + 1, std::memory_order_acquire,
@@ -236,6 +241,11 @@ void LogOutputLock::WriteLock() {
    // A waiting mark alone does not keep a writer out; it stays for the others.
    while (!_state.compare_exchange_weak(state, kWriter | (state & kWaiting),
                                         std::memory_order_acquire, std::memory_order_relaxed)) {
+      if ((state & ~kWaiting) && Internal::InReportChild()) {
+         // Taken over: its holders do not run in a report child.
+         _state.store(kWriter, std::memory_order_relaxed);
+         break;
+      }
       if (state & ~kWaiting) state = Await(state) & kWaiting;
    }
    _owner.store(self, std::memory_order_relaxed);

@@ -13,6 +13,7 @@
 
 #include "pelmora/object/containers.h"
 #include "pelmora/service/logWriters.h"
+#include "src/internal/report.h"
 
 namespace Pelmora::Service {
 
@@ -34,6 +35,11 @@ public:
       uint32_t state = 0;
       if (_state.compare_exchange_strong(state, kLocked, std::memory_order_acquire,
                                          std::memory_order_relaxed)) {
+         return;
+      }
+      if (Internal::InReportChild()) {
+         // The holder does not run in a report child; the report must not wait for it.
+         _state.store(kLocked, std::memory_order_relaxed);
          return;
       }
       // From here on the holder is told that someone waits; a wrong guess costs one wake.

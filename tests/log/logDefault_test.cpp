@@ -67,3 +67,72 @@ TEST(LogMemoryDeathTest, PanicReportHasTheRecentLinesWhileAnotherThreadHoldsALog
                 "----- End of recent log lines -----");
    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(15));
 }
+
+namespace {
+
+// Writes to standard error; the first Flush stops its thread for good, holding the log
+// writer's lock around it.
+class StderrStoppingWriter : public virtual Writer, public ObjectImpl {
+public:
+   void Write(const char* data, int length) override {
+      while (length > 0) {
+         ssize_t n = write(STDERR_FILENO, data, static_cast<size_t>(length));
+         if (n <= 0) return;
+         data += n;
+         length -= static_cast<int>(n);
+      }
+   }
+   void Flush() override {
+      if (stopped.exchange(true)) return;
+      for (;;) pause();
+   }
+   void Close() override {}
+   std::atomic<bool> stopped{false};
+};
+
+void WaitFor(const std::atomic<bool>& flag) {
+   auto end = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+   while (!flag.load() && std::chrono::steady_clock::now() < end) std::this_thread::yield();
+}
+
+// Panics while another thread, stopped for good, holds the default output's lock or one
+// of its writers' locks. The report time-out is short: a report child that waits for the
+// lock is killed by then and the report is cut short, without the recent lines.
+void PanicWithALogLockHeld(bool writerLock) {
+   SetPanicMayFork(true);
+   Internal::SetPanicReportTimeout(std::chrono::milliseconds(1500));
+   PELMORA_LOG_VERBOSE(GetDefaultLogger(), "recent line %1", 9);
+   LogOutput* output = GetDefaultLogger()->GetLogOutput();
+   std::atomic<bool> held{false};
+   if (writerLock) {
+      Ref<StderrStoppingWriter> target = new StderrStoppingWriter();
+      Ref<LogWriter> writer;
+      CreateLogWriter("stopping", target.Get(), "trivia", writer);
+      output->AddWriter("stopping", writer.Get());
+      std::thread([writer] { writer->Flush(); }).detach();
+      WaitFor(target->stopped);
+   } else {
+      std::thread([&] {
+         output->RecursiveWriteLock();
+         held.store(true);
+         for (;;) pause();
+      }).detach();
+      WaitFor(held);
+   }
+   PELMORA_VERIFY(1 + 1 == 3);
+}
+
+}  // namespace
+
+TEST(LogMemoryDeathTest, PanicReportIsWholeAndQuickWhileAnotherThreadHoldsALogLock) {
+   const char* whole =
+       "Panic: Assert Failed: \"1 \\+ 1 == 3\".*"
+       "----- Recent log lines \\(Assert Failed: .*recent line 9\n.*"
+       "----- End of recent log lines -----";
+   for (bool writerLock : {false, true}) {
+      auto start = std::chrono::steady_clock::now();
+      EXPECT_DEATH(PanicWithALogLockHeld(writerLock), whole) << "writer lock " << writerLock;
+      EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(1500))
+          << "writer lock " << writerLock;
+   }
+}
