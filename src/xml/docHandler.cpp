@@ -63,7 +63,8 @@ public:
    void OnStartElement(const std::string& name, int line, int column,
                        const char** attributes) override {
       IncNodeCountAndValidate(name.size());
-      std::unique_ptr<ElementNodeImpl> element(new (_arena) ElementNodeImpl(name, line, column));
+      std::unique_ptr<ElementNodeImpl> element(
+          new (_arena) ElementNodeImpl(_arena->InternName(name), line, column));
       for (const char** attribute = attributes; *attribute; attribute += 2)
          ValidateByteCount(std::strlen(attribute[0]) + std::strlen(attribute[1]));
       element->DefineParsedAttributes(attributes);

@@ -241,43 +241,60 @@ void DocumentImpl::PostRemoveProcessing(NodeImpl* child) {
 
 // ---- ElementNodeImpl ----
 
-ElementNodeImpl::ElementNodeImpl(const std::string& qualifiedName, int line, int column)
-    : _line(line), _column(column) {
+ElementName ElementName::FromQualified(std::string_view qualifiedName) {
    // A leading colon separates nothing: ":" or ":x" kept whole still writes back as read.
    size_t colon = qualifiedName.find(':');
-   if (colon == std::string::npos || colon == 0) {
-      _tag = qualifiedName;
-   } else {
-      _prefix.assign(qualifiedName, 0, colon);
-      _tag.assign(qualifiedName, colon + 1);
-   }
+   if (colon == std::string_view::npos || colon == 0) return {{}, std::string(qualifiedName)};
+   return {std::string(qualifiedName.substr(0, colon)),
+           std::string(qualifiedName.substr(colon + 1))};
 }
+
+ElementNodeImpl::ElementNodeImpl(const std::string& qualifiedName, int line, int column)
+    : _name(new ElementName(ElementName::FromQualified(qualifiedName))),
+      _line(line),
+      _column(column),
+      _ownsName(true) {}
 
 ElementNodeImpl::ElementNodeImpl(const std::string& prefix, const std::string& tag, int line,
                                  int column)
-    : _prefix(prefix), _tag(tag), _line(line), _column(column) {}
+    : _name(new ElementName{prefix, tag}), _line(line), _column(column), _ownsName(true) {}
+
+ElementNodeImpl::ElementNodeImpl(const ElementName* name, int line, int column)
+    : _name(name), _line(line), _column(column), _ownsName(false) {}
+
+ElementNodeImpl::~ElementNodeImpl() {
+   if (_ownsName) delete _name;
+}
+
+ElementName& ElementNodeImpl::OwnName() {
+   if (!_ownsName) {
+      _name = new ElementName(*_name);
+      _ownsName = true;
+   }
+   return *const_cast<ElementName*>(_name);
+}
 
 void ElementNodeImpl::SetPrefix(const std::string& prefix) {
-   VerifyElementName(prefix, _tag);
-   _prefix = prefix;
+   VerifyElementName(prefix, _name->tag);
+   OwnName().prefix = prefix;
 }
 
 void ElementNodeImpl::SetTag(const std::string& tag) {
-   VerifyElementName(_prefix, tag);
-   _tag = tag;
+   VerifyElementName(_name->prefix, tag);
+   OwnName().tag = tag;
 }
 
 std::string ElementNodeImpl::GetName() const {
-   if (_prefix.empty()) return _tag;
+   if (_name->prefix.empty()) return _name->tag;
    std::string name;
-   name.reserve(_prefix.size() + 1 + _tag.size());
-   name.append(_prefix).append(1, ':').append(_tag);
+   name.reserve(_name->prefix.size() + 1 + _name->tag.size());
+   name.append(_name->prefix).append(1, ':').append(_name->tag);
    return name;
 }
 
 void ElementNodeImpl::GetQName(QName& name) const {
-   if (!ResolvePrefix(_prefix, name.uri)) name.uri.clear();
-   name.localName = _tag;
+   if (!ResolvePrefix(_name->prefix, name.uri)) name.uri.clear();
+   name.localName = _name->tag;
 }
 
 namespace {
@@ -345,7 +362,12 @@ void ElementNodeImpl::DefineParsedAttributes(const char** attributes) {
    _attributes.reserve(_attributes.size() + count);
    for (const char** attribute = attributes; *attribute; attribute += 2)
       _attributes.emplace_back(attribute[0], attribute[1]);
-   std::sort(_attributes.begin(), _attributes.end());
+   // Names are unique: ordering by name alone orders the pairs.
+   auto byName = [](const AttributeList::value_type& a, const AttributeList::value_type& b) {
+      return a.first < b.first;
+   };
+   if (!std::is_sorted(_attributes.begin(), _attributes.end(), byName))
+      std::sort(_attributes.begin(), _attributes.end(), byName);
 }
 
 void ElementNodeImpl::RemoveAttribute(const std::string& name) {

@@ -26,8 +26,30 @@ size_t RoundUp(size_t size) {
 
 }  // namespace
 
+struct NodeArena::Interned {
+   explicit Interned(std::string_view name)
+       : qualified(name), name(ElementName::FromQualified(name)) {}
+   const std::string qualified;
+   const ElementName name;
+};
+
 NodeArena::~NodeArena() {
+   for (Interned* interned : _interned) delete interned;
    for (char* block : _blocks) ::operator delete(block);
+}
+
+const ElementName* NodeArena::InternName(std::string_view qualifiedName) {
+   auto found = _names.find(qualifiedName);
+   if (found != _names.end()) return &found->second->name;
+   _interned.reserve(_interned.size() + 1);
+   auto* interned = new Interned(qualifiedName);
+   _interned.push_back(interned);
+   try {
+      _names.emplace(interned->qualified, interned);
+   } catch (...) {
+      // Kept by _interned: found again by no one, freed with the arena.
+   }
+   return &interned->name;
 }
 
 void* NodeArena::Allocate(size_t size) {
@@ -51,7 +73,11 @@ void* NodeArena::Allocate(size_t size) {
 
 void NodeArena::Release() { Drop(1); }
 
-void NodeArena::ReleaseCreator() { Drop(kCreatorBias - _allocated); }
+void NodeArena::ReleaseCreator() {
+   // No more names are looked up; the names themselves stay with their elements.
+   std::unordered_map<std::string_view, Interned*>().swap(_names);
+   Drop(kCreatorBias - _allocated);
+}
 
 void NodeArena::Drop(size_t references) {
    if (_references.fetch_sub(references, std::memory_order_acq_rel) == references) delete this;

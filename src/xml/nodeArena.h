@@ -7,9 +7,13 @@
 
 #include <atomic>
 #include <cstddef>
+#include <string_view>
+#include <unordered_map>
 #include <vector>
 
 namespace Pelmora::Xml {
+
+struct ElementName;
 
 class NodeArena {
 public:
@@ -24,6 +28,10 @@ public:
    void Release();
    // Drops the creator's reference, after its last Allocate.
    void ReleaseCreator();
+   // The one name of this arena's elements called `qualifiedName`; it lives as long as
+   // the arena. By the creator, before ReleaseCreator. A document names few kinds of
+   // element many times: shared, the names cost a lookup instead of two strings a node.
+   const ElementName* InternName(std::string_view qualifiedName);
 
 private:
    // The creator's reference counts as this many, so that nodes need no atomic increment
@@ -39,6 +47,10 @@ private:
    std::vector<char*> _blocks;
    char* _cursor = nullptr;
    char* _end = nullptr;
+   // The interned names by qualified name; the keys view the stored qualified names.
+   struct Interned;
+   std::unordered_map<std::string_view, Interned*> _names;
+   std::vector<Interned*> _interned;
 };
 
 }  // namespace Pelmora::Xml

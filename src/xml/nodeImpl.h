@@ -16,6 +16,16 @@ namespace Pelmora::Xml {
 
 class NodeArena;
 
+// An element's prefix and tag. Parsed elements of one document share one per distinct
+// name (the document's arena keeps them); other elements own theirs.
+struct ElementName {
+   std::string prefix;
+   std::string tag;
+   // Splits a qualified name at the first ":"; no ":", or only a leading one, means no
+   // prefix.
+   static ElementName FromQualified(std::string_view qualifiedName);
+};
+
 // Throws InvalidArgumentException, naming `what`, `name` and the fault, unless `name` can be
 // written as an XML name.
 void VerifyName(const char* what, std::string_view name);
@@ -121,16 +131,18 @@ public:
    using AttributeList = std::vector<std::pair<std::string, std::string>>;
    using NodeImpl::WriteNode;
 
-   // Splits the qualified name at the first ":"; no ":", or only a leading one, means no
-   // prefix. The constructors take names as given (the parser's are known good); the
-   // factories and setters check them.
+   // The constructors take names as given (the parser's are known good); the factories
+   // and setters check them. The qualified name is split as ElementName::FromQualified.
    ElementNodeImpl(const std::string& qualifiedName, int line, int column);
    ElementNodeImpl(const std::string& prefix, const std::string& tag, int line, int column);
+   // With a name shared by the elements of a parsed document; `name` outlives the node.
+   ElementNodeImpl(const ElementName* name, int line, int column);
+   ~ElementNodeImpl() override;
 
    int GetNodeType() const override { return kElementNode; }
-   const std::string& GetPrefix() const override { return _prefix; }
+   const std::string& GetPrefix() const override { return _name->prefix; }
    void SetPrefix(const std::string& prefix) override;
-   const std::string& GetTag() const override { return _tag; }
+   const std::string& GetTag() const override { return _name->tag; }
    void SetTag(const std::string& tag) override;
    std::string GetName() const override;
    void GetQName(QName& name) const override;
@@ -161,12 +173,15 @@ public:
    bool IsBlockLayout(int indent) const;
 
 private:
+   // The name to change, made this element's own first if it was shared.
+   ElementName& OwnName();
+
    // Allocated on the first DefineAttribute: most elements carry no attributes.
    AttributeList _attributes;
-   std::string _prefix;
-   std::string _tag;
+   const ElementName* _name;
    int _line;
    int _column;
+   bool _ownsName;
 };
 
 class TextNodeImpl final : public virtual TextNode, public NodeImpl {

@@ -96,11 +96,11 @@ bool ElementNodeImpl::IsBlockLayout(int indent) const {
 bool ElementNodeImpl::WriteStartTag(Writer* writer, int indent) const {
    WriteIndent(writer, indent);
    writer->Write("<", 1);
-   if (!_prefix.empty()) {
-      WriteString(writer, _prefix);
+   if (!_name->prefix.empty()) {
+      WriteString(writer, _name->prefix);
       writer->Write(":", 1);
    }
-   WriteString(writer, _tag);
+   WriteString(writer, _name->tag);
    for (const auto& [name, value] : _attributes) {
       writer->Write(" ", 1);
       WriteString(writer, name);
@@ -122,11 +122,11 @@ void ElementNodeImpl::WriteEndTag(Writer* writer, int indent) const {
       WriteIndent(writer, indent);
    }
    writer->Write("</", 2);
-   if (!_prefix.empty()) {
-      WriteString(writer, _prefix);
+   if (!_name->prefix.empty()) {
+      WriteString(writer, _name->prefix);
       writer->Write(":", 1);
    }
-   WriteString(writer, _tag);
+   WriteString(writer, _name->tag);
    writer->Write(">", 1);
 }
 

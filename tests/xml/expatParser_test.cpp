@@ -259,6 +259,40 @@ TEST_F(ParserTest, ParsedNodesOutliveTheirDocumentAndMixWithBuiltOnes) {
    EXPECT_EQ(body, dynamic_cast<TextNode*>(text)->GetText());
 }
 
+// The elements of a parsed document share their names: renaming one must leave the
+// others of its name alone, and a name must live as long as any element that has it.
+TEST_F(ParserTest, ParsedElementsAreRenamedOneAtATime) {
+   Ref<XMLParser> parser = NewParser();
+   Ref<ElementNode> renamed, shared;
+   {
+      Ref<Document> document = Parse(parser.Get(), "<p:r xmlns:p='u'><p:e/><p:e/><e/><:c/></p:r>");
+      ElementNode* root = document->GetRoot();
+      auto* first = dynamic_cast<ElementNode*>(root->GetFirstChild());
+      auto* second = dynamic_cast<ElementNode*>(first->GetNextSibling());
+      auto* plain = dynamic_cast<ElementNode*>(second->GetNextSibling());
+      auto* colon = dynamic_cast<ElementNode*>(plain->GetNextSibling());
+      EXPECT_EQ("p", root->GetPrefix());
+      EXPECT_EQ("r", root->GetTag());
+      EXPECT_EQ("", plain->GetPrefix());
+      EXPECT_EQ("e", plain->GetTag());
+      EXPECT_EQ("", colon->GetPrefix());
+      EXPECT_EQ(":c", colon->GetTag());
+      first->SetTag("f");
+      second->SetPrefix("q");
+      EXPECT_EQ("<p:r xmlns:p=\"u\"><p:f/><q:e/><e/><:c/></p:r>", Write(root));
+      renamed = second;
+      shared = plain;
+      root->RemoveChild(second);
+   }
+   // Its document and that document's names are gone; the next document's are its own.
+   Ref<Document> next = Parse(parser.Get(), "<p:e><q:e/></p:e>");
+   EXPECT_EQ("q:e", renamed->GetName());
+   EXPECT_EQ("e", shared->GetName());
+   EXPECT_EQ("<p:e><q:e/></p:e>", Write(next->GetRoot()));
+   next->GetRoot()->AppendChild(renamed.Get());
+   EXPECT_EQ("<p:e><q:e/><q:e/></p:e>", Write(next->GetRoot()));
+}
+
 // Records the events it receives; fails on some element names.
 class RecordingHandler : public XMLHandler, public ObjectImpl {
 public:
