@@ -2,9 +2,11 @@
 // character data, and enforces the size, node and depth limits on restricted documents.
 
 #include <cstdint>
+#include <algorithm>
 #include <cstring>
 #include <initializer_list>
 #include <memory>
+#include <string_view>
 #include <mutex>
 #include <utility>
 #include <vector>
@@ -29,6 +31,66 @@ void VerifyLimits(const DocLimits& limits) {
       PELMORA_VERIFY(out >= 0);
 }
 
+// The names of the document being built, by qualified name: open addressing over a
+// table the handler keeps from one document to the next, so that looking up a name costs
+// a hash and a compare and a small document allocates nothing here.
+class NameTable {
+public:
+   const ElementName* Find(std::string_view qualifiedName, NodeArena* arena) {
+      if (_slots.empty()) _slots.resize(kFirstSize);
+      uint64_t hash = Hash(qualifiedName);
+      size_t mask = _slots.size() - 1;
+      for (size_t i = hash & mask;; i = (i + 1) & mask) {
+         Slot& slot = _slots[i];
+         if (!slot.name) {
+            slot.name = arena->NewName(qualifiedName, slot.key);
+            slot.hash = hash;
+            const ElementName* made = slot.name;
+            if (++_count * 2 > _slots.size()) Grow();
+            return made;
+         }
+         if (slot.hash == hash && slot.key == qualifiedName) return slot.name;
+      }
+   }
+
+   // Before the names' arena goes.
+   void Clear() {
+      if (_count == 0) return;
+      std::fill(_slots.begin(), _slots.end(), Slot());
+      _count = 0;
+   }
+
+private:
+   static constexpr size_t kFirstSize = 64;
+
+   struct Slot {
+      uint64_t hash = 0;
+      std::string_view key;  // in the arena of `name`
+      const ElementName* name = nullptr;
+   };
+
+   static uint64_t Hash(std::string_view text) {
+      uint64_t hash = 14695981039346656037ull;  // FNV-1a
+      for (char c : text) hash = (hash ^ static_cast<unsigned char>(c)) * 1099511628211ull;
+      return hash;
+   }
+
+   void Grow() {
+      std::vector<Slot> old(_slots.size() * 2);
+      old.swap(_slots);
+      size_t mask = _slots.size() - 1;
+      for (const Slot& slot : old) {
+         if (!slot.name) continue;
+         size_t i = slot.hash & mask;
+         while (_slots[i].name) i = (i + 1) & mask;
+         _slots[i] = slot;
+      }
+   }
+
+   std::vector<Slot> _slots;
+   size_t _count = 0;
+};
+
 class XMLDocHandlerImpl final : public virtual XMLHandler, public ObjectImpl {
 public:
    explicit XMLDocHandlerImpl(const DocLimits& limits)
@@ -47,6 +109,7 @@ public:
       _bytes = 0;
       _nodes = 0;
       _restricted = restricted;
+      _names.Clear();
       ReleaseArena();
       _arena = new NodeArena();
       _document = new (_arena) DocumentImpl();
@@ -56,6 +119,7 @@ public:
 
    void CleanUpDocument() override {
       _stack.clear();
+      _names.Clear();
       _document.Reset();
       ReleaseArena();
    }
@@ -64,7 +128,7 @@ public:
                        const char** attributes) override {
       IncNodeCountAndValidate(name.size());
       std::unique_ptr<ElementNodeImpl> element(
-          new (_arena) ElementNodeImpl(_arena->InternName(name), line, column));
+          new (_arena) ElementNodeImpl(_names.Find(name, _arena), line, column));
       for (const char** attribute = attributes; *attribute; attribute += 2)
          ValidateByteCount(std::strlen(attribute[0]) + std::strlen(attribute[1]));
       element->DefineParsedAttributes(attributes);
@@ -167,6 +231,7 @@ private:
    uint64_t _nodes = 0;
    Ref<DocumentImpl> _document;
    NodeArena* _arena = nullptr;
+   NameTable _names;
 };
 
 }  // namespace

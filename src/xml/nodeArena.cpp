@@ -26,33 +26,37 @@ size_t RoundUp(size_t size) {
 
 }  // namespace
 
-struct NodeArena::Interned {
-   explicit Interned(std::string_view name)
-       : qualified(name), name(ElementName::FromQualified(name)) {}
-   const std::string qualified;
-   const ElementName name;
+struct NodeArena::StoredName {
+   ElementName name;
+   StoredName* next;
 };
 
 NodeArena::~NodeArena() {
-   for (Interned* interned : _interned) delete interned;
+   for (StoredName* stored = _names; stored;) {
+      StoredName* next = stored->next;
+      stored->~StoredName();
+      stored = next;
+   }
    for (char* block : _blocks) ::operator delete(block);
 }
 
-const ElementName* NodeArena::InternName(std::string_view qualifiedName) {
-   auto found = _names.find(qualifiedName);
-   if (found != _names.end()) return &found->second->name;
-   _interned.reserve(_interned.size() + 1);
-   auto* interned = new Interned(qualifiedName);
-   _interned.push_back(interned);
-   try {
-      _names.emplace(interned->qualified, interned);
-   } catch (...) {
-      // Kept by _interned: found again by no one, freed with the arena.
-   }
-   return &interned->name;
+const ElementName* NodeArena::NewName(std::string_view qualifiedName, std::string_view& stored) {
+   char* text = static_cast<char*>(AllocateRaw(qualifiedName.size()));
+   std::copy(qualifiedName.begin(), qualifiedName.end(), text);
+   auto* name = new (AllocateRaw(sizeof(StoredName)))
+       StoredName{ElementName::FromQualified(qualifiedName), _names};
+   _names = name;
+   stored = std::string_view(text, qualifiedName.size());
+   return &name->name;
 }
 
 void* NodeArena::Allocate(size_t size) {
+   void* memory = AllocateRaw(size);
+   ++_allocated;
+   return memory;
+}
+
+void* NodeArena::AllocateRaw(size_t size) {
    size = RoundUp(size);
    if (static_cast<size_t>(_end - _cursor) < size) {
       size_t blockSize = _blocks.empty() ? kFirstBlockSize
@@ -67,17 +71,12 @@ void* NodeArena::Allocate(size_t size) {
    }
    void* memory = _cursor;
    _cursor += size;
-   ++_allocated;
    return memory;
 }
 
 void NodeArena::Release() { Drop(1); }
 
-void NodeArena::ReleaseCreator() {
-   // No more names are looked up; the names themselves stay with their elements.
-   std::unordered_map<std::string_view, Interned*>().swap(_names);
-   Drop(kCreatorBias - _allocated);
-}
+void NodeArena::ReleaseCreator() { Drop(kCreatorBias - _allocated); }
 
 void NodeArena::Drop(size_t references) {
    if (_references.fetch_sub(references, std::memory_order_acq_rel) == references) delete this;

@@ -8,7 +8,6 @@
 #include <atomic>
 #include <cstddef>
 #include <string_view>
-#include <unordered_map>
 #include <vector>
 
 namespace Pelmora::Xml {
@@ -28,10 +27,10 @@ public:
    void Release();
    // Drops the creator's reference, after its last Allocate.
    void ReleaseCreator();
-   // The one name of this arena's elements called `qualifiedName`; it lives as long as
-   // the arena. By the creator, before ReleaseCreator. A document names few kinds of
-   // element many times: shared, the names cost a lookup instead of two strings a node.
-   const ElementName* InternName(std::string_view qualifiedName);
+   // A name for this arena's elements, made from `qualifiedName`, which is copied into
+   // the arena too and `stored` set to the copy. Both live as long as the arena. By the
+   // creator, before ReleaseCreator.
+   const ElementName* NewName(std::string_view qualifiedName, std::string_view& stored);
 
 private:
    // The creator's reference counts as this many, so that nodes need no atomic increment
@@ -41,16 +40,17 @@ private:
 
    ~NodeArena();
    void Drop(size_t references);
+   // As Allocate, for memory that holds no node reference.
+   void* AllocateRaw(size_t size);
 
    std::atomic<size_t> _references{kCreatorBias};
    size_t _allocated = 0;  // by the creator's thread only
    std::vector<char*> _blocks;
    char* _cursor = nullptr;
    char* _end = nullptr;
-   // The interned names by qualified name; the keys view the stored qualified names.
-   struct Interned;
-   std::unordered_map<std::string_view, Interned*> _names;
-   std::vector<Interned*> _interned;
+   // The names made here, newest first, to be destroyed with the arena.
+   struct StoredName;
+   StoredName* _names = nullptr;
 };
 
 }  // namespace Pelmora::Xml
