@@ -428,6 +428,11 @@ TEST_F(HttpSvcTest, SlowlorisIsClosedWhileOthersAreServed) {
 }
 
 TEST_F(HttpSvcTest, FailedAcceptsBackOffAndRecover) {
+#if defined(__SANITIZE_ADDRESS__)
+   // The sanitizer runtime opens files for its checks; with every descriptor taken it
+   // reports faults that are not there.
+   GTEST_SKIP() << "the sanitizer runtime needs descriptors of its own";
+#endif
    DefaultLogCapture log;
    StartServer();
    // The client's socket is made before the descriptors run out; it connects after.
