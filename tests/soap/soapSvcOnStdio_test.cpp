@@ -78,9 +78,10 @@ Outcome Serve(bool cgi, const std::string& input, std::map<std::string, std::str
    Outcome outcome;
    outcome.status = svc->HandleStdin();
    ::close(out[1]);
-   // The service may leave input unread; the feeder must still finish.
-   ::close(in[0]);
+   // The service may leave input unread: the inputs here fit the pipe, so the feeder ends
+   // without a reader, and the read end closes only after it (no SIGPIPE).
    feeder.join();
+   ::close(in[0]);
    char piece[4096];
    for (ssize_t n; (n = ::read(out[0], piece, sizeof piece)) > 0;) outcome.output.append(piece, static_cast<size_t>(n));
    ::close(out[0]);
