@@ -430,9 +430,11 @@ bool HttpConnectionImpl::FinishRequest() {
    bool hasBody = _request->IsChunkedEncoded() || _request->GetContentLength() > 0;
    if (hasBody) {
       try {
-         std::vector<char> scratch(16384);
+         // Uninitialised on the stack: usually the handler read the whole body and the
+         // first Read returns 0, so this must cost nothing.
+         char scratch[16384];
          long long left = GetHttpSvcConfig().maxRequestBodyBytes;
-         for (int n; (n = _request->Read(scratch.data(), static_cast<int>(scratch.size()))) > 0;) {
+         for (int n; (n = _request->Read(scratch, static_cast<int>(sizeof scratch))) > 0;) {
             left -= n;
             if (GetHttpSvcConfig().maxRequestBodyBytes >= 0 && left < 0) return false;
          }

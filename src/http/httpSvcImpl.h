@@ -105,6 +105,7 @@ public:
    long long GetAuthenticatedReadTimeout() override { return _config.authenticatedReadTimeout; }
    long long GetAuthenticatedWriteTimeout() override { return _config.authenticatedWriteTimeout; }
    int GetConnectionCount() override;
+   using ObjectImpl::ToString;
    std::string ToString() const override;
 
    const HttpSvcConfig& GetConfig() const { return _config; }

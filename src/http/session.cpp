@@ -116,6 +116,7 @@ public:
       std::lock_guard<std::mutex> lock(_mutex);
       return _valid;
    }
+   using ObjectImpl::ToString;
    std::string ToString() const override { return "Session " + _id; }
 
    // Marks the session ended and lets go of its values (they may refer back to it).
@@ -176,6 +177,7 @@ public:
    }
    size_t ExpireIdleSessions() override;
    void Shutdown() override;
+   using ObjectImpl::ToString;
    std::string ToString() const override { return "SessionService " + _config.cookieName; }
 
    // The session left the map on its own (Invalidate).
