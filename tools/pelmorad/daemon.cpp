@@ -22,6 +22,7 @@
 #include "pelmora/system/threadState.h"
 #include "tools/pelmorad/embedded.h"
 #include "tools/pelmorad/json.h"
+#include "tools/pelmorad/managementApi.h"
 #include "tools/pelmorad/settings.h"
 #include "tools/pelmorad/statusApi.h"
 
@@ -218,6 +219,8 @@ void Daemon::Start() {
 
    Http::CreateHttpSvc(socket.Get(), nullptr, httpView.Get(), _svc);
    _svc->SetRequestHandler(_documents.Get());
+   _management = std::make_unique<ManagementApi>(this);
+   _management->Start();
    _svc->Start();
    try {
       Service::StartSignalThread([this](int number) { OnSignal(number); });
@@ -260,6 +263,7 @@ void Daemon::Stop() {
       PELMORA_LOG_INFO(DaemonLogger(), "Stopping the HTTP service; %1 connections open", _svc->GetConnectionCount());
       _svc->Stop();
    }
+   if (_management) _management->Stop();
    PELMORA_LOG_INFO(DaemonLogger(), "HTTP service stopped");
    Service::GetApp()->Stop();
 }

@@ -17,6 +17,7 @@
 namespace Pelmora::Daemon {
 
 class EndpointCounters;
+class ManagementApi;
 
 class Daemon {
 public:
@@ -67,6 +68,7 @@ private:
    Ref<Http::HttpSvc> _svc;
    Ref<Http::DocumentHandler> _documents;
    std::unique_ptr<EndpointCounters> _counters;
+   std::unique_ptr<ManagementApi> _management;
 };
 
 }  // namespace Pelmora::Daemon
