@@ -25,7 +25,7 @@ TEST_CONFIG = """<?xml version="1.0"?>
 
 class Daemon:
     def __init__(self, binary, extra_args=(), config_text=None, config_name="test.xml",
-                 drain_ms=0, deadline_ms=5000, env=None):
+                 drain_ms=0, deadline_ms=5000, env=None, use_config=True):
         self.dir = tempfile.mkdtemp(prefix="pelmorad-test-")
         self.state = os.path.join(self.dir, "state")
         self.config = os.path.join(self.dir, config_name)
@@ -34,7 +34,9 @@ class Daemon:
         mode = "wb" if isinstance(config_text, bytes) else "w"
         with open(self.config, mode) as f:
             f.write(config_text)
-        args = [binary, "--port", "0", "--state-dir", self.state, "--config", self.config]
+        args = [binary, "--port", "0", "--state-dir", self.state]
+        if use_config:
+            args += ["--config", self.config]
         # Standard error goes to a file: a pipe nobody reads would stall a chatty daemon.
         self.stderr_path = os.path.join(self.dir, "stderr.txt")
         with open(self.stderr_path, "wb") as err:
