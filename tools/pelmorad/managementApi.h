@@ -6,7 +6,6 @@
 // arguments are answered with client faults, failures inside the daemon with server
 // faults. Made and stopped by the Daemon; calls run concurrently on pool threads.
 
-#include <memory>
 #include <mutex>
 #include <string>
 
