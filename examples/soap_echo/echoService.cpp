@@ -11,19 +11,6 @@ namespace {
 
 constexpr char kNamespace[] = "urn:anchor:echo";
 
-// The text of an element, pieces and CDATA sections joined.
-std::string TextOf(const Xml::Node* element) {
-   std::string text;
-   for (Xml::Node* child = element->GetFirstChild(); child != nullptr; child = child->GetNextSibling()) {
-      if (auto* piece = dynamic_cast<Xml::TextNode*>(child)) {
-         text += piece->GetText();
-      } else if (child->GetNodeType() == Xml::kCDataNode) {
-         text += TextOf(child);
-      }
-   }
-   return text;
-}
-
 Xml::ElementNode* Required(Xml::ElementNode* parent, const char* name) {
    Xml::ElementNode* child = parent->GetChildElementByTag(name);
    if (child == nullptr) throw Soap::InvalidRequestException(std::string("Missing element ") + name);
@@ -47,7 +34,7 @@ class EchoString : public virtual Soap::BodyHandler, public ObjectImpl {
 public:
    void GetBodyHandlerInfo(Soap::BodyHandlerInfo& out) const override { out = {kNamespace, "echoString"}; }
    void HandleBody(Soap::SoapRequest*, Xml::ElementNode*, Xml::ElementNode* body, Soap::Reply* reply) override {
-      Answer(reply, "echoString", "out", TextOf(Required(body, "in")));
+      Answer(reply, "echoString", "out", Xml::GetTextContent(Required(body, "in")));
    }
 };
 
@@ -56,8 +43,8 @@ public:
    void GetBodyHandlerInfo(Soap::BodyHandlerInfo& out) const override { out = {kNamespace, "describePerson"}; }
    void HandleBody(Soap::SoapRequest*, Xml::ElementNode*, Xml::ElementNode* body, Soap::Reply* reply) override {
       Xml::ElementNode* person = Required(body, "person");
-      std::string name = TextOf(Required(person, "name"));
-      std::string ageText = TextOf(Required(person, "age"));
+      std::string name = Xml::GetTextContent(Required(person, "name"));
+      std::string ageText = Xml::GetTextContent(Required(person, "age"));
       char* end = nullptr;
       long age = std::strtol(ageText.c_str(), &end, 10);
       if (ageText.empty() || *end != '\0') throw Soap::InvalidRequestException("age is not a number: " + ageText);
@@ -68,7 +55,7 @@ public:
       std::string languages;
       for (Xml::ElementNode* language = person->GetChildElementByTag("languages"); language != nullptr;
            language = language->GetSiblingElementByTag("languages"))
-         languages += (languages.empty() ? "" : ", ") + TextOf(language);
+         languages += (languages.empty() ? "" : ", ") + Xml::GetTextContent(language);
       std::string text = name + " (" + std::to_string(age) + ") speaks " + (languages.empty() ? "nothing" : languages);
       Answer(reply, "describePerson", "description", text);
    }

@@ -164,4 +164,16 @@ bool ValidateAnyURI(const char* uri) {
    return true;
 }
 
+std::string GetTextContent(const Node* node) {
+   std::string text;
+   for (Node* child = node->GetFirstChild(); child != nullptr; child = child->GetNextSibling()) {
+      if (auto* piece = dynamic_cast<TextNode*>(child)) {
+         text += piece->GetText();
+      } else if (child->GetNodeType() == kCDataNode) {
+         text += GetTextContent(child);
+      }
+   }
+   return text;
+}
+
 }  // namespace Pelmora::Xml

@@ -17,6 +17,7 @@
 #include "pelmora/service/config.h"
 #include "pelmora/system/ssl.h"
 #include "src/http/httpSvcImpl.h"
+#include "tests/support/configViews.h"
 #include "tests/support/httpClient.h"
 #include "tests/support/netFixture.h"
 #include "tests/support/watchdog.h"
@@ -83,12 +84,7 @@ Ref<Service::Logger> TestLogger() {
 }
 
 Ref<Service::Config::View> Settings(const std::vector<std::pair<std::string, std::string>>& values) {
-   Ref<Service::Config> config;
-   Service::CreateScratchConfig(config);
-   Ref<Service::Config::View> view;
-   config->GetView("pelmora/http", view);
-   for (const auto& [key, value] : values) view->Set(key, value.c_str());
-   return view;
+   return TestSupport::ScratchView("pelmora/http", values);
 }
 
 class HttpSvcTest : public ::testing::Test {

@@ -1,7 +1,9 @@
 #pragma once
-// Small readers of a configuration's main tree, shared by the configuration tests.
+// Small readers and scratch views of configurations, shared by the tests.
 
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service/config.h"
@@ -31,6 +33,17 @@ inline std::string ParseError(StringFactory factory, std::string text) {
       return e.what();
    }
    return "no exception";
+}
+
+// A view of `subtree` in a scratch configuration holding `values`: settings for one test.
+inline Ref<Service::Config::View> ScratchView(const std::string& subtree,
+                                              const std::vector<std::pair<std::string, std::string>>& values) {
+   Ref<Service::Config> config;
+   Service::CreateScratchConfig(config);
+   Ref<Service::Config::View> view;
+   config->GetView(subtree, view);
+   for (const auto& [key, value] : values) view->Set(key, value.c_str());
+   return view;
 }
 
 }  // namespace Pelmora::TestSupport

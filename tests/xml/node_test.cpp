@@ -303,6 +303,13 @@ TEST(SimplePathTest, WalksChildElementsAndEndsAtTheFirstAttributeStep) {
    }
 }
 
+TEST(TextContentTest, JoinsTextAndCDataButNotTheTextOfChildElements) {
+   Ref<Document> document =
+       Testing::Parse("<a>one &amp; <![CDATA[<two>]]><b>skipped</b> three<!-- not text --></a>");
+   EXPECT_EQ("one & <two> three", GetTextContent(document->GetRoot()));
+   EXPECT_EQ("", GetTextContent(Testing::Element("empty").Get()));
+}
+
 TEST(ValidateAnyURITest, AcceptsUsualNamespaceNamesAndRefusesMalformedOnes) {
    for (const char* good : {"http://schemas.xmlsoap.org/soap/envelope/", "urn:pelmora:config",
                             "relative/path", "a%20b", "x+y.z-1:rest", "http://h/\xc3\xa9"})

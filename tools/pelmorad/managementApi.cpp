@@ -44,23 +44,10 @@ std::string EscapeXml(const std::string& text) {
    return out;
 }
 
-// The text of an element, pieces and CDATA sections joined.
-std::string TextOf(const Xml::Node* element) {
-   std::string text;
-   for (Xml::Node* child = element->GetFirstChild(); child != nullptr; child = child->GetNextSibling()) {
-      if (auto* piece = dynamic_cast<Xml::TextNode*>(child)) {
-         text += piece->GetText();
-      } else if (child->GetNodeType() == Xml::kCDataNode) {
-         text += TextOf(child);
-      }
-   }
-   return text;
-}
-
 std::string RequiredText(Xml::ElementNode* body, const char* name) {
    Xml::ElementNode* child = body->GetChildElementByTag(name);
    if (child == nullptr) throw Soap::InvalidRequestException(std::string("Missing element ") + name);
-   return TextOf(child);
+   return Xml::GetTextContent(child);
 }
 
 // Builds "<m:NameResponse xmlns:m=...>" and its unqualified children.

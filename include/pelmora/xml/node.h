@@ -184,6 +184,9 @@ PELMORA_EXPORT bool GetNamespace(const ElementNode* element, std::string& uri);
 PELMORA_EXPORT bool EvaluateSimplePath(const ElementNode* element, const std::string& path, std::string& result);
 // The same from the document's root; InvalidArgumentException when there is no root.
 PELMORA_EXPORT bool EvaluateSimplePath(const Document* document, const std::string& path, std::string& result);
+// The text directly inside `node`: its text children and CDATA sections joined, in order;
+// child elements and their text are skipped.
+PELMORA_EXPORT std::string GetTextContent(const Node* node);
 
 // Escapes the five markup characters as entities and writes other bytes below 32, except
 // tab, line feed and carriage return, as "%" and two lowercase hexadecimal digits.
