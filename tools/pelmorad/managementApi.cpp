@@ -153,20 +153,11 @@ void AddStatus(Answer& answer, Daemon* daemon, const std::string& instanceId) {
 }
 
 void AddCounters(Answer& answer, const std::string& pattern) {
-   PerfCounter::Registry* registry = PerfCounter::GetCounterRegistry();
    PerfCounter::QueryResults results;
-   if (pattern.empty()) {
-      registry->CollectAll(results);
-   } else {
-      Ref<PerfCounter::Query> query;
-      try {
-         registry->CreateRegexQuery(pattern, false, query);
-      } catch (const InvalidArgumentException& e) {
-         throw Soap::InvalidRequestException("Invalid regular expression: " + e.GetMessage());
-      }
-      query->SetQueryOption(PerfCounter::QUERY_OPTION_SORT_BY_NAME, true);
-      query->Execute(results);
-      query->Uninitialize();
+   try {
+      QueryCounters(pattern, results);
+   } catch (const InvalidArgumentException& e) {
+      throw Soap::InvalidRequestException("Invalid regular expression: " + e.GetMessage());
    }
    for (const PerfCounter::QueryResult& result : results) {
       Xml::ElementNode* counter = answer.AddGroup("counter");

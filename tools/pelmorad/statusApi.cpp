@@ -69,9 +69,8 @@ void WriteThreadStates(JsonWriter& json) {
    json.EndArray();
 }
 
-void WriteCounters(JsonWriter& json, const std::string& pattern) {
+void QueryCounters(const std::string& pattern, PerfCounter::QueryResults& results) {
    PerfCounter::Registry* registry = PerfCounter::GetCounterRegistry();
-   PerfCounter::QueryResults results;
    if (pattern.empty()) {
       registry->CollectAll(results);
    } else {
@@ -81,6 +80,11 @@ void WriteCounters(JsonWriter& json, const std::string& pattern) {
       query->Execute(results);
       query->Uninitialize();
    }
+}
+
+void WriteCounters(JsonWriter& json, const std::string& pattern) {
+   PerfCounter::QueryResults results;
+   QueryCounters(pattern, results);
    json.BeginArray();
    for (const PerfCounter::QueryResult& result : results) {
       json.BeginObject();

@@ -6,6 +6,7 @@
 #include <string>
 #include <vector>
 
+#include "pelmora/perfCounter/registry.h"
 #include "tools/pelmorad/json.h"
 
 namespace Pelmora::Daemon {
@@ -27,8 +28,10 @@ void WriteProcess(JsonWriter& json, const ProcessFacts& facts);
 void WritePool(JsonWriter& json);
 // Every thread with posted states: [{"thread": id, "states": [...]}].
 void WriteThreadStates(JsonWriter& json);
-// The counters whose names match `pattern` (empty: all), in name order:
-// [{"name", "type", "value"}]. InvalidArgumentException for a pattern that does not compile.
+// The counters whose names match `pattern` (empty: all), in name order.
+// InvalidArgumentException for a pattern that does not compile.
+void QueryCounters(const std::string& pattern, PerfCounter::QueryResults& results);
+// The same as [{"name", "type", "value"}].
 void WriteCounters(JsonWriter& json, const std::string& pattern);
 // The last `lines` lines of the in-memory log ring, oldest first.
 std::vector<std::string> GetLogTail(int lines);
