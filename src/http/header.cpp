@@ -63,6 +63,33 @@ struct LowerTable {
 };
 constexpr LowerTable kLower;
 
+// Whole seconds of a time in microseconds, rounded down for times before 1970 as well.
+long long FloorSeconds(long long microseconds) {
+   long long seconds = microseconds / 1000000;
+   if (microseconds < 0 && microseconds % 1000000 != 0) --seconds;
+   return seconds;
+}
+
+// A busy server writes the same Date text thousands of times a second: each thread keeps
+// the text of the last second it formatted.
+struct DateCache {
+   bool valid = false;
+   long long second = 0;
+   std::string text;
+};
+thread_local DateCache tDateCache;
+
+const std::string& DateText(long long microseconds) {
+   long long second = FloorSeconds(microseconds);
+   DateCache& cache = tDateCache;
+   if (!cache.valid || cache.second != second) {
+      cache.text = HttpDateFormatter(second * 1000000).ToString();
+      cache.second = second;
+      cache.valid = true;
+   }
+   return cache.text;
+}
+
 }  // namespace
 
 bool CaseInsensitiveStringLess::operator()(std::string_view a, std::string_view b) const noexcept {
@@ -86,9 +113,7 @@ std::string HttpDateFormatter::ToString() const {
    static const char* const kDays[] = {"Sun", "Mon", "Tue", "Wed", "Thu", "Fri", "Sat"};
    static const char* const kMonths[] = {"Jan", "Feb", "Mar", "Apr", "May", "Jun",
                                          "Jul", "Aug", "Sep", "Oct", "Nov", "Dec"};
-   long long seconds = _time / 1000000;
-   if (_time < 0 && _time % 1000000 != 0) --seconds;
-   time_t when = static_cast<time_t>(seconds);
+   time_t when = static_cast<time_t>(FloorSeconds(_time));
    struct tm parts {};
    gmtime_r(&when, &parts);
    char text[64];
@@ -349,7 +374,7 @@ std::string ResponseHeader::ToString(long long microseconds) const {
    text += ' ';
    text += _status->reasonPhrase;
    text += "\r\nDate: ";
-   text += HttpDateFormatter(microseconds).ToString();
+   text += DateText(microseconds);
    text += "\r\n";
    for (const auto& [name, value] : _fields) {
       text += name;

@@ -146,6 +146,26 @@ TEST(HeaderTest, ResponseTextHasStatusDateFieldsCookiesAndBlankLine) {
    EXPECT_EQ(HttpDateFormatter(951782400LL * 1000000).ToString(), "Tue, 29 Feb 2000 00:00:00 GMT");
 }
 
+// Response texts reuse the date of the last second formatted: a new second, an earlier
+// one and the edges of a second must each get their own date.
+TEST(HeaderTest, ResponseDateFollowsEachSecond) {
+   ResponseHeader header;
+   auto date = [&header](long long microseconds) {
+      std::string text = header.ToString(microseconds);
+      size_t at = text.find("Date: ");
+      return text.substr(at + 6, text.find("\r\n", at) - at - 6);
+   };
+   const long long second = 1795554309LL * 1000000;
+   EXPECT_EQ(date(second), "Tue, 24 Nov 2026 21:05:09 GMT");
+   EXPECT_EQ(date(second + 999999), "Tue, 24 Nov 2026 21:05:09 GMT");
+   EXPECT_EQ(date(second + 1000000), "Tue, 24 Nov 2026 21:05:10 GMT");
+   EXPECT_EQ(date(second - 1), "Tue, 24 Nov 2026 21:05:08 GMT");
+   EXPECT_EQ(date(second + 86400LL * 1000000), "Wed, 25 Nov 2026 21:05:09 GMT");
+   EXPECT_EQ(date(-1), "Wed, 31 Dec 1969 23:59:59 GMT");
+   EXPECT_EQ(date(0), "Thu, 1 Jan 1970 00:00:00 GMT");
+   EXPECT_EQ(date(second), "Tue, 24 Nov 2026 21:05:09 GMT");
+}
+
 TEST(HeaderTest, ClientStatusLine) {
    ClientResponseHeader header;
    header.FromString("HTTP/1.1 302 Found\r\nLocation: /x\r\nSet-Cookie: a=1; Path=/\r\nSet-Cookie: b=2\r\n\r\n");
