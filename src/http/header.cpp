@@ -143,7 +143,20 @@ bool Header::GetField(const std::string& name, std::string& value) const {
 }
 
 void Header::SetField(const std::string& name, const std::string& value) {
-   _fields[name] = value;
+   // One descent, and a node kept by ClearHeader when there is one: a response sets the
+   // same few fields on every request of a connection.
+   auto at = _fields.lower_bound(name);
+   if (at != _fields.end() && !_fields.key_comp()(name, at->first)) {
+      at->second = value;
+   } else if (!_spareNodes.empty()) {
+      FieldMap::node_type node = std::move(_spareNodes.back());
+      _spareNodes.pop_back();
+      node.key() = name;
+      node.mapped() = value;
+      _fields.insert(at, std::move(node));
+   } else {
+      _fields.emplace_hint(at, name, value);
+   }
    FieldChanged(name);
 }
 
