@@ -253,8 +253,7 @@ void HttpConnectionImpl::InitClientCapabilities() {
    if (!_agentKnown || agent != _agent) {
       _agent = agent;
       _agentKnown = true;
-      _agentNonChunking = _svc->IsNonChunkingAgent(agent);
-      _agentNeedsLength = _svc->NeedsContentLength(agent);
+      _svc->ClassifyAgent(agent, _agentNonChunking, _agentNeedsLength);
    }
    if (_agentNonChunking) {
       _capabilities.understandsChunking = false;

@@ -212,6 +212,25 @@ bool HttpSvcImpl::NeedsContentLength(const std::string& agent) const {
    return _haveNeedsLength && std::regex_match(agent, _needsLength);
 }
 
+void HttpSvcImpl::ClassifyAgent(const std::string& agent, bool& nonChunking, bool& needsLength) {
+   {
+      std::lock_guard<std::mutex> lock(_agentMutex);
+      if (_lastAgentKnown && _lastAgent == agent) {
+         nonChunking = _lastAgentNonChunking;
+         needsLength = _lastAgentNeedsLength;
+         return;
+      }
+   }
+   // The expressions run outside the lock; two threads may both work out a new agent.
+   nonChunking = IsNonChunkingAgent(agent);
+   needsLength = NeedsContentLength(agent);
+   std::lock_guard<std::mutex> lock(_agentMutex);
+   _lastAgent = agent;
+   _lastAgentNonChunking = nonChunking;
+   _lastAgentNeedsLength = needsLength;
+   _lastAgentKnown = true;
+}
+
 void HttpSvcImpl::Start() {
    std::unique_lock<std::mutex> lock(_mutex);
    if (_listeners.empty()) throw InvalidStateException("ServerSocket not set");

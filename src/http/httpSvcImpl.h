@@ -119,6 +119,9 @@ public:
    // The compiled agent expressions; an empty expression matches nothing.
    bool IsNonChunkingAgent(const std::string& agent) const;
    bool NeedsContentLength(const std::string& agent) const;
+   // Both of the above, remembered for the last agent asked about: most clients of a
+   // server send the same agent on connection after connection.
+   void ClassifyAgent(const std::string& agent, bool& nonChunking, bool& needsLength);
 
    // The first pause after a failed accept and the longest one.
    static constexpr long long kFirstAcceptBackoff = 10000;
@@ -152,6 +155,11 @@ private:
    std::regex _needsLength;
    bool _haveNonChunking = false;
    bool _haveNeedsLength = false;
+   std::mutex _agentMutex;
+   bool _lastAgentKnown = false;
+   std::string _lastAgent;
+   bool _lastAgentNonChunking = false;
+   bool _lastAgentNeedsLength = false;
 
    std::mutex _mutex;
    Ref<System::ServerSocket> _socket;  // the first listener's, for ToString

@@ -208,6 +208,27 @@ TEST(HttpSvcConfigTest, BadFrameOptionsAndAgentExpressionsFallBack) {
    EXPECT_TRUE(dynamic_cast<HttpSvcImpl*>(svc.Get())->NeedsContentLength("Tool/1"));
 }
 
+// The answer remembered for the last agent must not leak to the next, different one.
+TEST(HttpSvcConfigTest, ClassifiedAgentsKeepTheirOwnAnswers) {
+   EnsurePool();
+   Ref<HttpSvc> svc;
+   CreateHttpSvc(nullptr, TestLogger().Get(), Settings({{"agentsNeedingContentLength", "Tool/.*"}}).Get(), svc);
+   auto* impl = dynamic_cast<HttpSvcImpl*>(svc.Get());
+   struct Case {
+      const char* agent;
+      bool nonChunking;
+      bool needsLength;
+   } cases[] = {{"Norvex-desktop/7.1", true, false}, {"Norvex-desktop/7.1", true, false},
+                {"Tool/2", false, true},             {"curl/8.0", false, false},
+                {"Norvex-desktop/7.1", true, false}, {"Tool/2", false, true}};
+   for (const Case& c : cases) {
+      bool nonChunking = !c.nonChunking, needsLength = !c.needsLength;
+      impl->ClassifyAgent(c.agent, nonChunking, needsLength);
+      EXPECT_EQ(nonChunking, c.nonChunking) << c.agent;
+      EXPECT_EQ(needsLength, c.needsLength) << c.agent;
+   }
+}
+
 TEST_F(HttpSvcTest, StartRefusesWithoutSocketOrHandlerAndDescribesItself) {
    Ref<HttpSvc> svc;
    CreateHttpSvc(nullptr, TestLogger().Get(), nullptr, svc);
