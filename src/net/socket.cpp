@@ -88,7 +88,21 @@ void SetNoDelay(Tcp::socket& socket) {
 
 Ref<BindingInfo> MakeBindingInfo(const Tcp::endpoint& endpoint) {
    boost::asio::ip::address address = endpoint.address();
-   return new InetBindingInfo(address.to_string(), endpoint.port(), address.is_v6());
+   if (address.is_v4()) {
+      // inet_ntop goes through sprintf, and every accepted connection names two ends.
+      char text[16];
+      char* end = text;
+      bool first = true;
+      for (unsigned int part : address.to_v4().to_bytes()) {
+         if (!first) *end++ = '.';
+         first = false;
+         if (part >= 100) *end++ = static_cast<char>('0' + part / 100);
+         if (part >= 10) *end++ = static_cast<char>('0' + part / 10 % 10);
+         *end++ = static_cast<char>('0' + part % 10);
+      }
+      return new InetBindingInfo(std::string(text, end), endpoint.port(), false);
+   }
+   return new InetBindingInfo(address.to_string(), endpoint.port(), true);
 }
 
 Ref<BindingInfo> MakeBindingInfo(const Local::endpoint& endpoint) {

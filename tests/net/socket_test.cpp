@@ -126,6 +126,18 @@ TEST_F(SocketTest, TcpEchoOverIPv4AndIPv6WithBindingInfo) {
    }
 }
 
+// IPv4 addresses are written out digit by digit: every width of each of the four parts.
+TEST(BindingInfoTest, AddressTextsMatchTheNumericForm) {
+   using boost::asio::ip::make_address;
+   for (const char* text : {"0.0.0.0", "255.255.255.255", "10.0.100.9", "1.20.3.101", "127.0.0.1",
+                            "99.100.199.200", "::1", "fe80::1:2", "::ffff:1.2.3.4"}) {
+      Ref<BindingInfo> info = MakeBindingInfo(Tcp::endpoint(make_address(text), 8080));
+      EXPECT_EQ(info->GetAddress(), text);
+      EXPECT_EQ(info->GetPort(), 8080);
+      EXPECT_EQ(dynamic_cast<InetBindingInfo*>(info.Get())->IsV6(), std::string(text).find(':') != std::string::npos);
+   }
+}
+
 TEST_F(SocketTest, UnixDomainEchoAndStaleSocketFile) {
    std::string path = ::testing::TempDir() + "pelmora_socket_test_" + std::to_string(::getpid());
    ::unlink(path.c_str());
