@@ -91,6 +91,9 @@ private:
    Ref<System::Stream> _stream;
    ResponseHeader _header;
    std::unique_ptr<CharBuffer> _buffer;
+   // The fixed buffer of the last response, kept by Reset for the next one on the connection.
+   std::unique_ptr<CharBuffer> _spareBuffer;
+   bool _bufferFixed = false;
    ResponseState _currState = RESPONSE_BUFFERING;
    bool _prepared = false;
    bool _headerSent = false;
@@ -121,9 +124,13 @@ void ResponseImpl::PrepareToWrite() {
    if (_needsContentLength) {
       long long max = _connection->GetMaxBufferedResponseBytes();
       _buffer.reset(new DynamicCharBuffer(max >= 0 ? static_cast<size_t>(max) : kUnlimitedBuffered, kPrependReserve));
+   } else if (_spareBuffer && _spareBuffer->Capacity() == _bufferSize + kTrailerRoom) {
+      _buffer = std::move(_spareBuffer);
+      _buffer->Clear();
    } else {
       _buffer.reset(new FixedCharBuffer(_bufferSize + kTrailerRoom, kPrependReserve));
    }
+   _bufferFixed = !_needsContentLength;
    std::string connection;
    if (!_header.GetField("Connection", connection)) _header.SetKeepAlive(capabilities.canKeepAlive);
    _prepared = true;
@@ -197,6 +204,7 @@ void ResponseImpl::MakeRoom() {
       _buffer->Flip();
       for (size_t n; (n = _buffer->Get(piece, sizeof piece)) > 0;) larger->Append(piece, n);
       _buffer = std::move(larger);
+      _bufferFixed = false;
       _bufferingWhole = true;
    }
 }
@@ -403,7 +411,9 @@ void ResponseImpl::SendContinue() {
 
 void ResponseImpl::Reset() {
    _header.ClearHeader();
+   if (_bufferFixed && _buffer) _spareBuffer = std::move(_buffer);
    _buffer.reset();
+   _bufferFixed = false;
    _currState = RESPONSE_BUFFERING;
    _prepared = false;
    _headerSent = false;

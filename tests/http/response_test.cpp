@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <cstdio>
+#include <cstring>
 #include <string>
 #include <thread>
 
@@ -79,6 +80,39 @@ TEST_F(ResponseTest, SmallBodyGoesOutWithContentLengthAtComplete) {
    EXPECT_EQ(WithoutDate(Received()),
              "HTTP/1.1 415 Unsuppored Media Type\r\nConnection: Keep-Alive\r\nContent-Length: 11\r\n"
              "Content-Type: text/plain\r\n\r\nhello world");
+}
+
+// Responses on one connection share a buffer: nothing of a chunked, a whole-buffered or
+// an abandoned answer may show in the next, nor may a buffer of the old size be used
+// after the size changed.
+TEST_F(ResponseTest, NextResponsesStartFromAnEmptyBuffer) {
+   std::string body(150, 'x');
+   auto next = [this](const char* text) {
+      _response->Reset();
+      _response->Write(text, static_cast<int>(std::strlen(text)));
+      _response->Complete();
+   };
+   _response->SetChunkedEncodingAllowed();
+   _response->Write(body.data(), static_cast<int>(body.size()));
+   _response->Complete();
+   next("one");
+   _response->Reset();
+   _response->Write(body.data(), static_cast<int>(body.size()));  // no chunking: kept whole
+   _response->Complete();
+   next("two");
+   _response->Reset();
+   _response->Write("dropped", 7);  // never completed
+   SetBufferSize(128);
+   next("three");
+   std::string wire = WithoutDate(Received());
+   std::string chunked = "HTTP/1.1 200 OK\r\nConnection: Keep-Alive\r\nTransfer-Encoding: chunked\r\n\r\n40\r\n" +
+                         body.substr(0, 64) + "\r\n40\r\n" + body.substr(64, 64) + "\r\n16\r\n" +
+                         body.substr(128) + "\r\n0\r\n\r\n";
+   auto sized = [](const std::string& text) {
+      return "HTTP/1.1 200 OK\r\nConnection: Keep-Alive\r\nContent-Length: " + std::to_string(text.size()) +
+             "\r\n\r\n" + text;
+   };
+   EXPECT_EQ(wire, chunked + sized("one") + sized(body) + sized("two") + sized("three"));
 }
 
 TEST_F(ResponseTest, BodyOutgrowingTheBufferGoesChunked) {
