@@ -1,5 +1,6 @@
 #include "pelmora/http/header.h"
 
+#include <charconv>
 #include <cstring>
 #include <ctime>
 #include <string_view>
@@ -143,21 +144,25 @@ bool Header::GetField(const std::string& name, std::string& value) const {
 }
 
 void Header::SetField(const std::string& name, const std::string& value) {
+   PutField(name, value);
+   FieldChanged(name);
+}
+
+void Header::PutField(std::string_view name, std::string_view value) {
    // One descent, and a node kept by ClearHeader when there is one: a response sets the
    // same few fields on every request of a connection.
    auto at = _fields.lower_bound(name);
    if (at != _fields.end() && !_fields.key_comp()(name, at->first)) {
-      at->second = value;
+      at->second.assign(value);
    } else if (!_spareNodes.empty()) {
       FieldMap::node_type node = std::move(_spareNodes.back());
       _spareNodes.pop_back();
-      node.key() = name;
-      node.mapped() = value;
+      node.key().assign(name);
+      node.mapped().assign(value);
       _fields.insert(at, std::move(node));
    } else {
-      _fields.emplace_hint(at, name, value);
+      _fields.emplace_hint(at, std::string(name), std::string(value));
    }
-   FieldChanged(name);
 }
 
 void Header::RemoveField(const std::string& name) {
@@ -352,7 +357,11 @@ void ResponseHeader::SetContentLength(long long length) {
    if (length < 0) {
       RemoveField(kContentLength);
    } else {
-      SetField(kContentLength, std::to_string(length));
+      // Stored directly: FieldChanged would parse back the number just written.
+      char digits[24];
+      char* end = std::to_chars(digits, digits + sizeof digits, length).ptr;
+      PutField(kContentLength, std::string_view(digits, static_cast<size_t>(end - digits)));
+      _contentLength = length;
    }
 }
 

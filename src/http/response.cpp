@@ -35,6 +35,9 @@ constexpr size_t kUnlimitedBuffered = size_t(1) << 40;
 
 const char kTerminalChunk[] = "0\r\n\r\n";
 
+// Too long for a short string: made once rather than for every response.
+const std::string kTransferEncoding = "Transfer-Encoding";
+
 enum ResponseState {
    RESPONSE_BUFFERING,              // header unsent, body collecting
    RESPONSE_ACCEPT_WRITE_CHUNKED,   // header sent, body going out in chunks
@@ -283,7 +286,7 @@ void ResponseImpl::Complete() {
    if (!_prepared) PrepareToWrite();
    switch (_currState) {
       case RESPONSE_BUFFERING:
-         _header.RemoveField("Transfer-Encoding");
+         _header.RemoveField(kTransferEncoding);
          // A preset length with no body written answers HEAD: it tells the length GET would send.
          _header.SetContentLength(_buffer->Filled() == 0 && _presetContentLength > 0
                                       ? _presetContentLength
@@ -319,7 +322,7 @@ void ResponseImpl::SendFile(int fd, long long offset, long long length) {
       return;
    }
    if (!_prepared) PrepareToWrite();
-   _header.RemoveField("Transfer-Encoding");
+   _header.RemoveField(kTransferEncoding);
    _header.SetContentLength(length);
    std::string head = _header.ToString();
    _stream->Write(head.data(), static_cast<int>(head.size()));
@@ -392,7 +395,7 @@ void ResponseImpl::SendError(const ResponseCode::Info& info, const std::string& 
       _bufferingWhole = false;
    }
    _presetContentLength = -1;
-   _header.RemoveField("Transfer-Encoding");
+   _header.RemoveField(kTransferEncoding);
    _header.SetResponseCode(info);
    _header.SetKeepAlive(false);
    _header.SetContentType("text/plain", "utf-8");

@@ -121,7 +121,9 @@ TEST(HeaderTest, ResponseTextHasStatusDateFieldsCookiesAndBlankLine) {
    header.SetContentType("text/xml", "utf-8");
    header.SetKeepAlive(false);
    header.SetCacheResponse(false);
+   header.SetField("Content-Length", "7");
    header.SetContentLength(42);
+   EXPECT_EQ(header.GetContentLength(), 42);
    Ref<Cookie> cookie;
    CreateCookie("s", "1", cookie);
    cookie->SetHttpOnly(true);
@@ -139,6 +141,7 @@ TEST(HeaderTest, ResponseTextHasStatusDateFieldsCookiesAndBlankLine) {
    header.SetCacheResponse(true);
    header.SetKeepAlive(true);
    header.SetContentLength(-1);
+   EXPECT_EQ(header.GetContentLength(), -1);
    header.SetContentType("text/plain");
    EXPECT_EQ(header.ToString(0),
              "HTTP/1.1 415 Unsuppored Media Type\r\nDate: Thu, 1 Jan 1970 00:00:00 GMT\r\n"

@@ -83,6 +83,8 @@ protected:
    void ParseFields(const char* begin, const char* end, bool setCookie);
    void ParseFieldLine(const char* begin, const char* end, bool setCookie);
    void StoreField(std::string_view name, std::string_view value, bool setCookie);
+   // Sets the field's value, replacing any, without FieldChanged.
+   void PutField(std::string_view name, std::string_view value);
    // Keeps the parsed "Content-Length" in step with the field.
    void FieldChanged(const std::string& name);
 
