@@ -22,10 +22,12 @@ const ResponseCode::Info kHeaderFieldsTooLarge = {431, "Request Header Fields To
 // or body) is caught by the request deadline.
 class WatchedStream : public virtual System::Stream, public virtual System::FileSender, public ObjectImpl {
 public:
-   WatchedStream(System::Stream* inner, HttpConnectionImpl* connection)
-       : _inner(inner), _sender(dynamic_cast<System::FileSender*>(inner)), _connection(connection) {}
+   WatchedStream(System::Stream* inner, HttpConnectionImpl* connection) : _inner(inner), _connection(connection) {}
 
-   bool CanSendFile() override { return _sender != nullptr && _sender->CanSendFile(); }
+   bool CanSendFile() override {
+      System::FileSender* sender = InnerSender();
+      return sender != nullptr && sender->CanSendFile();
+   }
    long long TrySendFile(int fd, long long offset, long long length) override {
       long long n = Sender()->TrySendFile(fd, offset, length);
       _written.fetch_add(n, std::memory_order_relaxed);
@@ -111,13 +113,24 @@ public:
    long long Written() const { return _written.load(std::memory_order_relaxed); }
 
 private:
+   // The cross cast costs as much as a small request; most connections never send a file.
+   System::FileSender* InnerSender() {
+      if (!_senderKnown.load(std::memory_order_acquire)) {
+         _sender.store(dynamic_cast<System::FileSender*>(_inner.Get()), std::memory_order_relaxed);
+         _senderKnown.store(true, std::memory_order_release);
+      }
+      return _sender.load(std::memory_order_relaxed);
+   }
    System::FileSender* Sender() {
-      if (_sender == nullptr) throw NotSupportedException();
-      return _sender;
+      System::FileSender* sender = InnerSender();
+      if (sender == nullptr) throw NotSupportedException();
+      return sender;
    }
 
    Ref<System::Stream> _inner;
-   System::FileSender* _sender;  // the inner stream's side, when it has one
+   // The inner stream's side, when it has one; found on first use.
+   std::atomic<System::FileSender*> _sender{nullptr};
+   std::atomic<bool> _senderKnown{false};
    std::atomic<long long> _written{0};
    HttpConnectionImpl* _connection;  // owns this stream
 };
