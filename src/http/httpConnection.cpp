@@ -156,7 +156,7 @@ const char* MethodName(int method) {
 
 HttpConnectionImpl::HttpConnectionImpl(HttpSvcImpl* svc, System::Stream* stream) : _svc(svc) {
    _stream = new WatchedStream(stream, this);
-   svc->GetLogger()->CreateLogger("HttpConnection", _logger);
+   _logger = svc->GetConnectionLogger();
    CreateRequest(_stream.Get(), _request);
    _request->SetMaxBodyBytes(svc->GetConfig().maxRequestBodyBytes);
    CreateResponse(this, _stream.Get(), _response);

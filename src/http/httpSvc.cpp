@@ -145,6 +145,7 @@ HttpSvcImpl::HttpSvcImpl(System::ServerSocket* socket, Logger* logger, Service::
       }()),
       _config(_logger.Get(), view),
       _socket(socket) {
+   _logger->CreateLogger("HttpConnection", _connectionLogger);
    if (socket != nullptr) _listeners.push_back(MakeListener(socket));
    CompileAgents(view);
 }

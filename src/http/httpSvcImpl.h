@@ -110,6 +110,8 @@ public:
 
    const HttpSvcConfig& GetConfig() const { return _config; }
    Service::Logger* GetLogger() const { return _logger.Get(); }
+   // The child logger every connection logs to, made once rather than per connection.
+   Service::Logger* GetConnectionLogger() const { return _connectionLogger.Get(); }
    bool IsRunning();
    // 0 stopped, 1 started, 2 stopping (Stop lets requests in progress finish).
    int GetOpState();
@@ -150,6 +152,7 @@ private:
    void CompileAgents(Service::Config::View* view);
 
    Ref<Service::Logger> _logger;
+   Ref<Service::Logger> _connectionLogger;
    HttpSvcConfig _config;
    std::regex _nonChunking;
    std::regex _needsLength;
