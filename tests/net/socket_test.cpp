@@ -131,7 +131,7 @@ TEST(BindingInfoTest, AddressTextsMatchTheNumericForm) {
    using boost::asio::ip::make_address;
    for (const char* text : {"0.0.0.0", "255.255.255.255", "10.0.100.9", "1.20.3.101", "127.0.0.1",
                             "99.100.199.200", "::1", "fe80::1:2", "::ffff:1.2.3.4"}) {
-      Ref<BindingInfo> info = MakeBindingInfo(Tcp::endpoint(make_address(text), 8080));
+      Ref<BindingInfo> info = MakeBindingInfo(boost::asio::ip::tcp::endpoint(make_address(text), 8080));
       EXPECT_EQ(info->GetAddress(), text);
       EXPECT_EQ(info->GetPort(), 8080);
       EXPECT_EQ(dynamic_cast<InetBindingInfo*>(info.Get())->IsV6(), std::string(text).find(':') != std::string::npos);
