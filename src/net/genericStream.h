@@ -86,7 +86,8 @@ protected:
          return -1;
       } else {
          boost::system::error_code error;
-         _io.non_blocking(true, error);
+         // Setting the mode is an ioctl each time; asking is not.
+         if (!_io.non_blocking()) _io.non_blocking(true, error);
          if (error) return -1;
          std::size_t bytes = _io.write_some(boost::asio::buffer(buffer, static_cast<std::size_t>(length)), error);
          return error ? -1 : static_cast<int>(bytes);

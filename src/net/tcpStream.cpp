@@ -28,7 +28,7 @@ std::shared_ptr<TcpStream::Sending> TcpStream::MakeSending(int fd, long long off
 
 bool TcpStream::Step(Sending& sending) {
    boost::system::error_code ignored;
-   _io.non_blocking(true, ignored);
+   if (!_io.non_blocking()) _io.non_blocking(true, ignored);
    while (sending.left > 0) {
       off_t offset = static_cast<off_t>(sending.offset);
       ssize_t n = ::sendfile(_io.native_handle(), sending.fd, &offset,
