@@ -3,6 +3,7 @@
 #include <atomic>
 #include <exception>
 #include <typeinfo>
+#include <utility>
 
 #include "pelmora/exception/panic.h"
 #include "pelmora/exception/throwable.h"
@@ -75,11 +76,24 @@ void WorkQueueImpl::EnqueueItem(WorkItem&& item) {
       if (first) _dispatched = 0;
       // A serial queue with its item running re-enters its level on completion.
       announce = first && !(_kind == KIND_SERIAL && _executing > 0);
+      if (announce && _level) {
+         ++_announcing;
+      } else if (!first && _kind == KIND_FAIR && _announcing > 0) {
+         ++_deferredPosts;
+         return;
+      }
    }
    if (!_level) {
       _pool->MainQueueNonEmpty();
    } else if (announce) {
       _level->QueueNonEmpty(this);
+      int32_t deferred = 0;
+      {
+         Synchronized lock(this);
+         // The last of overlapping announcements sends them.
+         if (--_announcing == 0) std::swap(deferred, _deferredPosts);
+      }
+      for (int32_t i = 0; i < deferred; ++i) _pool->PostWork();
    } else if (!first && _kind == KIND_FAIR) {
       _pool->PostWork();
    }

@@ -107,6 +107,11 @@ private:
    // Atomic, so that a fair queue counts a completion without its lock.
    std::atomic<int32_t> _executing{0};
    int32_t _dispatched = 0;  // since the queue last became non-empty
+   // While the enqueuer that made the queue non-empty is still entering it into its
+   // level, a handler posted for a later item would find nothing and be dropped; those
+   // posts wait here and the announcing enqueuer sends them once the queue is in.
+   int32_t _announcing = 0;
+   int32_t _deferredPosts = 0;
    std::atomic<int64_t> _completed{0};
    std::atomic<int64_t> _executionMicroseconds{0};
 };

@@ -97,5 +97,60 @@ TEST_F(PollSchedulerTest, FullPollingThreadsAreJoinedByAnother) {
    Finish();
 }
 
+// Jitters the polling threads around the points where they snapshot, poll and drain their
+// signal, so a wake-up that depends on lucky timing gets lost.
+class JitterControl : public TestThreadControl {
+public:
+   JitterControl() : TestThreadControl(true) {}
+   void DoPoll(const std::vector<std::pair<int, POLL_EVENT>>& pollables,
+               std::vector<int>& readyIndices) override {
+      Jitter();
+      TestThreadControl::DoPoll(pollables, readyIndices);
+      Jitter();
+   }
+   void SetPollableSignal(int writeFd) override {
+      Jitter();
+      TestThreadControl::SetPollableSignal(writeFd);
+   }
+   void ResetPollableSignal(int readFd) override {
+      Jitter();
+      TestThreadControl::ResetPollableSignal(readFd);
+   }
+
+private:
+   void Jitter() {
+      unsigned r = _seed.fetch_add(0x9e3779b9u) * 2654435761u >> 24;
+      if (r % 4 == 0) std::this_thread::sleep_for(std::chrono::microseconds(r % 200));
+      else if (r % 4 == 1) std::this_thread::yield();
+   }
+   std::atomic<unsigned> _seed{1};
+};
+
+// Callbacks of waits that fire together reach the default queue from several polling
+// threads at once; none may be left in the queue without a handler.
+TEST(PollSchedulerStress, EveryWaitFiresUnderJitter) {
+   for (int round = 0; round < 40; ++round) {
+      Ref<JitterControl> control = new JitterControl();
+      control->maxPollables = 4;
+      Ref<ThreadPoolFair> pool = MakePool({{"minThreads", "2"}}, control.Get());
+      constexpr int kWaits = 7;
+      int fds[kWaits][2];
+      std::atomic<int> fired{0};
+      std::vector<Ref<ScheduledItem>> waits(kWaits);
+      for (int i = 0; i < kWaits; ++i) {
+         ASSERT_EQ(0, pipe(fds[i]));
+         pool->ScheduleReadReady(fds[i][0], [&] { ++fired; }, waits[i]);
+      }
+      for (int i = 0; i < kWaits; ++i) ASSERT_EQ(1, write(fds[i][1], "x", 1));
+      bool all = WaitFor([&] { return fired.load() == kWaits; }, "every wait", std::chrono::milliseconds(3000));
+      ShutDown(pool.Get());
+      for (auto& pair : fds) {
+         close(pair[0]);
+         close(pair[1]);
+      }
+      ASSERT_TRUE(all) << "round " << round;
+   }
+}
+
 }  // namespace
 }  // namespace Pelmora::System
