@@ -290,7 +290,9 @@ TEST_F(HttpSvcTest, AccessLogIsOffUnlessAsked) {
    RawClient client(_port);
    client.Send("POST /big HTTP/1.1\r\nContent-Length: 200\r\n\r\n");
    EXPECT_NE(client.ReadResponse().find("413"), std::string::npos);
-   ASSERT_TRUE(WaitFor([&] { return log.Contains("POST /big 413 "); }, "access line of the refused request"));
+   // Each access line is written after its answer went out, so wait for both.
+   ASSERT_TRUE(WaitFor([&] { return log.Contains("POST /big 413 ") && log.Contains("GET /sdk/x?y=1 200 "); },
+                       "access lines of both requests"));
    std::string text = log.Text();
    size_t line = text.find("GET /sdk/x?y=1 200 ");
    ASSERT_NE(line, std::string::npos) << text;
