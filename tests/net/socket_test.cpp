@@ -149,6 +149,7 @@ TEST_F(SocketTest, UnixDomainEchoAndStaleSocketFile) {
    CreateLocalConnection(path, 5000000, client);
    acceptor.join();
    ASSERT_TRUE(serverSide);
+   EXPECT_EQ(nullptr, dynamic_cast<FileSender*>(serverSide.Get())) << "only TCP streams send files";
    std::thread echo([&] { Echo(serverSide.Get()); });
    Ref<BindingInfo> local;
    Ref<BindingInfo> peer;

@@ -51,24 +51,14 @@ const Certificates& GetCertificates() {
    return certificates;
 }
 
-int CountDescriptors() {
-   int count = 0;
-   DIR* dir = ::opendir("/proc/self/fd");
-   while (dirent* entry = ::readdir(dir)) {
-      if (entry->d_name[0] != '.') ++count;
-   }
-   ::closedir(dir);
-   return count;
-}
-
-// This process's descriptors on IPv4 TCP sockets bound to local `port`: the listener and
-// the server ends of its connections.
-int CountPortDescriptors(int port) {
+// This process's descriptors; with `port`, only those on IPv4 TCP sockets bound to local
+// `port`: the listener and the server ends of its connections.
+int CountDescriptors(int port = -1) {
    std::set<std::string> inodes;
    std::ifstream table("/proc/net/tcp");
    std::string line;
    std::getline(table, line);
-   while (std::getline(table, line)) {
+   while (port >= 0 && std::getline(table, line)) {
       std::istringstream fields(line);
       std::string slot, local, remote, state, queues, timer, retransmits, uid, timeout, inode;
       fields >> slot >> local >> remote >> state >> queues >> timer >> retransmits >> uid >> timeout >> inode;
@@ -83,7 +73,8 @@ int CountPortDescriptors(int port) {
       if (entry->d_name[0] == '.') continue;
       char target[64] = {};
       std::string path = std::string("/proc/self/fd/") + entry->d_name;
-      if (::readlink(path.c_str(), target, sizeof target - 1) > 0 && inodes.count(target) != 0) ++count;
+      if (port < 0 || (::readlink(path.c_str(), target, sizeof target - 1) > 0 && inodes.count(target) != 0))
+         ++count;
    }
    ::closedir(dir);
    return count;
@@ -95,17 +86,42 @@ protected:
       NetTesting::EnsurePool();
       const Certificates& certificates = GetCertificates();
       ASSERT_TRUE(certificates.ok) << "the openssl command could not make certificates";
-      SslServerOptions serverOptions;
-      serverOptions.certificateChainFile = certificates.Path("server.pem");
-      serverOptions.privateKeyFile = certificates.Path("server.key");
-      CreateSslServerContext(serverOptions, serverContext);
-      CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), serverContext.Get(), server);
-      Ref<BindingInfo> listening;
-      server->GetBindingInfo(listening);
-      port = listening->GetPort();
+      serverContext = ServerContext(kSslDefaultMinVersion);
+      port = Listen(ServerSocketOptions(), serverContext.Get(), server);
    }
    void TearDown() override {
       if (server) server->Close();
+   }
+
+   static Ref<SslContext> ServerContext(const char* minVersion) {
+      SslServerOptions options;
+      options.certificateChainFile = GetCertificates().Path("server.pem");
+      options.privateKeyFile = GetCertificates().Path("server.key");
+      options.minVersion = minVersion;
+      Ref<SslContext> context;
+      CreateSslServerContext(options, context);
+      return context;
+   }
+   // A TLS server socket on a free loopback port; returns the port.
+   static int Listen(const ServerSocketOptions& options, SslContext* context,
+                     Ref<ServerSocket>& out) {
+      CreateSslServerSocket("127.0.0.1", 0, options, context, out);
+      return PortOf(out.Get());
+   }
+   static int PortOf(ServerSocket* socket) {
+      Ref<BindingInfo> listening;
+      socket->GetBindingInfo(listening);
+      return listening->GetPort();
+   }
+   // The port of `stream`'s peer end, or of its own end.
+   static int PortOf(Stream* stream, bool peerEnd) {
+      Ref<BindingInfo> local;
+      Ref<BindingInfo> peer;
+      stream->GetBindingInfo(typeid(InetBindingInfo), local, peer);
+      return peerEnd ? peer->GetPort() : local->GetPort();
+   }
+   static Functor<void, ServerSocket*, Exception*, Stream*> Into(Completion& done) {
+      return [&done](ServerSocket*, Exception* error, Stream*) { done.Done(error, 0); };
    }
 
    Ref<SslContext> ClientContext(const char* caName) {
@@ -143,11 +159,7 @@ TEST_F(SslStreamTest, EchoSynchronousAndAsynchronousAfterVerifiedHandshake) {
       serverSide->Close();
    });
    EXPECT_NE(std::string::npos, stream->ToString().find("tls 127.0.0.1:")) << stream->ToString();
-   Ref<BindingInfo> local;
-   Ref<BindingInfo> peer;
-   stream->GetBindingInfo(typeid(InetBindingInfo), local, peer);
-   ASSERT_TRUE(peer);
-   EXPECT_EQ(port, peer->GetPort());
+   EXPECT_EQ(port, PortOf(stream.Get(), true));
 
    // 200 KiB both ways at once: reads and writes share the TLS engine.
    std::string big(200 * 1024, 0);
@@ -178,7 +190,7 @@ TEST_F(SslStreamTest, WrongCaFailsTheHandshakeOnBothSidesWithoutLeaks) {
    int before = CountDescriptors();
    for (int i = 0; i < 3; ++i) {
       Completion accepted;
-      server->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { accepted.Done(error, 0); });
+      server->AsyncAccept(Into(accepted));
       Ref<Stream> stream;
       try {
          CreateSslConnection("127.0.0.1", port, 10000000, wrong.Get(), stream);
@@ -202,7 +214,7 @@ TEST_F(SslStreamTest, WrongCaFailsTheHandshakeOnBothSidesWithoutLeaks) {
    Ref<SslContext> misnamed;
    CreateSslClientContext(options, misnamed);
    Completion accepted;
-   server->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { accepted.Done(error, 0); });
+   server->AsyncAccept(Into(accepted));
    Ref<Stream> stream;
    EXPECT_THROW(CreateSslConnection("127.0.0.1", port, 10000000, misnamed.Get(), stream), SslException);
    ASSERT_TRUE(accepted.WaitCount(1));
@@ -212,14 +224,12 @@ TEST_F(SslStreamTest, AStalledHandshakeTimesOutOnBothSides) {
    ServerSocketOptions options;
    options.handshakeTimeoutMicroseconds = 30000;
    Ref<ServerSocket> slow;
-   CreateSslServerSocket("127.0.0.1", 0, options, serverContext.Get(), slow);
-   Ref<BindingInfo> listening;
-   slow->GetBindingInfo(listening);
+   int slowPort = Listen(options, serverContext.Get(), slow);
    Completion accepted;
-   slow->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { accepted.Done(error, 0); });
+   slow->AsyncAccept(Into(accepted));
    // A plain TCP client that never speaks TLS.
    Ref<Stream> silent;
-   CreateTcpConnection("127.0.0.1", listening->GetPort(), 5000000, silent);
+   CreateTcpConnection("127.0.0.1", slowPort, 5000000, silent);
    ASSERT_TRUE(accepted.WaitCount(1));
    EXPECT_TRUE(accepted.Failed());
    EXPECT_EQ(0u, accepted.Error().rfind("SSL error: ", 0)) << accepted.Error();
@@ -228,35 +238,12 @@ TEST_F(SslStreamTest, AStalledHandshakeTimesOutOnBothSides) {
    // A TLS client against a plain server that never answers gives up at its time-out.
    Ref<ServerSocket> plain;
    CreateTcpServerSocket("127.0.0.1", 0, ServerSocketOptions(), plain);
-   plain->GetBindingInfo(listening);
    Ref<Stream> stream;
-   EXPECT_THROW(CreateSslConnection("127.0.0.1", listening->GetPort(), 30000,
+   EXPECT_THROW(CreateSslConnection("127.0.0.1", PortOf(plain.Get()), 30000,
                                     ClientContext("ca.pem").Get(), stream),
                 TimeoutException);
    plain->Close();
 }
-
-// Opens a TLS connection on another thread; the test waits for the server side first.
-class ClientThread {
-public:
-   ClientThread(int port, SslContext* context)
-       : _thread([this, port, context] {
-            try {
-               CreateSslConnection("127.0.0.1", port, 10000000, context, stream);
-            } catch (const Exception& e) {
-               failure = e.GetMessage();
-            }
-         }) {}
-   ~ClientThread() { Join(); }
-   void Join() {
-      if (_thread.joinable()) _thread.join();
-   }
-   Ref<Stream> stream;
-   std::string failure;
-
-private:
-   std::thread _thread;
-};
 
 TEST_F(SslStreamTest, ASilentClientHoldsUpOtherHandshakesOnlyAtTheLimit) {
    using Clock = std::chrono::steady_clock;
@@ -270,11 +257,9 @@ TEST_F(SslStreamTest, ASilentClientHoldsUpOtherHandshakesOnlyAtTheLimit) {
       long long timeout = limit == 1 ? 200000 : 3000000;
       options.handshakeTimeoutMicroseconds = timeout;
       Ref<ServerSocket> socket;
-      CreateSslServerSocket("127.0.0.1", 0, options, serverContext.Get(), socket);
-      Ref<BindingInfo> listening;
-      socket->GetBindingInfo(listening);
+      int socketPort = Listen(options, serverContext.Get(), socket);
       Ref<Stream> silent;
-      CreateTcpConnection("127.0.0.1", listening->GetPort(), 5000000, silent);
+      CreateTcpConnection("127.0.0.1", socketPort, 5000000, silent);
 
       auto started = Clock::now();
       Completion first;
@@ -283,7 +268,17 @@ TEST_F(SslStreamTest, ASilentClientHoldsUpOtherHandshakesOnlyAtTheLimit) {
          firstStream = stream;
          first.Done(error, 0);
       });
-      ClientThread tls(listening->GetPort(), client.Get());
+      // The client connects on another thread (joined when the scope ends, also on a failed
+      // assertion); the test waits for the server side first.
+      Ref<Stream> tlsStream;
+      std::string failure;
+      std::jthread tls([&] {
+         try {
+            CreateSslConnection("127.0.0.1", socketPort, 10000000, client.Get(), tlsStream);
+         } catch (const Exception& e) {
+            failure = e.GetMessage();
+         }
+      });
       ASSERT_TRUE(first.WaitCount(1));
       if (limit > 1) {
          EXPECT_FALSE(first.Failed()) << first.Error();
@@ -295,10 +290,10 @@ TEST_F(SslStreamTest, ASilentClientHoldsUpOtherHandshakesOnlyAtTheLimit) {
          socket->Accept(5000000, second);
          EXPECT_TRUE(second);
       }
-      tls.Join();
-      EXPECT_EQ("", tls.failure);
-      EXPECT_TRUE(tls.stream);
-      if (tls.stream) tls.stream->Close();
+      tls.join();
+      EXPECT_EQ("", failure);
+      EXPECT_TRUE(tlsStream);
+      if (tlsStream) tlsStream->Close();
       if (firstStream) firstStream->Close();
       silent->Close();
       socket->Close();
@@ -314,22 +309,15 @@ TEST_F(SslStreamTest, HandshakesFinishWithoutAWaitingAcceptAndQueue) {
    for (int i = 0; i < 3; ++i) {
       Ref<Stream> stream;
       CreateSslConnection("127.0.0.1", port, 5000000, client.Get(), stream);
-      Ref<BindingInfo> local;
-      Ref<BindingInfo> peer;
-      stream->GetBindingInfo(typeid(InetBindingInfo), local, peer);
-      clients[local->GetPort()] = stream;
+      clients[PortOf(stream.Get(), false)] = stream;
    }
    // Each queued stream is the server end of one of the clients, and works.
    for (int i = 0; i < 3; ++i) {
       Ref<Stream> accepted;
       server->Accept(5000000, accepted);
       ASSERT_TRUE(accepted);
-      Ref<BindingInfo> local;
-      Ref<BindingInfo> peer;
-      accepted->GetBindingInfo(typeid(InetBindingInfo), local, peer);
-      ASSERT_TRUE(peer);
-      auto match = clients.find(peer->GetPort());
-      ASSERT_NE(clients.end(), match) << peer->ToString();
+      auto match = clients.find(PortOf(accepted.Get(), true));
+      ASSERT_NE(clients.end(), match) << accepted->ToString();
       match->second->Write("x", 1);
       char byte = 0;
       EXPECT_EQ(1, accepted->Read(&byte, 1));
@@ -347,37 +335,32 @@ TEST_F(SslStreamTest, CloseEndsHandshakesAndDropsQueuedStreamsWithoutLeaks) {
    // with silent clients in handshake (the default time-out: far away).
    Ref<ServerSocket> queued;
    Ref<ServerSocket> waiting;
-   CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), serverContext.Get(), queued);
-   CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), serverContext.Get(), waiting);
-   Ref<BindingInfo> listening;
-   queued->GetBindingInfo(listening);
-   int queuedPort = listening->GetPort();
-   waiting->GetBindingInfo(listening);
-   int waitingPort = listening->GetPort();
+   int queuedPort = Listen(ServerSocketOptions(), serverContext.Get(), queued);
+   int waitingPort = Listen(ServerSocketOptions(), serverContext.Get(), waiting);
 
    Ref<Stream> none;
    EXPECT_THROW(queued->Accept(1000, none), TimeoutException);
    Ref<Stream> tls;
    CreateSslConnection("127.0.0.1", queuedPort, 5000000, client.Get(), tls);
-   waiting->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { outstanding.Done(error, 0); });
+   waiting->AsyncAccept(Into(outstanding));
    std::vector<Ref<Stream>> silent(4);
    for (size_t i = 0; i < silent.size(); ++i) {
       CreateTcpConnection("127.0.0.1", i % 2 == 0 ? queuedPort : waitingPort, 5000000, silent[i]);
    }
    // Listener, the TLS stream and two in handshake; listener and two in handshake.
    ASSERT_TRUE(NetTesting::WaitFor(
-       [&] { return CountPortDescriptors(queuedPort) == 4 && CountPortDescriptors(waitingPort) == 3; },
+       [&] { return CountDescriptors(queuedPort) == 4 && CountDescriptors(waitingPort) == 3; },
        "connections accepted"))
-       << CountPortDescriptors(queuedPort) << " " << CountPortDescriptors(waitingPort);
+       << CountDescriptors(queuedPort) << " " << CountDescriptors(waitingPort);
    EXPECT_EQ(0, outstanding.Count());
 
    queued->Close();
    waiting->Close();
    EXPECT_THROW(queued->AsyncAccept([](ServerSocket*, Exception*, Stream*) {}), InvalidStateException);
    EXPECT_TRUE(NetTesting::WaitFor(
-       [&] { return CountPortDescriptors(queuedPort) + CountPortDescriptors(waitingPort) == 0; },
+       [&] { return CountDescriptors(queuedPort) + CountDescriptors(waitingPort) == 0; },
        "descriptors released"))
-       << CountPortDescriptors(queuedPort) << " " << CountPortDescriptors(waitingPort);
+       << CountDescriptors(queuedPort) << " " << CountDescriptors(waitingPort);
    ASSERT_TRUE(outstanding.WaitCount(1));
    EXPECT_TRUE(outstanding.Failed());
    // The queued stream was closed, not just forgotten: its client hears the end.
@@ -419,21 +402,13 @@ TEST_F(SslStreamTest, BadSettingsAreSslExceptions) {
 
 TEST_F(SslStreamTest, MinimumVersionIsEnforced) {
    // A server that wants TLS 1.3 refuses a TLS 1.2 client, and takes a TLS 1.3 one.
-   const Certificates& certificates = GetCertificates();
-   SslServerOptions options;
-   options.certificateChainFile = certificates.Path("server.pem");
-   options.privateKeyFile = certificates.Path("server.key");
-   options.minVersion = "TLSv1.3";
-   Ref<SslContext> strict;
-   CreateSslServerContext(options, strict);
+   Ref<SslContext> strict = ServerContext("TLSv1.3");
    Ref<ServerSocket> strictServer;
-   CreateSslServerSocket("127.0.0.1", 0, ServerSocketOptions(), strict.Get(), strictServer);
-   Ref<BindingInfo> listening;
-   strictServer->GetBindingInfo(listening);
+   int strictPort = Listen(ServerSocketOptions(), strict.Get(), strictServer);
    for (const char* version : {"-tls1_2", "-tls1_3"}) {
       Completion accepted;
-      strictServer->AsyncAccept([&](ServerSocket*, Exception* error, Stream*) { accepted.Done(error, 0); });
-      std::string command = "openssl s_client -connect 127.0.0.1:" + std::to_string(listening->GetPort()) +
+      strictServer->AsyncAccept(Into(accepted));
+      std::string command = "openssl s_client -connect 127.0.0.1:" + std::to_string(strictPort) +
                             " " + version + " </dev/null >/dev/null 2>&1";
       int status = std::system(command.c_str());
       ASSERT_TRUE(accepted.WaitCount(1));

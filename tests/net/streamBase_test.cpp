@@ -31,8 +31,25 @@ protected:
    void CloseIo() override { ++closes; }
 };
 
-Functor<void, Stream*, Exception*, int> Into(Completion& done) {
+using ReadFun = Functor<void, Stream*, Exception*, int>;
+
+ReadFun Into(Completion& done) {
    return [&done](Stream*, Exception* error, int bytes) { done.Done(error, bytes); };
+}
+
+// Returns once another thread waits for `stream`'s read: a second waiter is refused then.
+bool AwaitReadWaiter(StreamBase* stream) {
+   return WaitFor(
+       [&] {
+          try {
+             stream->TimedWaitRead(0);
+          } catch (const InProgressException&) {
+             return true;
+          } catch (const TimeoutException&) {
+          }
+          return false;
+       },
+       "the waiter");
 }
 
 TEST(StreamBaseTest, OneOperationPerDirectionAndNoneAfterClose) {
@@ -72,23 +89,12 @@ TEST(StreamBaseTest, WaitingWithNothingOutstandingOrASecondWaiterFails) {
    }
    EXPECT_THROW(stream->TimedWaitWrite(1000), NotInProgressException);
 
-   stream->AsyncRead(nullptr, 4, Functor<void, Stream*, Exception*, int>());
+   stream->AsyncRead(nullptr, 4, ReadFun());
    std::atomic<int> result{-1};
    std::thread waiter([&] { result = stream->WaitRead(); });
-   ASSERT_TRUE(WaitFor(
-       [&] {
-          try {
-             stream->TimedWaitRead(0);
-          } catch (const InProgressException&) {
-             return true;  // the first waiter is in place
-          } catch (const TimeoutException&) {
-          }
-          return false;
-       },
-       "the first waiter"));
+   ASSERT_TRUE(AwaitReadWaiter(stream.Get()));
    // A new operation while someone waits is refused too.
-   EXPECT_THROW(stream->AsyncRead(nullptr, 4, Functor<void, Stream*, Exception*, int>()),
-                InProgressException);
+   EXPECT_THROW(stream->AsyncRead(nullptr, 4, ReadFun()), InProgressException);
    stream->CompleteIO(false, nullptr, 4);
    waiter.join();
    EXPECT_EQ(4, result.load());
@@ -110,7 +116,7 @@ TEST(StreamBaseTest, SynchronousWaitsReturnBytesOrRethrowAndTimeOut) {
    EXPECT_EQ(3, stream->TimedWaitWrite(5000000));
    completer.join();
 
-   stream->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+   stream->AsyncRead(nullptr, 8, ReadFun());
    SystemException reset(104, "Connection reset by peer");
    stream->CompleteIO(false, &reset, 0);
    try {
@@ -125,14 +131,14 @@ TEST(StreamBaseTest, SynchronousWaitsReturnBytesOrRethrowAndTimeOut) {
 
    // A failed wait with close-on-failure closes its direction.
    stream->SetCloseOnFailure(true);
-   stream->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+   stream->AsyncRead(nullptr, 8, ReadFun());
    EXPECT_THROW(stream->TimedWaitRead(0), TimeoutException);
    EXPECT_EQ(StreamBase::STATE_CLOSED, stream->GetState(false));
 }
 
 TEST(StreamBaseTest, CloseWakesAWaiterWithInvalidState) {
    Ref<ManualStream> stream = new ManualStream();
-   stream->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+   stream->AsyncRead(nullptr, 8, ReadFun());
    std::atomic<bool> invalid{false};
    std::thread waiter([&] {
       try {
@@ -141,17 +147,7 @@ TEST(StreamBaseTest, CloseWakesAWaiterWithInvalidState) {
          invalid = true;
       }
    });
-   ASSERT_TRUE(WaitFor(
-       [&] {
-          try {
-             stream->TimedWaitRead(0);
-          } catch (const InProgressException&) {
-             return true;
-          } catch (const TimeoutException&) {
-          }
-          return false;
-       },
-       "the waiter"));
+   ASSERT_TRUE(AwaitReadWaiter(stream.Get()));
    stream->Close();
    waiter.join();
    EXPECT_TRUE(invalid.load());
@@ -176,7 +172,7 @@ TEST(StreamBaseTest, CompletionMarksItsThreadAndIsConsumedAfterTheCallback) {
          writeSideWrongThread = true;
       }
       // The callback may start the next read of its direction.
-      s->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+      s->AsyncRead(nullptr, 8, ReadFun());
       restarted = true;
    });
    stream->CompleteIO(false, nullptr, 5);
@@ -215,14 +211,19 @@ TEST(StreamBaseTest, TickCountsAreTimeOutOverTickPlusOneAndReloadOnCompletion) {
    EXPECT_EQ(3, stream->GetTicksLeft(false));
    stream->SetWriteTimeout(0, Service::Logger::LOG_WARNING, nullptr);
    EXPECT_EQ(1, stream->GetTicksLeft(true));
+   // A negative time-out never counts down, never closes.
    stream->SetWriteTimeout(-1, Service::Logger::LOG_WARNING, nullptr);
    EXPECT_EQ(0, stream->GetTicksLeft(true));
+   stream->AsyncWrite("x", 1, Functor<void, Stream*, Exception*>());
+   for (int i = 0; i < 100; ++i) stream->TimeoutTick("d");
+   EXPECT_EQ(StreamBase::STATE_PENDING, stream->GetState(true));
+   stream->CompleteIO(true, nullptr, 1);
 
    // An idle direction is skipped by the tick.
    stream->TimeoutTick("d");
    EXPECT_EQ(3, stream->GetTicksLeft(false));
 
-   stream->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+   stream->AsyncRead(nullptr, 8, ReadFun());
    stream->TimeoutTick("d");
    stream->TimeoutTick("d");
    EXPECT_EQ(1, stream->GetTicksLeft(false));
@@ -237,7 +238,7 @@ TEST(StreamBaseTest, TimedOutDirectionLogsAndClosesWriteSideFirst) {
    Ref<ManualStream> stream = new ManualStream();
    stream->SetReadTimeout(0, Service::Logger::LOG_WARNING, "idle client");
    stream->SetWriteTimeout(4999999, Service::Logger::LOG_WARNING, "idle client");
-   stream->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+   stream->AsyncRead(nullptr, 8, ReadFun());
    stream->AsyncWrite("x", 1, Functor<void, Stream*, Exception*>());
    stream->TimeoutTick("conn 7");
    EXPECT_EQ(1, stream->closes.load());
@@ -249,7 +250,7 @@ TEST(StreamBaseTest, TimedOutDirectionLogsAndClosesWriteSideFirst) {
 
    Ref<ManualStream> quiet = new ManualStream();
    quiet->SetReadTimeout(5000000, Service::Logger::LOG_WARNING, "");
-   quiet->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+   quiet->AsyncRead(nullptr, 8, ReadFun());
    quiet->TimeoutTick("conn 8");
    EXPECT_EQ(0, quiet->closes.load());
    quiet->TimeoutTick("conn 8");
@@ -261,19 +262,10 @@ TEST(StreamBaseTest, TimedOutDirectionLogsAndClosesWriteSideFirst) {
    // A level the default logger does not want closes without a line.
    Ref<ManualStream> unlogged = new ManualStream();
    unlogged->SetReadTimeout(0, Service::Logger::LOG_TRIVIA, "trivial");
-   unlogged->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+   unlogged->AsyncRead(nullptr, 8, ReadFun());
    unlogged->TimeoutTick("conn 9");
    EXPECT_EQ(1, unlogged->closes.load());
    EXPECT_FALSE(log.Contains("trivial"));
-}
-
-TEST(StreamBaseTest, NegativeTimeOutNeverCloses) {
-   Ref<ManualStream> stream = new ManualStream();
-   stream->SetReadTimeout(-1, Service::Logger::LOG_WARNING, "never");
-   stream->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
-   for (int i = 0; i < 100; ++i) stream->TimeoutTick("never");
-   EXPECT_EQ(0, stream->closes.load());
-   EXPECT_EQ(StreamBase::STATE_PENDING, stream->GetState(false));
 }
 
 TEST(StreamBaseTest, TickerClosesOnThePoolAndForgetsReleasedStreams) {
@@ -289,7 +281,7 @@ TEST(StreamBaseTest, TickerClosesOnThePoolAndForgetsReleasedStreams) {
       EXPECT_EQ(before + 1, ticker.GetStreamCount());
       SetStreamTimeoutTick(10000);
       stream->SetReadTimeout(0, Service::Logger::LOG_WARNING, "ticker");
-      stream->AsyncRead(nullptr, 8, Functor<void, Stream*, Exception*, int>());
+      stream->AsyncRead(nullptr, 8, ReadFun());
       EXPECT_TRUE(WaitFor([&] { return stream->closes.load() == 1; }, "the ticker's close",
                           std::chrono::milliseconds(2000)));
       EXPECT_TRUE(log.Contains("ticker : Read timeout after approximately 10ms. Closing stream manual stream"))

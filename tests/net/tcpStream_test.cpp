@@ -97,6 +97,7 @@ TEST_F(TcpStreamTest, SendsWholeFilesRangesAndShortFilesExactly) {
    auto* sender = dynamic_cast<FileSender*>(pair.accepted.Get());
    ASSERT_NE(sender, nullptr) << typeid(*pair.accepted.Get()).name();
    ASSERT_TRUE(sender->CanSendFile());
+   EXPECT_NE(dynamic_cast<FileSender*>(pair.client.Get()), nullptr) << "client ends are TCP as well";
 
    std::string got;
    std::thread reader([&] { got = ReadAll(pair.client.Get(), _content.size()); });
@@ -180,24 +181,6 @@ TEST_F(TcpStreamTest, WriteTimeOutAndCloseEndASendToAStalledReader) {
       pair.server->Close();
    }
    SetStreamTimeoutTick(tick);
-}
-
-TEST_F(TcpStreamTest, OnlyPlainTcpStreamsSendFiles) {
-   Connected pair = Connect();
-   EXPECT_NE(dynamic_cast<FileSender*>(pair.client.Get()), nullptr) << "client ends are TCP as well";
-   std::string path = ::testing::TempDir() + "tcpstream_unix_" + std::to_string(::getpid());
-   ::unlink(path.c_str());
-   Ref<ServerSocket> local;
-   CreateLocalServerSocket(path, ServerSocketOptions(), local);
-   Ref<Stream> accepted;
-   std::thread acceptor([&] { local->Accept(5000000, accepted); });
-   Ref<Stream> client;
-   CreateLocalConnection(path, 5000000, client);
-   acceptor.join();
-   EXPECT_EQ(dynamic_cast<FileSender*>(accepted.Get()), nullptr);
-   local->Close();
-   ::unlink(path.c_str());
-   pair.server->Close();
 }
 
 }  // namespace
