@@ -39,6 +39,11 @@ std::string LogOf(const ScratchDir& dir) {
    return ReadText(dir / "app.log");
 }
 
+// Runs `scenario` in a child that must end with status 0 (a failed check ends it with 100).
+void InChild(const std::function<void()>& scenario) {
+   EXPECT_EXIT((scenario(), _exit(0)), testing::ExitedWithCode(0), "");
+}
+
 class TestObject : public ObjectImpl {};
 
 TEST(AppRegistryTest, RegistersLooksUpAndRefusesDuplicatesAndAbsentNames) {
@@ -71,71 +76,81 @@ TEST(AppTest, ExitBeforeInitAndStopBeforeThePoolDoNothing) {
    app->Stop();
    app->Exit();
    EXPECT_FALSE(app->GetThreadPool());
-   app->SetExitStatus(4);
-   EXPECT_EQ(app->GetExitStatus(), 4);
 }
 
 TEST(AppDeathTest, OnlyOneApplicationPerProcess) {
-   EXPECT_EXIT(
-       ([&] {
-          APP_CHILD_CHECK(GetApp() == nullptr);
-          CreateApp();
-          App* app = GetApp();
-          APP_CHILD_CHECK(app != nullptr);
-          try {
-             CreateApp();
-             APP_CHILD_CHECK(!"second CreateApp returned");
-          } catch (const AlreadyInitializedException& e) {
-             APP_CHILD_CHECK(e.GetMessage() == "Already initialized");
-          }
-          APP_CHILD_CHECK(GetApp() == app);
-          _exit(0);
-       })(),
-       testing::ExitedWithCode(0), "");
+   InChild([&] {
+      APP_CHILD_CHECK(GetApp() == nullptr);
+      CreateApp();
+      App* app = GetApp();
+      APP_CHILD_CHECK(app != nullptr);
+      try {
+         CreateApp();
+         APP_CHILD_CHECK(!"second CreateApp returned");
+      } catch (const AlreadyInitializedException& e) {
+         APP_CHILD_CHECK(e.GetMessage() == "Already initialized");
+      }
+      APP_CHILD_CHECK(GetApp() == app);
+   });
 }
 
 TEST(AppDeathTest, SetAppInfoRefusesNull) {
    EXPECT_DEATH(SetAppInfo(nullptr), "Assert Failed:.*info");
 }
 
-TEST(AppDeathTest, StartsFromAConfigurationFileInOrderAndExitsCleanly) {
+TEST(AppDeathTest, StartsFromAConfigurationFileRunsUntilStopAndExitsCleanly) {
    ScratchDir dir;
-   std::string config = WriteConfig(dir, "<workingDir>" + dir.Path() + "</workingDir>",
-                                    "<xml><doc><maxDepth>7</maxDepth></doc></xml>");
-   EXPECT_EXIT(
-       ([&] {
-          SetAppInfo(new AppInfo("tester", "1.2"));
-          InitApp(config);
-          App* app = GetApp();
-          APP_CHILD_CHECK(app->GetThreadPool().Get() == System::GetThreadPool());
-          APP_CHILD_CHECK(app->GetConfig());
-          APP_CHILD_CHECK(app->GetAppLogger().Get() == GetDefaultLogger());
-          APP_CHILD_CHECK(app->GetAppInfo()->GetName() == "tester");
-          APP_CHILD_CHECK(GetAlerts() != nullptr);
-          APP_CHILD_CHECK(Xml::GetDefaultDocLimits().maxDepth == 7);
-          char cwd[4096];
-          APP_CHILD_CHECK(getcwd(cwd, sizeof(cwd)) && std::string(cwd) == dir.Path());
-          std::string log = LogOf(dir);
-          // The start-up steps in their order.
-          const char* steps[] = {"Logging uses fast path: true",
-                                 "Handling tarn/lib logs with PelMora facilities",
-                                 "Initialized channel manager",
-                                 "Current working directory: ",
-                                 "Executable directory: ",
-                                 "Plugin base directory: "};
-          size_t at = 0;
-          for (const char* step : steps) {
-             size_t found = log.find(step, at);
-             if (found == std::string::npos) fprintf(stderr, "missing or out of order: %s\n", step);
-             APP_CHILD_CHECK(found != std::string::npos);
-             at = found;
-          }
-          app->Exit();
-          APP_CHILD_CHECK(GetApp() == nullptr);
-          APP_CHILD_CHECK(System::GetThreadPool()->IsShuttingDown());
-          _exit(0);
-       })(),
-       testing::ExitedWithCode(0), "");
+   std::string config = WriteConfig(
+       dir, "<workingDir>" + dir.Path() + "</workingDir>",
+       "<xml><doc><maxDepth>7</maxDepth></doc></xml><debug><prefetchSymbols>true</prefetchSymbols>"
+       "<resolveSymbols>false</resolveSymbols><exceptionBacktraceLogSize>12"
+       "</exceptionBacktraceLogSize></debug>");
+   InChild([&] {
+      SetAppInfo(new AppInfo("tester", "1.2"));
+      InitApp(config);
+      App* app = GetApp();
+      APP_CHILD_CHECK(app->GetThreadPool().Get() == System::GetThreadPool());
+      APP_CHILD_CHECK(app->GetConfig());
+      APP_CHILD_CHECK(app->GetAppLogger().Get() == GetDefaultLogger());
+      APP_CHILD_CHECK(app->GetAppInfo()->GetName() == "tester");
+      APP_CHILD_CHECK(GetAlerts() != nullptr);
+      APP_CHILD_CHECK(Xml::GetDefaultDocLimits().maxDepth == 7);
+      char cwd[4096];
+      APP_CHILD_CHECK(getcwd(cwd, sizeof(cwd)) && std::string(cwd) == dir.Path());
+      std::string log = LogOf(dir);
+      // The start-up steps in their order.
+      const char* steps[] = {"Logging uses fast path: true",
+                             "Handling tarn/lib logs with PelMora facilities",
+                             "Initialized channel manager",
+                             "Current working directory: ",
+                             "Executable directory: ",
+                             "Plugin base directory: "};
+      size_t at = 0;
+      for (const char* step : steps) {
+         size_t found = log.find(step, at);
+         if (found == std::string::npos) fprintf(stderr, "missing or out of order: %s\n", step);
+         APP_CHILD_CHECK(found != std::string::npos);
+         at = found;
+      }
+      DebugConfig& debug = GetDebugConfig();
+      APP_CHILD_CHECK(debug.GetPrefetchSymbols() && !debug.GetPrefetchCoreDumpLibs());
+      APP_CHILD_CHECK(!debug.GetResolveSymbols() && debug.GetExceptionBacktrace() == 12);
+
+      // Run lends the main thread to the pool until Stop.
+      std::atomic<bool> ranOnMain{false};
+      pthread_t mainThread = pthread_self();
+      app->GetThreadPool()->GetMainThreadWorkQueue()->Enqueue(System::Functor<>([&] {
+         ranOnMain = pthread_equal(pthread_self(), mainThread) != 0;
+         GetApp()->SetExitStatus(9);
+         GetApp()->Stop();
+      }));
+      app->Run();
+      APP_CHILD_CHECK(ranOnMain.load());
+      APP_CHILD_CHECK(app->GetExitStatus() == 9);
+      app->Exit();
+      APP_CHILD_CHECK(GetApp() == nullptr);
+      APP_CHILD_CHECK(System::GetThreadPool()->IsShuttingDown());
+   });
 }
 
 TEST(AppDeathTest, ConfigurationErrorsAreLoggedAndStartUpGoesOn) {
@@ -143,45 +158,18 @@ TEST(AppDeathTest, ConfigurationErrorsAreLoggedAndStartUpGoesOn) {
    std::string config = WriteConfig(
        dir, "<workingDir>" + dir.Path() + "/absent</workingDir><panicOnNewFailure>maybe"
             "</panicOnNewFailure>", "<handleTarnLogging>false</handleTarnLogging>");
-   EXPECT_EXIT(
-       ([&] {
-          InitApp(config);
-          std::string log = LogOf(dir);
-          APP_CHILD_CHECK(Contains(log, "Failed to set the current working directory: " +
-                                            dir.Path() + "/absent, No such file"));
-          APP_CHILD_CHECK(Contains(log, "Encountered errors while reading panicOnNewFailure "
-                                        "parameter: "));
-          APP_CHILD_CHECK(Contains(log, " assuming default value (false)"));
-          APP_CHILD_CHECK(Contains(log, "tarn/lib logs will NOT be handled by PelMora"));
-          APP_CHILD_CHECK(GetApp()->GetThreadPool());
-          GetApp()->Exit();
-          _exit(0);
-       })(),
-       testing::ExitedWithCode(0), "");
-}
-
-TEST(AppDeathTest, RunLendsTheMainThreadUntilStop) {
-   ScratchDir dir;
-   std::string config = WriteConfig(dir, "");
-   EXPECT_EXIT(
-       ([&] {
-          InitApp(config);
-          App* app = GetApp();
-          Ref<System::ThreadPool> pool = app->GetThreadPool();
-          std::atomic<bool> ranOnMain{false};
-          pthread_t mainThread = pthread_self();
-          pool->GetMainThreadWorkQueue()->Enqueue(System::Functor<>([&] {
-             ranOnMain = pthread_equal(pthread_self(), mainThread) != 0;
-             GetApp()->SetExitStatus(9);
-             GetApp()->Stop();
-          }));
-          app->Run();
-          APP_CHILD_CHECK(ranOnMain.load());
-          APP_CHILD_CHECK(app->GetExitStatus() == 9);
-          app->Exit();
-          _exit(0);
-       })(),
-       testing::ExitedWithCode(0), "");
+   InChild([&] {
+      InitApp(config);
+      std::string log = LogOf(dir);
+      APP_CHILD_CHECK(Contains(log, "Failed to set the current working directory: " +
+                                        dir.Path() + "/absent, No such file"));
+      APP_CHILD_CHECK(Contains(log, "Encountered errors while reading panicOnNewFailure "
+                                    "parameter: "));
+      APP_CHILD_CHECK(Contains(log, " assuming default value (false)"));
+      APP_CHILD_CHECK(Contains(log, "tarn/lib logs will NOT be handled by PelMora"));
+      APP_CHILD_CHECK(GetApp()->GetThreadPool());
+      GetApp()->Exit();
+   });
 }
 
 TEST(AppDeathTest, PlainExitWithTheAlertOnEndsWithStatusZeroAndAWarning) {
@@ -196,12 +184,7 @@ TEST(AppDeathTest, PlainExitWithTheAlertOnEndsWithStatusZeroAndAWarning) {
        })(),
        testing::ExitedWithCode(0),
        "WARNING: This application is not using QuickExit\\(\\). The exit code will be set to 0.");
-   EXPECT_EXIT(
-       ([&] {
-          InitApp(config);
-          QuickExit(7);
-       })(),
-       testing::ExitedWithCode(7), "");
+   EXPECT_EXIT((InitApp(config), QuickExit(7)), testing::ExitedWithCode(7), "");
 }
 
 TEST(AppDeathTest, ThreeArgumentInitAppPutsTheLogNameAndDirectoryBehindTheFile) {
@@ -209,34 +192,12 @@ TEST(AppDeathTest, ThreeArgumentInitAppPutsTheLogNameAndDirectoryBehindTheFile) 
    std::string config = dir / "plain.xml";
    WriteText(config, "<config><log><level>info</level></log><pelmora><daemon><handleSignals>"
                      "false</handleSignals></daemon></pelmora></config>");
-   EXPECT_EXIT(
-       ([&] {
-          InitApp("named.log", dir.Path(), config);
-          GetDefaultLogManager()->Flush();
-          APP_CHILD_CHECK(Contains(ReadText(dir / "named.log"), "Logging uses fast path"));
-          GetApp()->Exit();
-          _exit(0);
-       })(),
-       testing::ExitedWithCode(0), "");
-}
-
-TEST(AppDeathTest, DebugSettingsAreReadFromTheConfiguration) {
-   ScratchDir dir;
-   std::string config = WriteConfig(
-       dir, "", "<debug><prefetchSymbols>true</prefetchSymbols><resolveSymbols>false"
-                "</resolveSymbols><exceptionBacktraceLogSize>12</exceptionBacktraceLogSize>"
-                "</debug>");
-   EXPECT_EXIT(
-       ([&] {
-          InitApp(config);
-          DebugConfig& debug = GetDebugConfig();
-          APP_CHILD_CHECK(debug.GetPrefetchSymbols());
-          APP_CHILD_CHECK(!debug.GetPrefetchCoreDumpLibs());
-          APP_CHILD_CHECK(!debug.GetResolveSymbols());
-          APP_CHILD_CHECK(debug.GetExceptionBacktrace() == 12);
-          _exit(0);
-       })(),
-       testing::ExitedWithCode(0), "");
+   InChild([&] {
+      InitApp("named.log", dir.Path(), config);
+      GetDefaultLogManager()->Flush();
+      APP_CHILD_CHECK(Contains(ReadText(dir / "named.log"), "Logging uses fast path"));
+      GetApp()->Exit();
+   });
 }
 
 }  // namespace

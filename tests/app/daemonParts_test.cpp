@@ -94,16 +94,16 @@ protected:
       return child;
    }
 
-   // The child's wait status, or -1 when it did not end within the limit (it is killed).
-   int WaitExit(pid_t child) {
+   // The child's exit status; -1 when a signal ended it or it did not end within the
+   // limit (it is killed).
+   int ExitStatus(pid_t child) {
       int status = -1;
-      bool ended = WaitUntil([&] { return waitpid(child, &status, WNOHANG) == child; });
-      if (!ended) {
+      if (!WaitUntil([&] { return waitpid(child, &status, WNOHANG) == child; })) {
          kill(child, SIGKILL);
          waitpid(child, &status, 0);
          return -1;
       }
-      return status;
+      return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
    }
 
    std::string Log() { return ReadText(_dir / "daemon.log"); }
@@ -121,9 +121,7 @@ TEST_F(DaemonTest, SigtermStopsTheDaemonWithItsExitStatusAndTheManagerIsTold) {
    EXPECT_EQ(ReadText(pidFile), std::to_string(child) + "\n");
    kill(child, SIGTERM);
    ASSERT_TRUE(_notify.ReceiveUntil("STOPPING=1", _seen));
-   int status = WaitExit(child);
-   ASSERT_TRUE(WIFEXITED(status)) << status;
-   EXPECT_EQ(WEXITSTATUS(status), 5);
+   EXPECT_EQ(ExitStatus(child), 5);
    EXPECT_NE(access(pidFile.c_str(), F_OK), 0) << "the PID file stays after exit";
    EXPECT_TRUE(Contains(Log(), "Received signal 15, stopping"));
    EXPECT_TRUE(Contains(Log(), "Application exiting with status 5"));
@@ -133,9 +131,7 @@ TEST_F(DaemonTest, SigintStopsTooAndQuickExitKeepsTheStatus) {
    pid_t child = Start("", 3, "quick");
    ASSERT_TRUE(_notify.ReceiveUntil("READY=1", _seen));
    kill(child, SIGINT);
-   int status = WaitExit(child);
-   ASSERT_TRUE(WIFEXITED(status)) << status;
-   EXPECT_EQ(WEXITSTATUS(status), 3);
+   EXPECT_EQ(ExitStatus(child), 3);
 }
 
 TEST_F(DaemonTest, SighupReopensARenamedLogFile) {
@@ -148,9 +144,7 @@ TEST_F(DaemonTest, SighupReopensARenamedLogFile) {
    EXPECT_TRUE(WaitUntil([&] { return Contains(Log(), "Reopened log files"); }));
    EXPECT_FALSE(Contains(ReadText(_dir / "daemon.log.1"), "Reopened log files"));
    kill(child, SIGTERM);
-   int status = WaitExit(child);
-   ASSERT_TRUE(WIFEXITED(status)) << status;
-   EXPECT_EQ(WEXITSTATUS(status), 0);
+   EXPECT_EQ(ExitStatus(child), 0);
    EXPECT_TRUE(Contains(Log(), "Received signal 15"));
 }
 
@@ -167,8 +161,7 @@ TEST_F(DaemonTest, SighupAppliesTheLevelsOfAChangedConfiguration) {
    kill(child, SIGHUP);
    ASSERT_TRUE(WaitUntil([&] { return Contains(Log(), "Unrecognized log/memoryLevel 'bogus'"); }));
    kill(child, SIGTERM);
-   int status = WaitExit(child);
-   ASSERT_TRUE(WIFEXITED(status)) << status;
+   ASSERT_EQ(ExitStatus(child), 0);
    // Info lines from the reload on are no longer written.
    EXPECT_FALSE(Contains(Log(), "Reopened log files")) << Log();
    EXPECT_FALSE(Contains(Log(), "Received signal 15")) << Log();
@@ -188,8 +181,7 @@ TEST_F(DaemonTest, TheWatchdogIsFedAtHalfItsInterval) {
    // Five feeds at 20 ms take about 80-100 ms; a period of the whole interval would take 160.
    EXPECT_LT(elapsed, std::chrono::milliseconds(150));
    kill(child, SIGTERM);
-   int status = WaitExit(child);
-   EXPECT_TRUE(WIFEXITED(status)) << status;
+   EXPECT_EQ(ExitStatus(child), 0);
 }
 
 }  // namespace

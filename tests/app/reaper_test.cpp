@@ -8,6 +8,7 @@
 #include <chrono>
 
 #include "pelmora/service/daemon.h"
+#include "tests/support/appProcess.h"
 
 namespace Pelmora::Service {
 namespace {
@@ -54,13 +55,7 @@ TEST(ChildReaperTest, ARunningChildHasNoStatusUntilItEnds) {
    EXPECT_FALSE(reaper->WaitStatus(child, 30, status));
    close(pipeFds[1]);
    // Found by the idle poll alone.
-   auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-   bool reaped = false;
-   while (!reaped && std::chrono::steady_clock::now() < deadline) {
-      reaped = reaper->TakeStatus(child, status);
-      if (!reaped) usleep(1000);
-   }
-   ASSERT_TRUE(reaped);
+   ASSERT_TRUE(Testing::WaitUntil([&] { return reaper->TakeStatus(child, status); }));
    EXPECT_EQ(WEXITSTATUS(status), 0);
    EXPECT_EQ(GetChildReaper() != nullptr, true);
    reaper->Stop();
