@@ -103,7 +103,7 @@ TEST_F(ThreadPoolFairTest, SingleThreadedStartsTheFirstWorkerOnTheFirstItem) {
    Finish();
 }
 
-TEST_F(ThreadPoolFairTest, QueueIdsAreUnique) {
+TEST_F(ThreadPoolFairTest, QueueIdsAreUniqueAndItemsKnowTheirQueue) {
    Pool({{"minThreads", "1"}});
    Ref<WorkQueue> first;
    pool->CreateSerialWorkQueue(WorkQueueSpec("jobs", 5), first);
@@ -121,6 +121,15 @@ TEST_F(ThreadPoolFairTest, QueueIdsAreUnique) {
    EXPECT_EQ(5, found->GetPriority());
    pool->FindCompletionQueue(WorkQueueSpec("replies", 3), found);
    EXPECT_FALSE(found->IsSerial());
+
+   // Items know their queue; other threads see none.
+   std::atomic<WorkQueue*> seen{nullptr};
+   found->Enqueue([&] { seen = pool->GetCurrentWorkQueue(); });
+   WaitFor([&] { return seen.load() != nullptr; }, "the item");
+   EXPECT_EQ(found.Get(), seen.load());
+   EXPECT_EQ(nullptr, pool->GetCurrentWorkQueue());
+   pool->EnlistThisThread();
+   pool->DelistThisThread();
    Finish();
 }
 
@@ -133,20 +142,6 @@ TEST_F(ThreadPoolFairDeathTest, BadQueueSpecsAndForeignThreadsPanic) {
    EXPECT_DEATH(pool->CreateFairWorkQueue(WorkQueueSpec("x", 26), queue),
                 "spec.priority >= WorkQueueSpec::PL_BEGIN && spec.priority <= WorkQueueSpec::PL_END");
    EXPECT_DEATH(pool->DelistThisThread(), "tlsInfo != __null");
-}
-
-TEST_F(ThreadPoolFairTest, ItemsKnowTheirQueueAndThreadsCanEnlist) {
-   Pool({{"minThreads", "2"}});
-   Ref<WorkQueue> queue;
-   pool->CreateFairWorkQueue(WorkQueueSpec("mine", 5), queue);
-   std::atomic<WorkQueue*> seen{nullptr};
-   queue->Enqueue([&] { seen = pool->GetCurrentWorkQueue(); });
-   WaitFor([&] { return seen.load() != nullptr; }, "the item");
-   EXPECT_EQ(queue.Get(), seen.load());
-   EXPECT_EQ(nullptr, pool->GetCurrentWorkQueue());
-   pool->EnlistThisThread();
-   pool->DelistThisThread();
-   Finish();
 }
 
 // Two fair queues of one level share it: neither gets far ahead of the other, although
@@ -400,7 +395,7 @@ TEST_F(ThreadPoolFairTest, StatsAndTheProcessPool) {
    EXPECT_EQ(3, completed);
    EXPECT_TRUE(registered("/ThreadPool/Pelmora/WorkQueue/Stats/currentConcurrency", nullptr));
    EXPECT_TRUE(registered("/ThreadPool/Pelmora/WorkQueue/DefaultIOQueue/QueueSize", nullptr));
-   EXPECT_EQ(nullptr, GetThreadPool());
+   EXPECT_EQ(nullptr, GetThreadPool()) << "a new pool is not the process's pool";
    SetThreadPool(pool.Get());
    EXPECT_EQ(pool.Get(), GetThreadPool());
    SetThreadPool(nullptr);

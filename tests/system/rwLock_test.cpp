@@ -18,10 +18,6 @@ Ref<RWLock> NewRWLock(int mode = RWLockableObject::LOCK_MODE_DEFAULT) {
    return lock;
 }
 
-void SleepMillis(int milliseconds) {
-   std::this_thread::sleep_for(std::chrono::milliseconds(milliseconds));
-}
-
 // Returns once a writer waits for `lock`: a sleep would only make that likely.
 void AwaitWaitingWriter(RWLock* lock) {
    Pelmora::Testing::Watchdog watchdog("a writer to wait for the lock");
@@ -131,7 +127,8 @@ TEST_P(RWLockModeTest, AReaderRelocksWhileAWriterWaits) {
    });
    if (writerPriority) {
       while (!readerStarting) std::this_thread::yield();
-      SleepMillis(3);              // time for the reader to get in if it wrongly could
+      // Time for the reader to get in if it wrongly could.
+      std::this_thread::sleep_for(std::chrono::milliseconds(3));
       EXPECT_EQ(0, first.load());  // held back behind the writer
    } else {
       while (first == 0) std::this_thread::yield();
