@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <tuple>
+
 #include "src/authorize/authLog.h"
 #include "tests/support/authProviders.h"
 
@@ -43,38 +45,32 @@ protected:
    ACL acl;
 };
 
-TEST_F(AclTest, AUserEntryOutranksLaterGroupEntries) {
-   Add("alice", false, kRoleReadOnly, false);
-   Add("admins", true, kRoleAdmin, false);
-   auto [own, propagated] = Alice();
-   EXPECT_EQ(std::vector<int>{kRoleReadOnly}, own);
-   EXPECT_EQ(std::vector<int>{-99}, propagated);
-}
-
-TEST_F(AclTest, GroupEntriesBeforeTheUserEntryAddUpAndPropagateSeparately) {
-   Add("ops", true, kRoleView, true);
-   Add("admins", true, kRoleAnonymous, false);
-   Add("alice", false, kRoleReadOnly, false);
-   Add("bob", false, kRoleAdmin, true);
-   auto [own, propagated] = Alice();
-   EXPECT_EQ((std::vector<int>{kRoleView, kRoleAnonymous, kRoleReadOnly}), own);
-   EXPECT_EQ(std::vector<int>{kRoleView}, propagated);
-}
-
-TEST_F(AclTest, APropagatingUserEntryEndsTheWalk) {
-   Add("alice", false, kRoleView, true);
-   Add("ops", true, kRoleAdmin, true);
-   auto [own, propagated] = Alice();
-   EXPECT_EQ(std::vector<int>{kRoleView}, own);
-   EXPECT_EQ(std::vector<int>{kRoleView}, propagated);
-}
-
-TEST_F(AclTest, ANonPropagatingUserEntryStillLetsGroupsPropagate) {
-   Add("alice", false, kRoleView, false);
-   Add("ops", true, kRoleAdmin, true);
-   auto [own, propagated] = Alice();
-   EXPECT_EQ(std::vector<int>{kRoleView}, own);
-   EXPECT_EQ(std::vector<int>{kRoleAdmin}, propagated);
+// The walk in entry order for alice (in ops and admins): her own entry ends it, and only
+// propagating entries reach the propagated access.
+TEST_F(AclTest, TheWalkStopsAtTheUserEntryAndPropagatesSeparately) {
+   using Entry = std::tuple<const char*, bool, int, bool>;  // name, group, role, propagate
+   const struct {
+      const char* why;
+      std::vector<Entry> entries;
+      std::vector<int> own, propagated;
+   } cases[] = {
+       {"a user entry outranks later group entries",
+        {{"alice", false, kRoleReadOnly, false}, {"admins", true, kRoleAdmin, false}}, {kRoleReadOnly}, {-99}},
+       {"group entries before the user entry add up",
+        {{"ops", true, kRoleView, true}, {"admins", true, kRoleAnonymous, false},
+         {"alice", false, kRoleReadOnly, false}, {"bob", false, kRoleAdmin, true}},
+        {kRoleView, kRoleAnonymous, kRoleReadOnly}, {kRoleView}},
+       {"a propagating user entry ends the walk",
+        {{"alice", false, kRoleView, true}, {"ops", true, kRoleAdmin, true}}, {kRoleView}, {kRoleView}},
+       {"a non-propagating user entry still lets groups propagate",
+        {{"alice", false, kRoleView, false}, {"ops", true, kRoleAdmin, true}}, {kRoleView}, {kRoleAdmin}},
+   };
+   for (const auto& c : cases) {
+      SCOPED_TRACE(c.why);
+      acl = ACL();
+      for (const auto& [name, isGroup, roleId, propagate] : c.entries) Add(name, isGroup, roleId, propagate);
+      EXPECT_EQ(std::make_pair(c.own, c.propagated), Alice());
+   }
 }
 
 TEST_F(AclTest, UsersMatchByIdentityAndNoEntryMeansNoAnswer) {
@@ -86,6 +82,11 @@ TEST_F(AclTest, UsersMatchByIdentityAndNoEntryMeansNoAnswer) {
    EXPECT_FALSE(acl.GetAccessForUser("carol", carol.Get(), own, propagated));
    EXPECT_TRUE(own.IsNull());
    EXPECT_TRUE(propagated.IsNull());
+   // Without a token a user entry matches by name only.
+   acl = ACL();
+   Add("alice", false, kRoleView, false);
+   EXPECT_TRUE(acl.GetAccessForUser("alice", nullptr, own, propagated));
+   EXPECT_FALSE(acl.GetAccessForUser("alice2", nullptr, own, propagated));
 }
 
 TEST_F(AclTest, GroupResolutionIsLoggedAndAnUndecidableGroupDoesNotApply) {
@@ -128,13 +129,6 @@ TEST_F(AclTest, CreateACERefusesAMismatchedRoleOrAnEmptyName) {
    EXPECT_FALSE(ace->IsUser());
    EXPECT_EQ(USER_UNRESOLVED, ace->GetValidation());
    EXPECT_EQ((ACEData{"e1", "g", true, kRoleView, true}), ace->ToData("e1"));
-}
-
-TEST_F(AclTest, AUserEntryWithoutATokenMatchesByName) {
-   Add("alice", false, kRoleView, false);
-   Ref<EntityAccess> own, propagated;
-   EXPECT_TRUE(acl.GetAccessForUser("alice", nullptr, own, propagated));
-   EXPECT_FALSE(acl.GetAccessForUser("alice2", nullptr, own, propagated));
 }
 
 TEST_F(AclTest, AGroupEntryWithoutATokenPanics) {

@@ -194,17 +194,6 @@ TEST_F(ManagerTest, APropagatingEntryReachesEveryDescendantWithoutOneOfItsOwn) {
    EXPECT_FALSE(Can(alice.Get(), "root", kPrivilegeAnonymous));
 }
 
-TEST_F(ManagerTest, ANonPropagatingUserEntryBeatsALaterGroupAdminEntry) {
-   Start();
-   manager->CreateACE(E("host"), "alice", false, kRoleReadOnly, false);
-   manager->CreateACE(E("host"), "ops", true, kRoleAdmin, false);
-   Ref<Session> alice = Connect("alice");
-   Ref<Session> bob = Connect("bob");
-   EXPECT_EQ(std::vector<int>{kRoleReadOnly}, RolesOn(alice.Get(), "host"));
-   EXPECT_EQ(std::vector<int>{kRoleAdmin}, RolesOn(bob.Get(), "host"));
-   EXPECT_TRUE(RolesOn(alice.Get(), "vm").empty());
-}
-
 TEST_F(ManagerTest, ChecksRefuseUnknownSessionsAndUnknownPrivileges) {
    Start();
    Ref<Session> stranger(new TestSession());

@@ -7,23 +7,6 @@
 namespace Pelmora::Authorize {
 namespace {
 
-TEST(PrivSetTest, SetsTestsAndUnitesBitsUpToTheLastIndex) {
-   PrivSet a;
-   EXPECT_TRUE(a.IsEmpty());
-   a.Set(0);
-   a.Set(MAX_PRIVILEGES - 1);
-   PrivSet b;
-   b.Set(5);
-   a |= b;
-   EXPECT_TRUE(a.Test(0));
-   EXPECT_TRUE(a.Test(5));
-   EXPECT_TRUE(a.Test(MAX_PRIVILEGES - 1));
-   EXPECT_FALSE(a.Test(1));
-   EXPECT_EQ(3u, a.Count());
-   a.Clear(5);
-   EXPECT_FALSE(a.Test(5));
-}
-
 TEST(PrivSetDeathTest, AnIndexPastTheLastPanics) {
    PrivSet set;
    EXPECT_DEATH(set.Set(MAX_PRIVILEGES), "Assert Failed: \"index < MAX_PRIVILEGES\"");

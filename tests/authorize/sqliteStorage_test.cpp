@@ -42,12 +42,18 @@ protected:
       writes(tx.Get());
       tx->Commit();
    }
-   // Runs `sql` on its own connection.
-   void Sql(const std::string& sql) {
+   // Runs `sql` on its own connection; the first column of its first row, if any.
+   std::string Sql(const std::string& sql) {
       sqlite3* db = nullptr;
-      ASSERT_EQ(SQLITE_OK, sqlite3_open(path.c_str(), &db));
-      EXPECT_EQ(SQLITE_OK, sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr)) << sqlite3_errmsg(db);
+      std::string first;
+      EXPECT_EQ(SQLITE_OK, sqlite3_open(path.c_str(), &db));
+      auto keep = [](void* out, int, char** values, char**) {
+         if (static_cast<std::string*>(out)->empty() && values[0]) *static_cast<std::string*>(out) = values[0];
+         return 0;
+      };
+      EXPECT_EQ(SQLITE_OK, sqlite3_exec(db, sql.c_str(), keep, &first, nullptr)) << sqlite3_errmsg(db);
       sqlite3_close(db);
+      return first;
    }
 
    std::string dir;
@@ -114,19 +120,9 @@ TEST_F(SqliteStorageTest, UncommittedWritesAreRolledBack) {
 
 TEST_F(SqliteStorageTest, TheSchemaIsVersionedAndANewerOneIsRefused) {
    Open();
-   sqlite3* db = nullptr;
-   ASSERT_EQ(SQLITE_OK, sqlite3_open(path.c_str(), &db));
-   sqlite3_stmt* stmt = nullptr;
-   ASSERT_EQ(SQLITE_OK, sqlite3_prepare_v2(db, "SELECT version FROM schema_version", -1, &stmt, nullptr));
-   ASSERT_EQ(SQLITE_ROW, sqlite3_step(stmt));
-   EXPECT_EQ(kSqliteSchemaVersion, sqlite3_column_int(stmt, 0));
-   EXPECT_EQ(SQLITE_DONE, sqlite3_step(stmt));
-   sqlite3_finalize(stmt);
-   ASSERT_EQ(SQLITE_OK, sqlite3_prepare_v2(db, "PRAGMA journal_mode", -1, &stmt, nullptr));
-   ASSERT_EQ(SQLITE_ROW, sqlite3_step(stmt));
-   EXPECT_STREQ("wal", reinterpret_cast<const char*>(sqlite3_column_text(stmt, 0)));
-   sqlite3_finalize(stmt);
-   sqlite3_close(db);
+   EXPECT_EQ(std::to_string(kSqliteSchemaVersion), Sql("SELECT version FROM schema_version"));
+   EXPECT_EQ("1", Sql("SELECT count(*) FROM schema_version"));
+   EXPECT_EQ("wal", Sql("PRAGMA journal_mode"));
 
    Sql("UPDATE schema_version SET version = " + std::to_string(kSqliteSchemaVersion + 1));
    EXPECT_THROW(Open(), AuthStorageException);
