@@ -1,4 +1,5 @@
-// The escaping tables and the scan that skips the byte after each replaced byte.
+// The scan that skips the byte after each replaced byte; what each table escapes is checked
+// through the canonicaliser against libxml2.
 
 #include "src/c14n/escape.h"
 
@@ -26,23 +27,9 @@ std::string Attribute(const std::string& value) {
    return out;
 }
 
-TEST(EscapeTest, TextTableEscapesMarkupAndCarriageReturnOnly) {
-   EXPECT_EQ("a&lt;b", Text("a<b"));
-   EXPECT_EQ("x &amp; y &gt; z&#xD;", Text("x & y > z\r"));
-   EXPECT_EQ("\"q\" 'a'\t\n", Text("\"q\" 'a'\t\n"));
-   EXPECT_EQ("\xc3\xa9\xe2\x82\xac", Text("\xc3\xa9\xe2\x82\xac"));
-   EXPECT_EQ("", Text(""));
-}
-
-TEST(EscapeTest, AttributeTableAlsoEscapesQuoteWhitespaceAndGreaterThan) {
-   EXPECT_EQ("&lt;a&gt; &amp; &quot;b&quot; &#x9;c &#xA;d &#xD;e 'f'", Attribute("<a> & \"b\" \tc \nd \re 'f'"));
-}
-
 TEST(EscapeTest, ByteAfterAReplacedByteIsWrittenUnexamined) {
-   EXPECT_EQ("a&lt;<b", Text("a<<b"));
    EXPECT_EQ("&lt;<&lt;<", Text("<<<<"));
    EXPECT_EQ("&lt;<&lt;", Text("<<<"));
-   EXPECT_EQ("&#xD;\n", Attribute("\r\n"));
    EXPECT_EQ("&amp;\"&quot;", Attribute("&\"\""));
    // A special byte at the very end still ends the run correctly.
    EXPECT_EQ("ab&gt;", Text("ab>"));
