@@ -1,5 +1,5 @@
-// Configuration files: the backend's rules, gzip, size limits, properties files, change
-// detection, and crash safety of writing.
+// Configuration files: the backend's rules, gzip (multi-member streams are the core reader's
+// to test), size limits, properties files, change detection, and crash safety of writing.
 
 #include <signal.h>
 #include <sys/stat.h>
@@ -152,16 +152,6 @@ TEST_F(ConfigFileTest, DamagedGzipGivesZlibTexts) {
    EXPECT_EQ(loadError(good.substr(0, good.size() / 2)), "Buffer error : " + gz);
    EXPECT_EQ(loadError("not gzip at all"), "Data error : " + gz);
    EXPECT_EQ(loadError(good), "no exception");
-}
-
-TEST_F(ConfigFileTest, GzipMembersReadAsOneStream) {
-   WriteThrough(Path("1.xml"), kConfigFlagGzip, "<config><a>1</a>");
-   WriteThrough(Path("2.xml"), kConfigFlagGzip, "<b>2</b></config>");
-   WriteFile(Path("joined.xml.gz"), ReadFile(Path("1.xml.gz")) + ReadFile(Path("2.xml.gz")));
-   Ref<Config> config;
-   CreateXmlFileConfig(Path("joined.xml"), -1, kConfigFlagGzip, config);
-   EXPECT_EQ(Text(config.Get(), "a"), "1");
-   EXPECT_EQ(Text(config.Get(), "b"), "2");
 }
 
 TEST_F(ConfigFileTest, SizeLimitHoldsForReadingAndWriting) {
