@@ -25,10 +25,8 @@ TEST(ExceptionTest, ConstructorsBuildTheirMessages) {
    EXPECT_STREQ("Number range exception", NumberRangeException().what());
    EXPECT_STREQ("Resource is already in use: x", ResourceInUseException("x").what());
    EXPECT_STREQ("File Format Exception: x", FileFormatException("x").what());
-   FileIONoSpaceException full("Write failed", "/var/log/a", "second");
-   EXPECT_STREQ("Write failed : /var/log/a", full.what());
-   EXPECT_EQ("/var/log/a", full.GetPath());
-   EXPECT_EQ("second", full.GetSecondText());
+   EXPECT_STREQ("Write failed : /var/log/a",
+                FileIONoSpaceException("Write failed", "/var/log/a", "second").what());
 }
 
 // `catch (const Exception&)` is the documented way to catch whatever the library throws;
