@@ -117,7 +117,6 @@ TEST(JournalEntryTest, PrintEntryKeepsOneLine) {
 TEST(JournalHeaderTest, LayoutAndLength) {
    JrnlHeader empty(1, 2, 3, "id");
    std::string bytes = HeaderBytes(empty);
-   EXPECT_EQ(bytes.size(), 21u + 2u);
    EXPECT_EQ(bytes, U32(1) + U32(2) + U32(3) + U32(0) + U32(3) + std::string("id\0", 3));
    JrnlHeader withData(kJrnlHeaderMagic, kJrnlKindFileOps, 9, "j", std::string("\0d", 2));
    bytes = HeaderBytes(withData);
