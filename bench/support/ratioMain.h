@@ -18,7 +18,11 @@ class RatioReporter : public benchmark::ConsoleReporter {
 public:
    void ReportRuns(const std::vector<Run>& runs) override {
       for (const Run& run : runs) {
-         if (run.run_type == Run::RT_Iteration) _nanos[run.benchmark_name()] = run.GetAdjustedRealTime();
+         if (run.run_type != Run::RT_Iteration) continue;
+         _nanos[run.benchmark_name()] = run.GetAdjustedRealTime();
+         for (const auto& [name, counter] : run.counters) {
+            _counters[name][run.benchmark_name()] = counter.value;
+         }
       }
       ConsoleReporter::ReportRuns(runs);
    }
@@ -33,8 +37,22 @@ public:
       }
    }
 
+   // As PrintRatios, for a counter the benchmarks set (a cost per item: below 1 is cheaper).
+   void PrintCounterRatios(const std::string& counter,
+                           const std::vector<std::pair<std::string, std::string>>& pairs) {
+      const std::map<std::string, double>& values = _counters[counter];
+      std::printf("\nratios of %s (ours / peer; below 1.00 is cheaper):\n", counter.c_str());
+      for (const auto& [ours, peer] : pairs) {
+         auto a = values.find(ours);
+         auto b = values.find(peer);
+         if (a == values.end() || b == values.end() || b->second == 0) continue;
+         std::printf("  %-40s vs %-32s %6.2fx\n", ours.c_str(), peer.c_str(), a->second / b->second);
+      }
+   }
+
 private:
    std::map<std::string, double> _nanos;
+   std::map<std::string, std::map<std::string, double>> _counters;
 };
 
 inline int RunWithRatios(int argc, char** argv,
@@ -44,6 +62,20 @@ inline int RunWithRatios(int argc, char** argv,
    RatioReporter reporter;
    benchmark::RunSpecifiedBenchmarks(&reporter);
    reporter.PrintRatios(pairs);
+   benchmark::Shutdown();
+   return 0;
+}
+
+// As above, and the same pairs compared by each of `counters` as well.
+inline int RunWithRatios(int argc, char** argv,
+                         const std::vector<std::pair<std::string, std::string>>& pairs,
+                         const std::vector<std::string>& counters) {
+   std::thread([] {}).join();
+   benchmark::Initialize(&argc, argv);
+   RatioReporter reporter;
+   benchmark::RunSpecifiedBenchmarks(&reporter);
+   reporter.PrintRatios(pairs);
+   for (const std::string& counter : counters) reporter.PrintCounterRatios(counter, pairs);
    benchmark::Shutdown();
    return 0;
 }
