@@ -448,7 +448,8 @@ private:
 };
 
 LogManagerImpl::LogManagerImpl()
-   : _defaultLog(Logger::LOG_INFO * 2 - 1), _defaultMem(Logger::LOG_VERBOSE * 2 - 1) {}
+   : System::LockableObjectImpl(new LogManagerMutex()),
+     _defaultLog(Logger::LOG_INFO * 2 - 1), _defaultMem(Logger::LOG_VERBOSE * 2 - 1) {}
 
 void CreateLogManager(Ref<LogManager>& out) { out = new LogManagerImpl(); }
 

@@ -1,6 +1,7 @@
 #pragma once
 // The logging implementation classes shared by the logging units.
 
+#include <pthread.h>
 #include <sys/types.h>
 
 #include <atomic>
@@ -12,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include "pelmora/exception/panic.h"
 #include "pelmora/object/containers.h"
 #include "pelmora/service/logWriters.h"
 #include "src/internal/report.h"
@@ -60,6 +62,30 @@ public:
 private:
    static constexpr uint32_t kFree = 0, kLocked = 1, kContended = 2;
    std::atomic<uint32_t> _state{kFree};
+};
+
+// The log manager's mutex: the library's owner-checked Mutex over a LogWriterMutex, so
+// that a report child takes it over, as it does the writers' locks, when a thread that
+// is not running there held it at fork time.
+class LogManagerMutex final : public virtual System::Mutex, public ObjectImpl {
+public:
+   void Lock() PELMORA_ACQUIRE() override PELMORA_NO_THREAD_SAFETY_ANALYSIS {
+      PELMORA_VERIFY(!IsLocked());
+      _word.lock();
+      _owner.store(pthread_self(), std::memory_order_relaxed);
+   }
+   void Unlock() PELMORA_RELEASE() override PELMORA_NO_THREAD_SAFETY_ANALYSIS {
+      PELMORA_VERIFY(IsLocked());
+      _owner.store(0, std::memory_order_relaxed);
+      _word.unlock();
+   }
+   bool IsLocked() const override {
+      return _owner.load(std::memory_order_relaxed) == pthread_self();
+   }
+
+private:
+   LogWriterMutex _word;
+   std::atomic<pthread_t> _owner{0};
 };
 
 // A writer over a target Writer, filtered by a mask; its mutex serialises the target

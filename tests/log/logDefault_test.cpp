@@ -95,16 +95,20 @@ void WaitFor(const std::atomic<bool>& flag) {
    while (!flag.load() && std::chrono::steady_clock::now() < end) std::this_thread::yield();
 }
 
-// Panics while another thread, stopped for good, holds the default output's lock or one
-// of its writers' locks. The report time-out is short: a report child that waits for the
-// lock is killed by then and the report is cut short, without the recent lines.
-void PanicWithALogLockHeld(bool writerLock) {
+// The lock another thread holds, stopped for good, when the process panics.
+enum class HeldLock { kOutput, kWriter, kManager };
+
+// Panics while another thread, stopped for good, holds the default output's lock, one of
+// its writers' locks or its manager's lock. The report time-out is short: a report child
+// that waits for the lock is killed by then and the report is cut short, without the
+// recent lines.
+void PanicWithALogLockHeld(HeldLock which) {
    SetPanicMayFork(true);
    Internal::SetPanicReportTimeout(std::chrono::milliseconds(1500));
    PELMORA_LOG_VERBOSE(GetDefaultLogger(), "recent line %1", 9);
    LogOutput* output = GetDefaultLogger()->GetLogOutput();
    std::atomic<bool> held{false};
-   if (writerLock) {
+   if (which == HeldLock::kWriter) {
       Ref<StderrStoppingWriter> target = new StderrStoppingWriter();
       Ref<LogWriter> writer;
       CreateLogWriter("stopping", target.Get(), "trivia", writer);
@@ -112,8 +116,12 @@ void PanicWithALogLockHeld(bool writerLock) {
       std::thread([writer] { writer->Flush(); }).detach();
       WaitFor(target->stopped);
    } else {
-      std::thread([&] {
-         output->RecursiveWriteLock();
+      std::thread([&, which] {
+         if (which == HeldLock::kOutput) {
+            output->RecursiveWriteLock();
+         } else {
+            GetDefaultLogManager()->Lock();
+         }
          held.store(true);
          for (;;) pause();
       }).detach();
@@ -129,10 +137,10 @@ TEST(LogMemoryDeathTest, PanicReportIsWholeAndQuickWhileAnotherThreadHoldsALogLo
        "Panic: Assert Failed: \"1 \\+ 1 == 3\".*"
        "----- Recent log lines \\(Assert Failed: .*recent line 9\n.*"
        "----- End of recent log lines -----";
-   for (bool writerLock : {false, true}) {
+   for (HeldLock which : {HeldLock::kOutput, HeldLock::kWriter, HeldLock::kManager}) {
       auto start = std::chrono::steady_clock::now();
-      EXPECT_DEATH(PanicWithALogLockHeld(writerLock), whole) << "writer lock " << writerLock;
+      EXPECT_DEATH(PanicWithALogLockHeld(which), whole) << "lock " << static_cast<int>(which);
       EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(1500))
-          << "writer lock " << writerLock;
+          << "lock " << static_cast<int>(which);
    }
 }
