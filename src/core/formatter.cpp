@@ -289,28 +289,129 @@ void PrintFormatter::FormatThrowable(Writer* writer, const FormatValue& value, c
    WriteAll(writer, text.data(), text.size());
 }
 
-void MessageFormatter::PrintArgs(Writer* writer, const char* format, const PrintFormatter* args,
-                                 int count) {
-   size_t index = 0;
+namespace {
+
+// Hands each piece to the writer as it comes.
+class DirectPieces {
+public:
+   explicit DirectPieces(Writer* writer) : _writer(writer) {}
+   void Append(const char* data, size_t length) { WriteAll(_writer, data, length); }
+   // The writer, with everything appended so far written to it.
+   Writer* GetWriter() { return _writer; }
+
+private:
+   Writer* _writer;
+};
+
+// Gathers pieces on the stack; the writer sees them when the buffer fills, before an
+// argument writes itself, and at the end.
+class JoinedPieces {
+public:
+   explicit JoinedPieces(Writer* writer) : _writer(writer) {}
+   void Append(const char* data, size_t length) {
+      if (length > sizeof(_data) - _used) {
+         Drain();
+         if (length > sizeof(_data)) return WriteAll(_writer, data, length);
+      }
+      std::memcpy(_data + _used, data, length);
+      _used += length;
+   }
+   // Room for at least `length` bytes; Commit says where the bytes written there end.
+   char* Room(size_t length) {
+      if (length > sizeof(_data) - _used) Drain();
+      return _data + _used;
+   }
+   void Commit(const char* end) { _used = static_cast<size_t>(end - _data); }
+   void Drain() {
+      if (_used == 0) return;
+      size_t used = _used;
+      _used = 0;
+      _writer->Write(_data, static_cast<int>(used));
+   }
+   Writer* GetWriter() {
+      Drain();
+      return _writer;
+   }
+
+private:
+   Writer* _writer;
+   size_t _used = 0;
+   char _data[256];
+};
+
+template <class T>
+void AppendDecimal(JoinedPieces& pieces, T value) {
+   char* room = pieces.Room(kIntBuffer);
+   pieces.Commit(std::to_chars(room, room + kIntBuffer, value).ptr);
+}
+
+// The placeholder walk: literal runs go to `pieces`, each argument to `argument`.
+template <class Pieces, class Argument>
+void Walk(Pieces& pieces, const char* format, const PrintFormatter* args, int count,
+          Argument argument) {
+   const char* at = format;
    for (;;) {
-      size_t end = static_cast<size_t>(strchrnul(format + index, '%') - format);
-      if (end > index) WriteAll(writer, format + index, end - index);
-      index = end;
-      if (format[index] == '\0') return;
-      PELMORA_VERIFY(format[index] == '%');
-      char next = format[index + 1];
+      const char* percent = strchrnul(at, '%');
+      if (percent > at) pieces.Append(at, static_cast<size_t>(percent - at));
+      if (*percent == '\0') return;
+      char next = percent[1];
       if (next == '\0') return;
       if (next >= '1' && next <= '9') {
          int number = next - '0';
-         if (number > count) throw InvalidFormatStringException(format);
-         args[number - 1].Print(writer);
+         if (number > count) {
+            pieces.GetWriter();  // what came before stays written
+            throw InvalidFormatStringException(format);
+         }
+         argument(args[number - 1]);
       } else if (next == '%') {
-         writer->Write("%", 1);
+         pieces.Append("%", 1);
       } else {
-         writer->Write(format + index, 2);
+         pieces.Append(percent, 2);
       }
-      index += 2;
+      at = percent + 2;
    }
+}
+
+}  // namespace
+
+void MessageFormatter::PrintArgs(Writer* writer, const char* format, const PrintFormatter* args,
+                                 int count) {
+   DirectPieces pieces(writer);
+   Walk(pieces, format, args, count, [writer](const PrintFormatter& arg) { arg.Print(writer); });
+}
+
+void MessageFormatter::PrintArgsJoined(Writer* writer, const char* format,
+                                       const PrintFormatter* args, int count) {
+   JoinedPieces pieces(writer);
+   // The plain forms of the common types are appended here; the call through the
+   // argument's function and the writer's per piece cost more than the conversion.
+   auto argument = [&pieces](const PrintFormatter& arg) {
+      const PrintFormatter::FormatValue& value = arg._value;
+      PrintFormatter::FormatFunction function = arg._function;
+      if (arg._option == nullptr) {
+         if (function == PrintFormatter::FormatInt) return AppendDecimal(pieces, value.int32);
+         if (function == PrintFormatter::FormatUInt) return AppendDecimal(pieces, value.uint32);
+         if (function == PrintFormatter::FormatLong) return AppendDecimal(pieces, value.int64);
+         if (function == PrintFormatter::FormatULong) return AppendDecimal(pieces, value.uint64);
+         if (function == PrintFormatter::FormatChar) return pieces.Append(&value.character, 1);
+      }
+      if (function == PrintFormatter::FormatString) {
+         if (!value.string) return pieces.Append(kNull, sizeof(kNull) - 1);
+         return pieces.Append(value.string, std::strlen(value.string));
+      }
+      if (function == PrintFormatter::FormatSTLString && value.stlString) {
+         return pieces.Append(value.stlString->data(), value.stlString->size());
+      }
+      if (function == PrintFormatter::FormatStringView && value.stringView) {
+         return pieces.Append(value.stringView->data(), value.stringView->size());
+      }
+      if (function == PrintFormatter::FormatBoolean) {
+         return value.boolean ? pieces.Append("true", 4) : pieces.Append("false", 5);
+      }
+      arg.Print(pieces.GetWriter());
+   };
+   Walk(pieces, format, args, count, argument);
+   pieces.Drain();
 }
 
 std::string MessageFormatter::ASPrintArgs(const char* format, const PrintFormatter* args,

@@ -351,7 +351,8 @@ void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
    }
    try {
       Writer* line = logger->GetLineWriter();
-      MessageFormatter::PrintArgs(line ? line : logger, format, args, count);
+      // The line writer buffers the line anyway: one Write for the message, not one a piece.
+      MessageFormatter::PrintArgsJoined(line ? line : logger, format, args, count);
    } catch (...) {
       // A bad argument or format ends the line here; logging never throws.
    }

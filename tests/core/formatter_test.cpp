@@ -6,8 +6,10 @@
 #include <climits>
 #include <cmath>
 #include <cstdio>
+#include <initializer_list>
 #include <stdexcept>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "pelmora/exception.h"
@@ -86,6 +88,46 @@ TEST(MessageFormatterTest, ErrorsPropagateAndKeepWhatWasWritten) {
    EXPECT_THROW(MessageFormatter::Print(&second, "before %1 after", &object),
                 InvalidStateException);
    EXPECT_EQ("before ", second.Text());
+}
+
+// The joined walk (log lines) must write what the plain walk writes, for every argument
+// type it appends itself and those it leaves to their formatter, and keep what came
+// before an error.
+TEST(MessageFormatterTest, JoinedWalkWritesThePlainTextInFewerPieces) {
+   auto both = [](const char* format, std::initializer_list<PrintFormatter> args) {
+      PieceWriter plain, joined;
+      MessageFormatter::PrintArgs(&plain, format, args.begin(), static_cast<int>(args.size()));
+      MessageFormatter::PrintArgsJoined(&joined, format, args.begin(),
+                                        static_cast<int>(args.size()));
+      EXPECT_EQ(plain.Text(), joined.Text()) << format;
+      return joined.pieces.size();
+   };
+   std::string stl = "stl";
+   std::string_view view = "view";
+   const char* nullString = nullptr;
+   EXPECT_EQ(1u, both("a %1 b %2 c %3 d %4 e %5 %6 %7 %8 %9%%",
+                      {INT_MIN, UINT_MAX, LLONG_MIN, ULLONG_MAX, 'z', true, stl, view,
+                       nullString}));
+   both("%1|%2|%3|%4|%5", {false, 2.5, PrintFormatter(42, "%05d"), 'q', "text"});
+   both("%0 %x end%", {1});
+   both("", {1});
+
+   // Past the stack buffer, and a piece larger than it: nothing cut or reordered.
+   std::string big(1000, 'b');
+   std::string format = std::string(300, 'f') + "%1<%2>";
+   both(format.c_str(), {big, std::string(250, 's')});
+
+   PieceWriter partial;
+   const PrintFormatter one[] = {PrintFormatter(1)};
+   EXPECT_THROW(MessageFormatter::PrintArgsJoined(&partial, "one %1 then %2", one, 1),
+                InvalidFormatStringException);
+   EXPECT_EQ("one 1 then ", partial.Text());
+   PieceWriter before;
+   ThrowingObject object;
+   const PrintFormatter throwing[] = {PrintFormatter(&object)};
+   EXPECT_THROW(MessageFormatter::PrintArgsJoined(&before, "before %1 after", throwing, 1),
+                InvalidStateException);
+   EXPECT_EQ("before ", before.Text());
 }
 
 TEST(MessageFormatterTest, LongOutputIsComplete) {

@@ -28,8 +28,12 @@ public:
       return ASPrintArgs(format, formatters, sizeof...(Args));
    }
 
-   // The walk behind every overload.
+   // The walk behind every overload: one Write per literal run and per argument.
    static void PrintArgs(Writer* writer, const char* format, const PrintFormatter* args, int count);
+   // The same text, gathered on the stack so that `writer` sees few and larger pieces; for
+   // writers that buffer anyway and pay per call (a log line).
+   static void PrintArgsJoined(Writer* writer, const char* format, const PrintFormatter* args,
+                               int count);
    static std::string ASPrintArgs(const char* format, const PrintFormatter* args, int count);
 };
 

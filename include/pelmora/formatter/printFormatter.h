@@ -104,6 +104,9 @@ protected:
       : _value(value), _option(option), _function(function) {}
 
 private:
+   // Writes the plain forms of the common types itself, without the call through _function.
+   friend class MessageFormatter;
+
    FormatValue _value;
    const char* _option;
    FormatFunction _function;
