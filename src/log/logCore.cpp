@@ -239,6 +239,7 @@ void LogOutputLock::WriteLock() {
       return;
    }
    uint32_t state = 0;
+   int spins = kLogLockSpins;
    // A waiting mark alone does not keep a writer out; it stays for the others.
    while (!_state.compare_exchange_weak(state, kWriter | (state & kWaiting),
                                         std::memory_order_acquire, std::memory_order_relaxed)) {
@@ -247,7 +248,14 @@ void LogOutputLock::WriteLock() {
          _state.store(kWriter, std::memory_order_relaxed);
          break;
       }
-      if (state & ~kWaiting) state = Await(state) & kWaiting;
+      // Watched with loads first, then slept on.
+      while ((state & ~kWaiting) && spins > 0) {
+         --spins;
+         RelaxCpu();
+         state = _state.load(std::memory_order_relaxed);
+      }
+      if (state & ~kWaiting) state = Await(state);
+      state &= kWaiting;
    }
    _owner.store(self, std::memory_order_relaxed);
    _depth = 1;

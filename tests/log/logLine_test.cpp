@@ -92,6 +92,23 @@ TEST(LogLineTest, LargePiecesGoStraightThroughAndOtherPiecesStayWithinTheChunk) 
    EXPECT_EQ(bigPieces, 1);
 }
 
+// Around the chunk's size one of these lines ends exactly at its edge, so that the newline
+// starts the next chunk; every line must still arrive whole, with one newline at its end.
+TEST(LogLineTest, LinesEndingAtTheChunksEdgeKeepTheirNewline) {
+   TestLogger t;
+   for (size_t length = 1900; length <= 2100; ++length) {
+      PELMORA_LOG_INFO(t.logger.Get(), "%1", std::string(length, 'e'));
+   }
+   std::vector<std::string> lines = t.Lines();
+   ASSERT_EQ(lines.size(), 201u);
+   for (size_t i = 0; i < lines.size(); ++i) {
+      std::string text = "] " + std::string(1900 + i, 'e');
+      ASSERT_GE(lines[i].size(), text.size());
+      EXPECT_EQ(lines[i].substr(lines[i].size() - text.size()), text) << i;
+   }
+   EXPECT_EQ(t.target->Text().back(), '\n');
+}
+
 // A long line holds the output from its first flush to its end, fast path on or off.
 class LongLineTest : public testing::TestWithParam<bool> {};
 
