@@ -1,7 +1,8 @@
 // Fuzzes the placeholder walk and the argument formatters. The input's first byte gives
 // the length of the format string that follows; the rest picks up to nine arguments, some
 // with a fuzzed conversion text. Only InvalidFormatStringException may leave a formatting
-// call; any other exception escapes and ends the run as a crash.
+// call; any other exception escapes and ends the run as a crash. The walk that joins
+// pieces must write what the plain walk writes.
 
 #include <algorithm>
 #include <cstdint>
@@ -54,6 +55,32 @@ void Check(bool condition, const char* what) {
       std::fprintf(stderr, "check failed: %s\n", what);
       std::abort();
    }
+}
+
+// Appends every piece to one string.
+class TextWriter final : public virtual Writer, public ObjectImpl {
+public:
+   void Write(const char* data, int length) override { text.append(data, length); }
+   void Close() override {}
+   std::string text;
+};
+
+// The joined walk (log lines) writes what the plain walk writes, up to the same error.
+void CheckJoinedWalk(const std::string& format, const std::vector<PrintFormatter>& args) {
+   TextWriter plain, joined;
+   bool plainThrew = false, joinedThrew = false;
+   int count = static_cast<int>(args.size());
+   try {
+      MessageFormatter::PrintArgs(&plain, format.c_str(), args.data(), count);
+   } catch (const InvalidFormatStringException&) {
+      plainThrew = true;
+   }
+   try {
+      MessageFormatter::PrintArgsJoined(&joined, format.c_str(), args.data(), count);
+   } catch (const InvalidFormatStringException&) {
+      joinedThrew = true;
+   }
+   Check(plainThrew == joinedThrew && plain.text == joined.text, "joined walk");
 }
 
 template <class T>
@@ -152,6 +179,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
       if (format.find('%') == std::string::npos) Check(text == format, "literal format");
    } catch (const InvalidFormatStringException&) {
    }
+   CheckJoinedWalk(format, args);
    for (const PrintFormatter& arg : args) {
       try {
          std::string text;
