@@ -88,6 +88,14 @@ Ref<SessionService> MakeService(const SessionServiceConfig& config = SessionServ
    return service;
 }
 
+// A new session of `service` for a request without cookies; none when refused.
+Ref<Session> NewSession(SessionService* service) {
+   Exchange exchange;
+   Ref<Session> session;
+   service->ResolveSession(exchange.request.Get(), exchange.response.Get(), session);
+   return session;
+}
+
 // The value of a session counter of the process's registry; -1 when there is none.
 long long CounterValue(const std::string& cookieName, const std::string& counter) {
    std::vector<std::string> names{"/Http/Sessions/Cookie='" + cookieName + "'/" + counter};
@@ -150,9 +158,8 @@ TEST_F(SessionTest, NewSessionSetsItsCookieAndTheCookieResolvesToIt) {
 
 TEST_F(SessionTest, MalformedOrUnknownCookiesGetANewSession) {
    Ref<SessionService> service = MakeService();
-   Exchange first;
-   Ref<Session> known;
-   ASSERT_TRUE(service->ResolveSession(first.request.Get(), first.response.Get(), known));
+   Ref<Session> known = NewSession(service.Get());
+   ASSERT_TRUE(known);
    std::string id = known->GetId();
    std::string upper = id;
    for (char& c : upper) c = static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
@@ -195,10 +202,8 @@ TEST_F(SessionTest, MaximumCountRefusesWithOneWarningPerBurst) {
    config.maxSessionCount = 2;
    config.cookieName = "limited_session";
    Ref<SessionService> service = MakeService(config);
-   Ref<Session> a, b, refused;
-   Exchange ea, eb;
-   ASSERT_TRUE(service->ResolveSession(ea.request.Get(), ea.response.Get(), a));
-   ASSERT_TRUE(service->ResolveSession(eb.request.Get(), eb.response.Get(), b));
+   Ref<Session> a = NewSession(service.Get()), b = NewSession(service.Get()), refused;
+   ASSERT_TRUE(a && b);
    for (int i = 0; i < 3; ++i) {
       Exchange refusedExchange;
       EXPECT_FALSE(ResolveSession(service.Get(), refusedExchange.request.Get(), refusedExchange.response.Get(),
@@ -219,10 +224,8 @@ TEST_F(SessionTest, MaximumCountRefusesWithOneWarningPerBurst) {
 
    // Room again, then a second burst warns again.
    a->Invalidate();
-   Exchange ec, ed;
-   Ref<Session> c;
-   ASSERT_TRUE(service->ResolveSession(ec.request.Get(), ec.response.Get(), c));
-   EXPECT_FALSE(service->ResolveSession(ed.request.Get(), ed.response.Get(), refused));
+   EXPECT_TRUE(NewSession(service.Get()));
+   EXPECT_FALSE(NewSession(service.Get()));
    EXPECT_EQ(Count(log.Text(), warning), 2u) << log.Text();
    EXPECT_EQ(CounterValue("limited_session", "Created"), 3);
    EXPECT_EQ(CounterValue("limited_session", "Refused"), 4);
@@ -237,10 +240,8 @@ TEST_F(SessionTest, IdleSessionsExpireOnTheTimerWhileUsedOnesStay) {
    config.idleTimeout = 50000;
    config.expiryInterval = 10000;
    Ref<SessionService> service = MakeService(config);
-   Exchange e1, e2;
-   Ref<Session> idle, used;
-   ASSERT_TRUE(service->ResolveSession(e1.request.Get(), e1.response.Get(), idle));
-   ASSERT_TRUE(service->ResolveSession(e2.request.Get(), e2.response.Get(), used));
+   Ref<Session> idle = NewSession(service.Get()), used = NewSession(service.Get());
+   ASSERT_TRUE(idle && used);
    std::string cookie = "pelmora_session=" + used->GetId();
    // Every access restarts the clock: touched every 10 ms, `used` outlives `idle`.
    ASSERT_TRUE(WaitFor(
@@ -276,10 +277,9 @@ TEST_F(SessionTest, IdleSessionsEndOnLookupAndOnExplicitExpiry) {
    config.cookieName = "idle_session";
    Ref<SessionService> service = MakeService(config);
    std::vector<Ref<Session>> sessions(4);
-   std::vector<std::unique_ptr<Exchange>> exchanges;
    for (auto& session : sessions) {
-      exchanges.emplace_back(new Exchange());
-      ASSERT_TRUE(service->ResolveSession(exchanges.back()->request.Get(), exchanges.back()->response.Get(), session));
+      session = NewSession(service.Get());
+      ASSERT_TRUE(session);
    }
    auto made = std::chrono::steady_clock::now();
    ASSERT_TRUE(WaitFor([&] { return std::chrono::steady_clock::now() - made > std::chrono::milliseconds(40); },
@@ -303,9 +303,8 @@ TEST_F(SessionTest, IdleSessionsEndOnLookupAndOnExplicitExpiry) {
 
    // Sessions still held elsewhere end with a service dropped without Shutdown.
    Ref<SessionService> dropped = MakeService();
-   Exchange e0;
-   Ref<Session> orphan;
-   ASSERT_TRUE(dropped->ResolveSession(e0.request.Get(), e0.response.Get(), orphan));
+   Ref<Session> orphan = NewSession(dropped.Get());
+   ASSERT_TRUE(orphan);
    dropped.Reset();
    EXPECT_FALSE(orphan->IsValid());
    orphan->Invalidate();
@@ -313,9 +312,8 @@ TEST_F(SessionTest, IdleSessionsEndOnLookupAndOnExplicitExpiry) {
    // A negative time-out never expires.
    config.idleTimeout = -1;
    Ref<SessionService> forever = MakeService(config);
-   Exchange e;
-   Ref<Session> kept;
-   ASSERT_TRUE(forever->ResolveSession(e.request.Get(), e.response.Get(), kept));
+   Ref<Session> kept = NewSession(forever.Get());
+   ASSERT_TRUE(kept);
    std::this_thread::sleep_for(std::chrono::milliseconds(5));
    EXPECT_EQ(forever->ExpireIdleSessions(), 0u);
    EXPECT_TRUE(forever->LookupSession(kept->GetId(), out));
@@ -325,9 +323,8 @@ TEST_F(SessionTest, IdleSessionsEndOnLookupAndOnExplicitExpiry) {
 
 TEST_F(SessionTest, InvalidateAndShutdownEndSessionsAndTheirValues) {
    Ref<SessionService> service = MakeService();
-   Exchange first;
-   Ref<Session> session;
-   ASSERT_TRUE(service->ResolveSession(first.request.Get(), first.response.Get(), session));
+   Ref<Session> session = NewSession(service.Get());
+   ASSERT_TRUE(session);
    Ref<Object> value(new ObjectImpl()), out;
    session->SetAttribute("user", value.Get());
    ASSERT_TRUE(session->GetAttribute("user", out));
@@ -364,18 +361,16 @@ TEST_F(SessionTest, TheTimerNeitherKeepsTheServiceAliveNorRacesShutdown) {
    config.expiryInterval = 1000;
    for (int round = 0; round < 20; ++round) {
       Ref<SessionService> service = MakeService(config);
-      Exchange e;
-      Ref<Session> session;
-      ASSERT_TRUE(service->ResolveSession(e.request.Get(), e.response.Get(), session));
+      Ref<Session> session = NewSession(service.Get());
+      ASSERT_TRUE(session);
       std::this_thread::sleep_for(std::chrono::microseconds(500 * (round % 5)));
       service->Shutdown();
       EXPECT_EQ(service->GetSessionCount(), 0u);
    }
    Ref<SessionService> service = MakeService(config);
    WeakRef<SessionService> weak(service);
-   Exchange e;
-   Ref<Session> session;
-   ASSERT_TRUE(service->ResolveSession(e.request.Get(), e.response.Get(), session));
+   Ref<Session> session = NewSession(service.Get());
+   ASSERT_TRUE(session);
    ASSERT_TRUE(WaitFor([&] { return !session->IsValid(); }, "timer ran"));
    service.Reset();  // without Shutdown; a timer callback in progress may hold it briefly
    EXPECT_TRUE(WaitFor([&] { return weak.IsDetached(); }, "service released", std::chrono::milliseconds(2000)));
@@ -384,9 +379,8 @@ TEST_F(SessionTest, TheTimerNeitherKeepsTheServiceAliveNorRacesShutdown) {
 TEST_F(SessionTest, ConcurrentResolutionFromSeveralThreads) {
    Pelmora::Testing::Watchdog watchdog("concurrent session resolution");
    Ref<SessionService> service = MakeService();
-   Exchange seed;
-   Ref<Session> shared;
-   ASSERT_TRUE(service->ResolveSession(seed.request.Get(), seed.response.Get(), shared));
+   Ref<Session> shared = NewSession(service.Get());
+   ASSERT_TRUE(shared);
    constexpr int kThreads = 4, kRounds = 100;
    std::atomic<int> sameCount{0}, newCount{0}, failures{0};
    std::vector<std::thread> threads;
