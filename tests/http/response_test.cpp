@@ -1,7 +1,7 @@
 #include <gtest/gtest.h>
 
-#include <cstdio>
 #include <cstring>
+#include <fstream>
 #include <string>
 #include <thread>
 
@@ -10,6 +10,7 @@
 #include "pelmora/http/response.h"
 #include "pelmora/object/weak.h"
 #include "pelmora/system/socket.h"
+#include "tests/support/httpClient.h"
 #include "tests/support/netFixture.h"
 #include "tests/support/watchdog.h"
 
@@ -17,6 +18,7 @@ namespace Pelmora::Http {
 namespace {
 
 using System::NetTesting::EnsurePool;
+using Testing::RunCommand;
 
 class TestConnection : public virtual HttpConnection, public ObjectImpl {
 public:
@@ -262,26 +264,21 @@ TEST(ResponseClientTest, PythonClientReadsAChunkedResponseByteExact) {
    listener->GetBindingInfo(local);
    std::string body;
    for (int i = 0; i < 50000; ++i) body += static_cast<char>((i * 7919) % 251);
-   const std::string script =
-      "import http.client, sys\n"
-      "c = http.client.HTTPConnection('127.0.0.1', " + std::to_string(local->GetPort()) + ", timeout=20)\n"
-      "c.request('GET', '/data?x=1')\n"
-      "r = c.getresponse()\n"
-      "data = r.read()\n"
-      "sys.stdout.write('%d %s %d\\n' % (r.status, r.getheader('Transfer-Encoding'), len(data)))\n"
-      "sys.stdout.flush()\n"
-      "sys.stdout.buffer.write(data)\n";
-   std::string command = "python3 -c \"$HTTP_TEST_SCRIPT\"";
-   setenv("HTTP_TEST_SCRIPT", script.c_str(), 1);
-   FILE* child = popen(command.c_str(), "r");
-   ASSERT_NE(child, nullptr);
+   std::string script = ::testing::TempDir() + "response_client.py";
+   std::ofstream(script) << "import http.client, sys\n"
+                            "c = http.client.HTTPConnection('127.0.0.1', "
+                         << local->GetPort()
+                         << ", timeout=20)\n"
+                            "c.request('GET', '/data?x=1')\n"
+                            "r = c.getresponse()\n"
+                            "data = r.read()\n"
+                            "sys.stdout.write('%d %s %d\\n' % (r.status, r.getheader('Transfer-Encoding'), len(data)))\n"
+                            "sys.stdout.flush()\n"
+                            "sys.stdout.buffer.write(data)\n";
    std::string output;
-   std::thread reader([&] {
-      char piece[8192];
-      for (size_t n; (n = fread(piece, 1, sizeof piece, child)) > 0;) output.append(piece, n);
-   });
+   std::thread client([&] { output = RunCommand("python3 " + script); });
    {
-      Testing::Watchdog watchdog("the Python client");
+      Pelmora::Testing::Watchdog watchdog("the Python client");
       Ref<System::Stream> stream;
       listener->Accept(20000000, stream);
       Ref<Request> request;
@@ -300,15 +297,13 @@ TEST(ResponseClientTest, PythonClientReadsAChunkedResponseByteExact) {
          response->Write(body.data() + at, static_cast<int>(n));
       }
       response->Complete();
-      Testing::Join(reader, "the Python client's output");
+      Pelmora::Testing::Join(client, "the Python client");
       stream->Close();
    }
-   int status = pclose(child);
    SetBufferSize(8192);
    listener->Close();
-   EXPECT_EQ(status, 0) << output;
    std::string first = "200 chunked 50000\n";
-   ASSERT_EQ(output.substr(0, first.size()), first);
+   ASSERT_EQ(output.substr(0, first.size()), first) << output.substr(0, 300);
    EXPECT_TRUE(output.substr(first.size()) == body);
 }
 
