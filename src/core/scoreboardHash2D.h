@@ -19,7 +19,7 @@ public:
    void GetStats(PerfCounter::LwStatsBuilder& builder) override;
    void Increment(const char* name) override { Add(name, 1); }
    void Decrement(const char* name) override { Add(name, -1); }
-   void Add(const char* name, int delta);
+   void Add(const char* name, int delta) override;
    void Serialize(std::string& out) const override;
    int GetSize() const override;
    void VisitClasses(ClassVisitor visitor, void* context) const override;
