@@ -6,12 +6,14 @@
 #include <cstring>
 #include <initializer_list>
 #include <memory>
+#include <string>
 #include <string_view>
 #include <mutex>
 #include <utility>
 #include <vector>
 
 #include "pelmora/exception/panic.h"
+#include "pelmora/object/scoreboard.h"
 #include "pelmora/xml/parser.h"
 #include "src/xml/nodeArena.h"
 #include "src/xml/nodeImpl.h"
@@ -102,10 +104,15 @@ public:
 
    void StartNewDocument(Ref<Object>& result) override { StartNewDocument(false, result); }
 
-   ~XMLDocHandlerImpl() override { ReleaseArena(); }
+   ~XMLDocHandlerImpl() override {
+      ReportMadeNodes();
+      ReleaseArena();
+   }
 
    void StartNewDocument(bool restricted, Ref<Object>& result) override {
+      ReportMadeNodes();
       _stack.clear();
+      _textOpen = false;
       _bytes = 0;
       _nodes = 0;
       _restricted = restricted;
@@ -114,11 +121,16 @@ public:
       _arena = new NodeArena();
       _document = new (_arena) DocumentImpl();
       _stack.push_back(_document.Get());
+      // The reference tracker wants to see every first reference itself.
+      _countInBulk = GetRefTracker() == nullptr;
       result = _document.Get();
    }
 
    void CleanUpDocument() override {
+      // Before any node can go: the nodes' releases count down what this counted up.
+      ReportMadeNodes();
       _stack.clear();
+      _textOpen = false;
       _names.Clear();
       _document.Reset();
       ReleaseArena();
@@ -126,43 +138,55 @@ public:
 
    void OnStartElement(const std::string& name, int line, int column,
                        const char** attributes) override {
+      CloseText();
       IncNodeCountAndValidate(name.size());
       std::unique_ptr<ElementNodeImpl> element(
-          new (_arena) ElementNodeImpl(_names.Find(name, _arena), line, column));
+          new (_arena) ElementNodeImpl(_names.Find(name, _arena), line, column, _arena));
       for (const char** attribute = attributes; *attribute; attribute += 2)
          ValidateByteCount(std::strlen(attribute[0]) + std::strlen(attribute[1]));
       element->DefineParsedAttributes(attributes);
       Push(std::move(element));
    }
 
-   void OnEndElement(const std::string&) override { Pop(); }
+   void OnEndElement(const std::string&) override {
+      CloseText();
+      Pop();
+   }
 
+   // Expat splits character data at line ends and references: one text node takes all,
+   // collected here first so that the node's text is allocated once, at its full size.
+   // The limits count each piece as it comes, the node with the first.
    void OnCharacters(const char* data, int length) override {
-      // Expat splits character data at line ends and references: one text node takes all.
-      NodeImpl* last = _stack.back()->LastChildImpl();
-      if (last && last->GetNodeType() == kTextNode) {
+      if (_textOpen) {
          ValidateByteCount(static_cast<uint64_t>(length));
-         static_cast<TextNodeImpl*>(last)->AppendText(data, length);
+         _text.append(data, static_cast<size_t>(length));
          return;
       }
       IncNodeCountAndValidate(static_cast<uint64_t>(length));
-      AppendLeaf(std::unique_ptr<TextNodeImpl>(new (_arena) TextNodeImpl(data, length)));
+      _text.assign(data, static_cast<size_t>(length));
+      _textOpen = true;
    }
 
    void OnStartCData() override {
+      CloseText();
       IncNodeCountAndValidate(0);
       Push(std::unique_ptr<CDataNodeImpl>(new (_arena) CDataNodeImpl()));
    }
 
-   void OnEndCData() override { Pop(); }
+   void OnEndCData() override {
+      CloseText();
+      Pop();
+   }
 
    // Comments and processing instructions hold text too, so their bytes count as well.
    void OnComment(const std::string& text) override {
+      CloseText();
       IncNodeCountAndValidate(text.size());
       AppendLeaf(std::unique_ptr<CommentNodeImpl>(new (_arena) CommentNodeImpl(text)));
    }
 
    void OnProcessingInstruction(const std::string& target, const std::string& data) override {
+      CloseText();
       IncNodeCountAndValidate(target.size() + data.size());
       AppendLeaf(std::unique_ptr<ProcessingInstructionNodeImpl>(
           new (_arena) ProcessingInstructionNodeImpl(target, data)));
@@ -179,8 +203,9 @@ private:
    template <class T>
    void Push(std::unique_ptr<T> node) {
       NodeImpl* added = node.get();
-      _stack.back()->AppendChildImpl(added);
+      _stack.back()->AppendParsedChild(added, !_countInBulk);
       static_cast<void>(node.release());  // the tree holds it now
+      if (_countInBulk) ++_made[added->GetNodeType()];
       _stack.push_back(added);
       if (_restricted && _stack.size() > _maxDepth) {
          LogXml(kXmlLogWarning, "XML document too deep: %1 (max: %2)", _stack.size(), _maxDepth);
@@ -197,6 +222,24 @@ private:
    void AppendLeaf(std::unique_ptr<T> node) {
       Push(std::move(node));
       Pop();
+   }
+
+   // Makes the text node of the character data collected so far.
+   void CloseText() {
+      if (!_textOpen) return;
+      _textOpen = false;
+      AppendLeaf(std::unique_ptr<TextNodeImpl>(
+          new (_arena) TextNodeImpl(_text.data(), static_cast<int>(_text.size()))));
+   }
+
+   // Counts the nodes made since the last call on the scoreboard, one step per kind. The
+   // scoreboard exists: it counted the document.
+   void ReportMadeNodes() {
+      Scoreboard* scoreboard = GetScoreboard();
+      for (int type = 0; type <= kProcessingInstructionNode; ++type) {
+         int made = std::exchange(_made[type], 0);
+         if (made && scoreboard) scoreboard->Add(NodeImpl::ScoreboardName(type), made);
+      }
    }
 
    void ValidateByteCount(uint64_t bytes) {
@@ -232,6 +275,12 @@ private:
    Ref<DocumentImpl> _document;
    NodeArena* _arena = nullptr;
    NameTable _names;
+   // Character data not yet made into a node; the buffer keeps its capacity.
+   std::string _text;
+   bool _textOpen = false;
+   // Nodes linked into the tree but not yet on the scoreboard, by kind.
+   bool _countInBulk = false;
+   int _made[kProcessingInstructionNode + 1] = {};
 };
 
 }  // namespace

@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <climits>
 #include <cstddef>
+#include <random>
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/exception/panic.h"
@@ -16,6 +17,13 @@
 
 namespace Pelmora::Xml {
 namespace {
+
+unsigned long NewHashSalt() {
+   std::random_device source;
+   unsigned long salt = source();
+   if constexpr (sizeof(salt) > sizeof(unsigned)) salt = (salt << 32) ^ source();
+   return salt;
+}
 
 // Bytes read from the reader and handed to expat at a time.
 constexpr int kBlockSize = 10240;
@@ -151,6 +159,9 @@ private:
    XML_Parser _parser = nullptr;
    bool _restricted = false;
    bool _stopped = false;
+   // Drawn once per parser: left to itself, expat reads the system's entropy source again
+   // for every document, a system call per request.
+   unsigned long _hashSalt = NewHashSalt();
 };
 
 void XMLParserImpl::InstallCallbacks() {
@@ -172,8 +183,9 @@ void XMLParserImpl::ThrowParseError() {
 
 template <class Input>
 void XMLParserImpl::ParseDocument(bool restricted, Ref<Object>& result, Input input) {
-   // The reset clears the callbacks too.
+   // The reset clears the callbacks and the hash salt too.
    XML_ParserReset(_parser, nullptr);
+   XML_SetHashSalt(_parser, _hashSalt);
    InstallCallbacks();
    _restricted = restricted;
    _stopped = false;

@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <new>
+#include <utility>
 
 #include "src/xml/nodeImpl.h"
 
@@ -15,10 +16,22 @@ namespace {
 // largest, which keeps block allocation rare while staying below the heap's mmap threshold.
 constexpr size_t kFirstBlockSize = 8 * 1024;
 constexpr size_t kLargestBlockSize = 64 * 1024;
-constexpr size_t kAlignment = 16;
+// Enough for every node kind: a wider unit would only spread the nodes over more memory,
+// which building and dropping a large document read through.
+constexpr size_t kAlignment = alignof(void*);
+static_assert(alignof(DocumentImpl) <= kAlignment && alignof(ElementNodeImpl) <= kAlignment &&
+              alignof(TextNodeImpl) <= kAlignment && alignof(CDataNodeImpl) <= kAlignment &&
+              alignof(CommentNodeImpl) <= kAlignment &&
+              alignof(ProcessingInstructionNodeImpl) <= kAlignment &&
+              alignof(ElementName) <= kAlignment);
 // Before each node: the arena it came from, or null for the general heap; one alignment
 // unit, so that the node itself stays aligned.
 constexpr size_t kHeaderSize = kAlignment;
+
+// One first block kept from a dropped arena for the next: a document a request allocates
+// and frees at least that block, and a heap request of its size makes the heap tidy its
+// small free chunks first.
+std::atomic<char*> g_spareFirstBlock{nullptr};
 
 size_t RoundUp(size_t size) {
    return (size + kAlignment - 1) & ~(kAlignment - 1);
@@ -37,7 +50,13 @@ NodeArena::~NodeArena() {
       stored->~StoredName();
       stored = next;
    }
-   for (char* block : _blocks) ::operator delete(block);
+   size_t first = 0;
+   if (_firstBlockIsSpare && !_blocks.empty()) {
+      if (char* old = g_spareFirstBlock.exchange(_blocks.front(), std::memory_order_acq_rel))
+         ::operator delete(old);
+      first = 1;
+   }
+   for (size_t i = first; i < _blocks.size(); ++i) ::operator delete(_blocks[i]);
 }
 
 const ElementName* NodeArena::NewName(std::string_view qualifiedName, std::string_view& stored) {
@@ -64,7 +83,12 @@ void* NodeArena::AllocateRaw(size_t size) {
                                                     kLargestBlockSize);
       blockSize = std::max(blockSize, size);
       _blocks.reserve(_blocks.size() + 1);
-      char* block = static_cast<char*>(::operator new(blockSize));
+      char* block = nullptr;
+      if (_blocks.empty() && blockSize == kFirstBlockSize) {
+         block = g_spareFirstBlock.exchange(nullptr, std::memory_order_acq_rel);
+         _firstBlockIsSpare = true;
+      }
+      if (!block) block = static_cast<char*>(::operator new(blockSize));
       _blocks.push_back(block);
       _cursor = block;
       _end = block + blockSize;
@@ -76,10 +100,46 @@ void* NodeArena::AllocateRaw(size_t size) {
 
 void NodeArena::Release() { Drop(1); }
 
-void NodeArena::ReleaseCreator() { Drop(kCreatorBias - _allocated); }
+void NodeArena::Release(size_t count) { Drop(count); }
+
+void NodeArena::ReleaseCreator() {
+   _building = false;
+   Drop(kCreatorBias - _allocated);
+}
+
+void* AllocateNodePart(NodeArena* arena, size_t size) {
+   bool fromArena = arena && arena->IsBuilding();
+   char* memory = static_cast<char*>(fromArena ? arena->AllocateRaw(kHeaderSize + size)
+                                               : ::operator new(kHeaderSize + size));
+   *reinterpret_cast<NodeArena**>(memory) = fromArena ? arena : nullptr;
+   return memory + kHeaderSize;
+}
+
+void FreeNodePart(void* part) {
+   char* memory = static_cast<char*>(part) - kHeaderSize;
+   if (!*reinterpret_cast<NodeArena**>(memory)) ::operator delete(memory);
+}
 
 void NodeArena::Drop(size_t references) {
    if (_references.fetch_sub(references, std::memory_order_acq_rel) == references) delete this;
+}
+
+void NodeDisposal::Free(void* node) {
+   char* memory = static_cast<char*>(node) - kHeaderSize;
+   NodeArena* arena = *reinterpret_cast<NodeArena**>(memory);
+   if (!arena) {
+      ::operator delete(memory);
+      return;
+   }
+   if (arena != _arena) {
+      Flush();
+      _arena = arena;
+   }
+   ++_count;
+}
+
+void NodeDisposal::Flush() {
+   if (_count) _arena->Release(std::exchange(_count, 0));
 }
 
 void* NodeImpl::operator new(size_t size) {

@@ -21,12 +21,18 @@ public:
    NodeArena(const NodeArena&) = delete;
    NodeArena& operator=(const NodeArena&) = delete;
 
-   // Memory for one node, 16-byte aligned; the node holds a reference until it dies.
+   // Memory for one node, pointer-aligned; the node holds a reference until it dies.
    void* Allocate(size_t size);
+   // As Allocate, for memory that holds no node reference.
+   void* AllocateRaw(size_t size);
    // Drops a node's reference; the last frees every block.
    void Release();
+   // Drops the references of `count` nodes at once.
+   void Release(size_t count);
    // Drops the creator's reference, after its last Allocate.
    void ReleaseCreator();
+   // Whether the creator still builds: only then may its nodes' parts come from here.
+   bool IsBuilding() const { return _building; }
    // A name for this arena's elements, made from `qualifiedName`, which is copied into
    // the arena too and `stored` set to the copy. Both live as long as the arena. By the
    // creator, before ReleaseCreator.
@@ -40,17 +46,41 @@ private:
 
    ~NodeArena();
    void Drop(size_t references);
-   // As Allocate, for memory that holds no node reference.
-   void* AllocateRaw(size_t size);
 
    std::atomic<size_t> _references{kCreatorBias};
    size_t _allocated = 0;  // by the creator's thread only
+   bool _building = true;
+   bool _firstBlockIsSpare = false;  // of the first size: goes to the spare slot
    std::vector<char*> _blocks;
    char* _cursor = nullptr;
    char* _end = nullptr;
    // The names made here, newest first, to be destroyed with the arena.
    struct StoredName;
    StoredName* _names = nullptr;
+};
+
+// Memory for a part of a node (an element's attribute list): from `arena` while its creator
+// builds, from the heap otherwise. Parts from an arena go with the arena; FreeNodePart
+// frees either kind.
+void* AllocateNodePart(NodeArena* arena, size_t size);
+void FreeNodePart(void* part);
+
+// Frees the memory of nodes whose destructors have run, from whichever heap or arena each
+// came, releasing each arena once per run of its nodes rather than once per node.
+class NodeDisposal {
+public:
+   NodeDisposal() = default;
+   NodeDisposal(const NodeDisposal&) = delete;
+   NodeDisposal& operator=(const NodeDisposal&) = delete;
+   ~NodeDisposal() { Flush(); }
+
+   // `node` is the address of the complete node object, as operator new returned it.
+   void Free(void* node);
+   void Flush();
+
+private:
+   NodeArena* _arena = nullptr;
+   size_t _count = 0;
 };
 
 }  // namespace Pelmora::Xml

@@ -7,6 +7,7 @@
 #include <map>
 #include <string>
 #include <string_view>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -15,6 +16,32 @@
 namespace Pelmora::Xml {
 
 class NodeArena;
+void* AllocateNodePart(NodeArena* arena, size_t size);
+void FreeNodePart(void* part);
+
+// Hands a container of a node the memory of AllocateNodePart. Any instance frees what any
+// other allocated, so all compare equal.
+template <class T>
+class NodePartAllocator {
+public:
+   using value_type = T;
+   using is_always_equal = std::true_type;
+
+   explicit NodePartAllocator(NodeArena* arena = nullptr) : _arena(arena) {}
+   template <class U>
+   NodePartAllocator(const NodePartAllocator<U>& other) : _arena(other.Arena()) {}
+
+   T* allocate(size_t count) {
+      return static_cast<T*>(AllocateNodePart(_arena, count * sizeof(T)));
+   }
+   void deallocate(T* part, size_t) { FreeNodePart(part); }
+   NodeArena* Arena() const { return _arena; }
+   template <class U>
+   bool operator==(const NodePartAllocator<U>&) const { return true; }
+
+private:
+   NodeArena* _arena;
+};
 
 // An element's prefix and tag. Parsed elements of one document share one per distinct
 // name (the document's arena keeps them); other elements own theirs.
@@ -75,6 +102,13 @@ public:
       Insert(child, nullptr);
    }
 
+   // For the parser: appends a node it has just made, which nobody else references. With
+   // `counted` false the node is not reported to the scoreboard; the caller reports it
+   // (with the others of its document, at once) under ScoreboardName.
+   void AppendParsedChild(NodeImpl* child, bool counted);
+   // The name under which the scoreboard counts the nodes of a kind (a NodeType).
+   static const char* ScoreboardName(int nodeType);
+
    // The implementation behind a node of this model; any other Node is a panic.
    static NodeImpl* FromNode(Node* node);
    static const NodeImpl* FromNode(const Node* node);
@@ -127,16 +161,19 @@ private:
 class ElementNodeImpl final : public virtual ElementNode, public NodeImpl {
 public:
    using AttributeMap = std::map<std::string, std::string>;
-   // Sorted by name: the order of a map, at one allocation per element.
-   using AttributeList = std::vector<std::pair<std::string, std::string>>;
+   // Sorted by name: the order of a map, at one allocation per element, which for a parsed
+   // element comes from its document's arena.
+   using Attribute = std::pair<std::string, std::string>;
+   using AttributeList = std::vector<Attribute, NodePartAllocator<Attribute>>;
    using NodeImpl::WriteNode;
 
    // The constructors take names as given (the parser's are known good); the factories
    // and setters check them. The qualified name is split as ElementName::FromQualified.
    ElementNodeImpl(const std::string& qualifiedName, int line, int column);
    ElementNodeImpl(const std::string& prefix, const std::string& tag, int line, int column);
-   // With a name shared by the elements of a parsed document; `name` outlives the node.
-   ElementNodeImpl(const ElementName* name, int line, int column);
+   // With a name shared by the elements of a parsed document; `name` outlives the node,
+   // which is made in `arena`.
+   ElementNodeImpl(const ElementName* name, int line, int column, NodeArena* arena);
    ~ElementNodeImpl() override;
 
    int GetNodeType() const override { return kElementNode; }

@@ -4,6 +4,8 @@
 #include <string>
 
 #include "pelmora/exception.h"
+#include "pelmora/object/scoreboard.h"
+#include "src/xml/nodeImpl.h"
 #include "tests/xml/nodeBuilders.h"
 
 namespace Pelmora::Xml {
@@ -73,6 +75,93 @@ TEST(NodeTest, AVeryDeepTreeIsWrittenAndReleasedWithoutRecursion) {
    EXPECT_EQ(static_cast<size_t>(kDepth) * 7 + 1, written.size());
    EXPECT_EQ(0u, written.find("<e><e><e>"));
    top.Reset();  // would overflow the stack if each level took a frame
+}
+
+// The live instances of each node class, as the scoreboard counts them.
+std::map<std::string, int> NodeCounts() {
+   std::map<std::string, int> counts;
+   for (int type = kDocumentNode; type <= kProcessingInstructionNode; ++type)
+      counts[NodeImpl::ScoreboardName(type)] = 0;
+   if (Scoreboard* scoreboard = GetScoreboard()) {
+      scoreboard->VisitClasses(
+          [](void* context, const char* name, int count) {
+             auto* counts = static_cast<std::map<std::string, int>*>(context);
+             if (auto found = counts->find(name); found != counts->end()) found->second = count;
+          },
+          &counts);
+   }
+   return counts;
+}
+
+// Dropping a parsed tree frees its nodes in bulk; every node still referenced from outside
+// must survive with its subtree, whichever arena or heap it and its parent came from.
+TEST(NodeTest, DroppingATreeKeepsEveryNodeHeldElsewhere) {
+   Ref<Document> other = Testing::Parse("<o><moved>m<i/></moved></o>");
+   Ref<ElementNode> moved = dynamic_cast<ElementNode*>(other->GetRoot()->GetFirstChild());
+   Ref<ElementNode> deep, middle;
+   Ref<TextNode> text;
+   Ref<CommentNode> comment;
+   {
+      Ref<Document> document = Testing::Parse(
+          "<r><a><b><c x='1'>deep text</c><d/></b>tail<!--note--></a><e>gone</e></r>");
+      auto* a = dynamic_cast<ElementNode*>(document->GetRoot()->GetFirstChild());
+      auto* b = dynamic_cast<ElementNode*>(a->GetFirstChild());
+      middle = b;
+      deep = dynamic_cast<ElementNode*>(b->GetFirstChild());  // held inside a held node
+      text = dynamic_cast<TextNode*>(b->GetNextSibling());
+      comment = dynamic_cast<CommentNode*>(text->GetNextSibling());
+      // Nodes of another document and of the heap, mixed into this tree, go with it.
+      other->GetRoot()->RemoveChild(moved.Get());
+      a->AppendChild(moved.Get());
+      moved.Reset();
+      document->GetRoot()->AppendChild(Element("built").Get());
+      dynamic_cast<ElementNode*>(document->GetRoot()->GetLastChild())
+          ->AppendChild(Text("heap").Get());
+   }
+   EXPECT_EQ(nullptr, middle->GetParent());
+   EXPECT_EQ(nullptr, text->GetParent());
+   EXPECT_EQ(nullptr, text->GetNextSibling());
+   EXPECT_EQ(nullptr, comment->GetPrevSibling());
+   EXPECT_EQ(middle.Get(), deep->GetParent());
+   EXPECT_EQ("<b><c x=\"1\">deep text</c><d/></b>", Testing::Write(middle.Get()));
+   EXPECT_EQ("tail", text->GetText());
+   EXPECT_EQ("note", comment->GetComment());
+   middle.Reset();
+   EXPECT_EQ(nullptr, deep->GetParent());
+   EXPECT_EQ("<c x=\"1\">deep text</c>", Testing::Write(deep.Get()));
+   // The document the moved node came from is untouched by its loss.
+   EXPECT_EQ("<o/>", Testing::Write(other->GetRoot()));
+}
+
+// The parser counts its nodes on the scoreboard a document at a time, and a tree dropped
+// in bulk counts them down the same way: the counts come back to where they were.
+TEST(NodeTest, TheScoreboardCountsParsedNodesUntilTheyGo) {
+   std::map<std::string, int> before = NodeCounts();
+   auto delta = [&before](int type) {
+      const char* name = NodeImpl::ScoreboardName(type);
+      return NodeCounts()[name] - before[name];
+   };
+   Ref<TextNode> kept;
+   {
+      Ref<Document> document =
+          Testing::Parse("<r><!--c--><a>x&amp;y</a><a/><![CDATA[z]]>w</r>");
+      EXPECT_EQ(1, delta(kDocumentNode));
+      EXPECT_EQ(3, delta(kElementNode));
+      EXPECT_EQ(3, delta(kTextNode));
+      EXPECT_EQ(1, delta(kCDataNode));
+      EXPECT_EQ(1, delta(kCommentNode));
+      kept = dynamic_cast<TextNode*>(document->GetRoot()->GetLastChild());
+      document->GetRoot()->AppendChild(Element("built").Get());
+      EXPECT_EQ(4, delta(kElementNode));
+   }
+   EXPECT_EQ("w", kept->GetText());
+   EXPECT_EQ(0, delta(kDocumentNode));
+   EXPECT_EQ(0, delta(kElementNode));
+   EXPECT_EQ(1, delta(kTextNode));
+   EXPECT_EQ(0, delta(kCDataNode));
+   EXPECT_EQ(0, delta(kCommentNode));
+   kept.Reset();
+   EXPECT_EQ(0, delta(kTextNode));
 }
 
 TEST(NodeTest, EachKindRefusesTheChildrenItCannotHold) {
