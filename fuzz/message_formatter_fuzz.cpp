@@ -1,8 +1,9 @@
-// Fuzzes the placeholder walk and the argument formatters. The input's first byte gives
+// Fuzzes the placeholder walk and the argument formatters. The input's second byte gives
 // the length of the format string that follows; the rest picks up to nine arguments, some
 // with a fuzzed conversion text. Only InvalidFormatStringException may leave a formatting
 // call; any other exception escapes and ends the run as a crash. The walk that joins
-// pieces must write what the plain walk writes.
+// pieces must write what the plain walk writes, and so must the walk into a buffer (of a
+// size from the input's first byte) whenever it does not decline.
 
 #include <algorithm>
 #include <cstdint>
@@ -83,6 +84,28 @@ void CheckJoinedWalk(const std::string& format, const std::vector<PrintFormatter
    Check(plainThrew == joinedThrew && plain.text == joined.text, "joined walk");
 }
 
+// The walk into a buffer writes what the plain walk writes, or declines; it never writes
+// past `capacity` (the bytes beyond it stay as they were).
+void CheckBufferWalk(const std::string& format, const std::vector<PrintFormatter>& args,
+                     size_t capacity) {
+   TextWriter plain;
+   bool plainThrew = false;
+   try {
+      MessageFormatter::PrintArgs(&plain, format.c_str(), args.data(),
+                                  static_cast<int>(args.size()));
+   } catch (const InvalidFormatStringException&) {
+      plainThrew = true;
+   }
+   std::string buffer(capacity + 16, '#');
+   int length = MessageFormatter::PrintPlainArgs(buffer.data(), capacity, format.c_str(),
+                                                 args.data(), static_cast<int>(args.size()));
+   Check(buffer.compare(capacity, 16, std::string(16, '#')) == 0, "buffer walk stays in room");
+   if (length < 0) return;
+   Check(!plainThrew, "buffer walk declines a bad placeholder");
+   Check(static_cast<size_t>(length) <= capacity, "buffer walk length");
+   Check(buffer.substr(0, static_cast<size_t>(length)) == plain.text, "buffer walk");
+}
+
 template <class T>
 void CheckDefault(const PrintFormatter& formatter, const char* printfFormat, T value) {
    char expected[64];
@@ -96,6 +119,7 @@ void CheckDefault(const PrintFormatter& formatter, const char* printfFormat, T v
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
    Input input(data, size);
+   size_t capacity = input.Byte();
    std::string format = input.Text(input.Byte());
 
    // Values and texts stay put while the formatters refer to them.
@@ -180,6 +204,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
    } catch (const InvalidFormatStringException&) {
    }
    CheckJoinedWalk(format, args);
+   CheckBufferWalk(format, args, capacity);
    for (const PrintFormatter& arg : args) {
       try {
          std::string text;

@@ -12,6 +12,7 @@
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/formatter/printFormatter.h"
 #include "src/core/conversion.h"
+#include "src/internal/shortCopy.h"
 
 namespace Pelmora {
 namespace {
@@ -345,6 +346,15 @@ void AppendDecimal(JoinedPieces& pieces, T value) {
    pieces.Commit(std::to_chars(room, room + kIntBuffer, value).ptr);
 }
 
+// Converts into [out, end) and moves `out` past the digits; false when they do not fit.
+template <class T>
+bool AppendNumber(char*& out, char* end, T value) {
+   auto result = std::to_chars(out, end, value);
+   if (result.ec != std::errc()) return false;
+   out = result.ptr;
+   return true;
+}
+
 // The placeholder walk: literal runs go to `pieces`, each argument to `argument`.
 template <class Pieces, class Argument>
 void Walk(Pieces& pieces, const char* format, const PrintFormatter* args, int count,
@@ -412,6 +422,67 @@ void MessageFormatter::PrintArgsJoined(Writer* writer, const char* format,
    };
    Walk(pieces, format, args, count, argument);
    pieces.Drain();
+}
+
+int MessageFormatter::PrintPlainArgs(char* buffer, size_t capacity, const char* format,
+                                     const PrintFormatter* args, int count) {
+   char* out = buffer;
+   char* const end = buffer + capacity;
+   auto append = [&out, end](const char* data, size_t length) {
+      if (length > static_cast<size_t>(end - out)) return false;
+      Internal::CopyShort(out, data, length);
+      out += length;
+      return true;
+   };
+   // The same walk as Walk's, in one function: no writer to drain, and no argument that
+   // could write itself.
+   const char* at = format;
+   for (;;) {
+      const char* percent = strchrnul(at, '%');
+      if (!append(at, static_cast<size_t>(percent - at))) return -1;
+      if (*percent == '\0' || percent[1] == '\0') break;
+      char next = percent[1];
+      at = percent + 2;
+      if (next == '%') {
+         if (out == end) return -1;
+         *out++ = '%';
+         continue;
+      }
+      if (next < '1' || next > '9') {
+         if (!append(percent, 2)) return -1;
+         continue;
+      }
+      int number = next - '0';
+      if (number > count) return -1;
+      const PrintFormatter& arg = args[number - 1];
+      const PrintFormatter::FormatValue& value = arg._value;
+      PrintFormatter::FormatFunction function = arg._function;
+      bool done;
+      if (function == PrintFormatter::FormatSTLString && value.stlString) {
+         done = append(value.stlString->data(), value.stlString->size());
+      } else if (function == PrintFormatter::FormatString && value.string) {
+         done = append(value.string, std::strlen(value.string));
+      } else if (arg._option != nullptr) {
+         return -1;
+      } else if (function == PrintFormatter::FormatInt) {
+         done = AppendNumber(out, end, value.int32);
+      } else if (function == PrintFormatter::FormatUInt) {
+         done = AppendNumber(out, end, value.uint32);
+      } else if (function == PrintFormatter::FormatLong) {
+         done = AppendNumber(out, end, value.int64);
+      } else if (function == PrintFormatter::FormatULong) {
+         done = AppendNumber(out, end, value.uint64);
+      } else if (function == PrintFormatter::FormatChar) {
+         done = out != end;
+         if (done) *out++ = value.character;
+      } else if (function == PrintFormatter::FormatBoolean) {
+         done = value.boolean ? append("true", 4) : append("false", 5);
+      } else {
+         return -1;
+      }
+      if (!done) return -1;
+   }
+   return static_cast<int>(out - buffer);
 }
 
 std::string MessageFormatter::ASPrintArgs(const char* format, const PrintFormatter* args,

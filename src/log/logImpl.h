@@ -200,7 +200,7 @@ struct LogFileOps {
 void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
                          const LogFileOps& ops, Ref<FileLogWriter>& out);
 
-class LogOutputImpl : public virtual LogOutput, public ObjectImpl {
+class LogOutputImpl final : public virtual LogOutput, public ObjectImpl {
 public:
    explicit LogOutputImpl(const std::string& name) : _name(name) {}
 

@@ -3,6 +3,7 @@
 
 #include <time.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstring>
 #include <map>
@@ -14,6 +15,7 @@
 #include "pelmora/formatter/messageFormatter.h"
 #include "pelmora/service/logMacros.h"
 #include "pelmora/system/thread.h"
+#include "src/internal/shortCopy.h"
 #include "src/log/logImpl.h"
 
 namespace Pelmora::Service {
@@ -27,10 +29,12 @@ constexpr int kChunkSize = 2048;
 constexpr int kLargePiece = 1023;
 constexpr int kPrefixLimit = 65;
 
-// Short copies of sizes known only at run time: the compiler expands these inline as
-// rep movs, whose start-up costs more than calling the C library's memcpy.
-[[gnu::noinline]] void CopyBytes(char* to, const char* from, size_t length) {
-   memcpy(to, from, length);
+// The usual prefix of one level and subsystem, kept per thread for its second; copied
+// as this many bytes at once, whatever its length, when the chunk has the room.
+constexpr int kPrefixCache = 96;
+
+void CopyBytes(char* to, const char* from, size_t length) {
+   Internal::CopyShort(to, from, length);
 }
 
 // Builds one line for one output at a time, Begin to End. The chunk holds the line until
@@ -97,6 +101,17 @@ public:
 
    void Close() override {}
 
+   // Formats a message of plain arguments straight into the chunk; false (and nothing
+   // written) when it needs the general walk. A message longer than a large piece goes
+   // that way too, so that it reaches the output as it always has.
+   bool WritePlain(const char* format, const PrintFormatter* args, int count) {
+      size_t room = static_cast<size_t>(std::min(kChunkSize - _chunkPos, kLargePiece));
+      int length = MessageFormatter::PrintPlainArgs(_chunk + _chunkPos, room, format, args, count);
+      if (length < 0) return false;
+      _chunkPos += length;
+      return true;
+   }
+
    // Hands the rest of the line on and lets the output go, also when a writer throws.
    void End() {
       struct Release {
@@ -140,6 +155,7 @@ private:
          struct tm local;
          localtime_r(&now.tv_sec, &local);
          _second = now.tv_sec;
+         _prefixSize = 0;
          if (local.tm_year != _dateYear || local.tm_mon != _dateMonth ||
              local.tm_mday != _dateDay) {
             snprintf(_dateText, sizeof(_dateText), "%04u-%02u-%02u",
@@ -188,6 +204,20 @@ private:
       char millisText[3] = {static_cast<char>('0' + millis / 100),
                             static_cast<char>('0' + millis / 10 % 10),
                             static_cast<char>('0' + millis % 10)};
+      if (context.empty()) {
+         if (_prefixSize == 0 || _prefixLevel != _level ||
+             subsystem.size() != static_cast<size_t>(_prefixNameSize) ||
+             memcmp(subsystem.data(), _prefix + _prefixNameAt, subsystem.size()) != 0) {
+            CachePrefix(subsystem);
+         }
+         if (_prefixSize > 0 && kChunkSize - _chunkPos >= kPrefixCache) {
+            char* out = _chunk + _chunkPos;
+            memcpy(out, _prefix, kPrefixCache);
+            memcpy(out + _stamp.size, millisText, sizeof(millisText));
+            _chunkPos += _prefixSize;
+            return;
+         }
+      }
       const char* levelName = GetCombinedLevelName(_level);
       size_t levelSize = strlen(levelName);
       int usualSize = _stampedTail.size + static_cast<int>(levelSize) + 2;
@@ -226,6 +256,31 @@ private:
       Write("] ", 2);
    }
 
+   // Makes _prefix the usual prefix of _level and `subsystem` in this second (with zero
+   // milliseconds), or empty when that prefix would be cut or does not fit the cache.
+   void CachePrefix(const std::string& subsystem) {
+      _prefixSize = 0;
+      const char* levelName = GetCombinedLevelName(_level);
+      size_t levelSize = strlen(levelName);
+      int usualSize = _stampedTail.size + static_cast<int>(levelSize) + 2;
+      size_t size = static_cast<size_t>(usualSize) + subsystem.size() + 3;
+      if (usualSize >= kPrefixLimit || size > static_cast<size_t>(kPrefixCache)) return;
+      char* out = _prefix;
+      memcpy(out, _stampedTail.data, static_cast<size_t>(_stampedTail.size));
+      out += _stampedTail.size;
+      memcpy(out, levelName, levelSize);
+      out += levelSize;
+      memcpy(out, " '", 2);
+      out += 2;
+      _prefixNameAt = static_cast<int>(out - _prefix);
+      _prefixNameSize = static_cast<int>(subsystem.size());
+      memcpy(out, subsystem.data(), subsystem.size());
+      out += subsystem.size();
+      memcpy(out, "'] ", 3);
+      _prefixLevel = _level;
+      _prefixSize = static_cast<int>(size);
+   }
+
    const void* const _threadId;
    char _chunk[kChunkSize];
    int _chunkPos = 0;
@@ -249,6 +304,13 @@ private:
    // Both with room for the milliseconds between them.
    BoundedText _stampedTail;
    char _threadText[24];
+   // The whole usual prefix of _prefixLevel for the subsystem name at _prefixNameAt, as
+   // of _second; empty when not made yet or not cacheable.
+   char _prefix[kPrefixCache] = {};
+   int _prefixSize = 0;
+   int _prefixNameAt = 0;
+   int _prefixNameSize = 0;
+   Logger::CombinedLevel _prefixLevel = 0;
 };
 
 // The calling thread's line writers, one per nesting depth, and its log context. Kept in
@@ -361,8 +423,12 @@ void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
    }
    try {
       Writer* line = logger->GetLineWriter();
-      // The line writer buffers the line anyway: one Write for the message, not one a piece.
-      MessageFormatter::PrintArgsJoined(line ? line : logger, format, args, count);
+      // This thread's own line writer takes a message of plain arguments into its chunk
+      // as it is formatted; any other goes through one Write per joined run.
+      TlsBufferedLogWriter* own = t_state ? t_state->Top() : nullptr;
+      if (own == nullptr || line != own || !own->WritePlain(format, args, count)) {
+         MessageFormatter::PrintArgsJoined(line ? line : logger, format, args, count);
+      }
    } catch (...) {
       // A bad argument or format ends the line here; logging never throws.
    }

@@ -130,6 +130,53 @@ TEST(MessageFormatterTest, JoinedWalkWritesThePlainTextInFewerPieces) {
    EXPECT_EQ("before ", before.Text());
 }
 
+// The in-place walk (a log line's chunk) writes what the plain walk writes, and declines
+// (so that the caller starts over) whatever it cannot finish alone: no room left, a kind
+// of argument that writes itself, a conversion option, a null string, a bad placeholder.
+TEST(MessageFormatterTest, PlainWalkIntoABufferMatchesThePlainWalkOrDeclines) {
+   auto into = [](const char* format, std::initializer_list<PrintFormatter> args,
+                  size_t capacity = 512) {
+      std::string buffer(capacity, '\0');
+      int length = MessageFormatter::PrintPlainArgs(buffer.data(), capacity, format,
+                                                    args.begin(), static_cast<int>(args.size()));
+      if (length < 0) return std::string("declined");
+      EXPECT_LE(static_cast<size_t>(length), capacity);
+      return buffer.substr(0, static_cast<size_t>(length));
+   };
+   auto plain = [](const char* format, std::initializer_list<PrintFormatter> args) {
+      PieceWriter writer;
+      MessageFormatter::PrintArgs(&writer, format, args.begin(), static_cast<int>(args.size()));
+      return writer.Text();
+   };
+   std::string stl = "stl", empty, longer(40, 'l');
+   const char* text = "text of nineteen ch";
+   const char* formats[] = {"a %1 b %2 c %3 d %4 e %5 %6 %7 %8 %9%%", "%9%8%7%6%5%4%3%2%1",
+                            "%0 %x %10 end%", "", "no placeholders at all, some 35 chars"};
+   for (const char* format : formats) {
+      std::initializer_list<PrintFormatter> args = {INT_MIN, UINT_MAX, LLONG_MIN, ULLONG_MAX, 'z',
+                                                    true, stl, text, longer};
+      EXPECT_EQ(plain(format, args), into(format, args)) << format;
+   }
+   EXPECT_EQ("false||", into("%1|%2|%3", {false, empty, ""}));
+
+   // Exactly enough room, and one byte short at each kind of piece.
+   EXPECT_EQ("id 12345 ok", into("id %1 ok", {12345}, 11));
+   EXPECT_EQ("declined", into("id %1 ok", {"12345"}, 10));
+   EXPECT_EQ("declined", into("id %1", {12345}, 7));
+   EXPECT_EQ("id -1", into("id %1", {-1}, 5));
+   EXPECT_EQ("declined", into("100%%", {1}, 3));
+   EXPECT_EQ("declined", into("%x", {1}, 1));
+
+   // Declined before the argument is formatted: its formatting would throw here.
+   ThrowingObject object;
+   const char* nullString = nullptr;
+   EXPECT_EQ("declined", into("%1 %2", {1, &object}));
+   EXPECT_EQ("declined", into("%1", {2.5}));
+   EXPECT_EQ("declined", into("%1", {PrintFormatter(42, "%05d")}));
+   EXPECT_EQ("declined", into("%1", {nullString}));
+   EXPECT_EQ("declined", into("%1 %2", {1}));
+}
+
 TEST(MessageFormatterTest, LongOutputIsComplete) {
    std::string piece(300, 'x');
    std::string text = MessageFormatter::ASPrint("<%1|%1>", piece);

@@ -47,6 +47,35 @@ TEST(LogLineTest, PrefixHasDateTimeBiasThreadLevelSubsystemAndThisThreadsContext
    EXPECT_EQ(t.target->pieces.size(), 3u);  // a short line reaches the output in one piece
 }
 
+// One thread alternating between loggers of names of one length, between levels, and a
+// name too long for the prefix kept per thread: each line names its own logger and level.
+TEST(LogLineTest, EachLineNamesItsOwnLoggerAndLevelWhateverCameBefore) {
+   TestLogger t("trivia");
+   Ref<Logger> same, other, longName;
+   t.logger->CreateLogger("abc", same);
+   t.logger->CreateLogger("abd", other);
+   t.logger->CreateLogger(std::string(90, 'n'), longName);
+   for (Logger* logger : {same.Get(), other.Get(), longName.Get()}) {
+      ASSERT_TRUE(logger->SetLevelByName("trivia"));
+   }
+   ASSERT_EQ(same->GetSubsystemName().size(), other->GetSubsystemName().size());
+   ASSERT_EQ(same->GetLogOutput(), t.logger->GetLogOutput());
+   Logger* order[] = {same.Get(), other.Get(), longName.Get(), same.Get(), same.Get()};
+   const char* levels[] = {"info", "info", "warning", "warning", "trivia"};
+   PELMORA_LOG_INFO(order[0], "n=%1", 0);
+   PELMORA_LOG_INFO(order[1], "n=%1", 1);
+   PELMORA_LOG_WARNING(order[2], "n=%1", 2);
+   PELMORA_LOG_WARNING(order[3], "n=%1", 3);
+   PELMORA_LOG_TRIVIA(order[4], "n=%1", 4);
+   std::vector<std::string> lines = t.Lines();
+   ASSERT_EQ(lines.size(), 5u);
+   for (size_t i = 0; i < lines.size(); ++i) {
+      std::string rest = std::string(levels[i]) + " '" + order[i]->GetSubsystemName() +
+                         "'\\] n=" + std::to_string(i);
+      EXPECT_TRUE(Matches(lines[i], rest)) << lines[i];
+   }
+}
+
 TEST(LogLineTest, UnwantedLevelFormatsAndEvaluatesNothing) {
    TestLogger t("info");
    t.logger->SetMemLevelByName("info");  // verbose is wanted nowhere

@@ -34,6 +34,13 @@ public:
    // writers that buffer anyway and pay per call (a log line).
    static void PrintArgsJoined(Writer* writer, const char* format, const PrintFormatter* args,
                                int count);
+   // The same text straight into `buffer`, for the plain forms of the common types only
+   // (integers, characters, strings, booleans): the length written, or -1 when the text
+   // needs more than `capacity` bytes, an argument of another kind or a bad placeholder.
+   // Then nothing has been formatted that has side effects, and the caller starts over
+   // with PrintArgsJoined.
+   static int PrintPlainArgs(char* buffer, size_t capacity, const char* format,
+                             const PrintFormatter* args, int count);
    static std::string ASPrintArgs(const char* format, const PrintFormatter* args, int count);
 };
 
