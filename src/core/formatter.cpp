@@ -113,34 +113,14 @@ private:
 
 }  // namespace
 
-PrintFormatter::PrintFormatter(bool value, const char* option)
-    : PrintFormatter(FormatValue{.boolean = value}, option, FormatBoolean) {}
-PrintFormatter::PrintFormatter(char value, const char* option)
-    : PrintFormatter(FormatValue{.character = value}, option, FormatChar) {}
-PrintFormatter::PrintFormatter(int value, const char* option)
-    : PrintFormatter(FormatValue{.int32 = value}, option, FormatInt) {}
-PrintFormatter::PrintFormatter(unsigned int value, const char* option)
-    : PrintFormatter(FormatValue{.uint32 = value}, option, FormatUInt) {}
-PrintFormatter::PrintFormatter(long value, const char* option)
-    : PrintFormatter(FormatValue{.int64 = value}, option, FormatLong) {}
-PrintFormatter::PrintFormatter(unsigned long value, const char* option)
-    : PrintFormatter(FormatValue{.uint64 = value}, option, FormatULong) {}
-PrintFormatter::PrintFormatter(long long value, const char* option)
-    : PrintFormatter(FormatValue{.int64 = value}, option, FormatLong) {}
-PrintFormatter::PrintFormatter(unsigned long long value, const char* option)
-    : PrintFormatter(FormatValue{.uint64 = value}, option, FormatULong) {}
 PrintFormatter::PrintFormatter(float value, const char* option)
     : PrintFormatter(FormatValue{.float32 = value}, option, FormatFloat) {}
 PrintFormatter::PrintFormatter(double value, const char* option)
     : PrintFormatter(FormatValue{.float64 = value}, option, FormatDouble) {}
 PrintFormatter::PrintFormatter(const void* value, const char* option)
     : PrintFormatter(FormatValue{.pointer = value}, option, FormatPtr) {}
-PrintFormatter::PrintFormatter(const char* value, const char* option)
-    : PrintFormatter(FormatValue{.string = value}, option, FormatString) {}
 PrintFormatter::PrintFormatter(std::nullptr_t, const char* option)
     : PrintFormatter(FormatValue{.string = nullptr}, option, FormatString) {}
-PrintFormatter::PrintFormatter(const std::string& value, const char* option)
-    : PrintFormatter(FormatValue{.stlString = &value}, option, FormatSTLString) {}
 PrintFormatter::PrintFormatter(const std::string_view& value, const char* option)
     : PrintFormatter(FormatValue{.stringView = &value}, option, FormatStringView) {}
 PrintFormatter::PrintFormatter(const Object* value, const char* option)

@@ -160,17 +160,6 @@ void CreateMemLogWriter(const std::string&, int sizeK, const std::string& level,
 
 // ---- the output lock
 
-const void* LogOutputLock::Self() {
-   // The address of a thread-local object names the thread without a system call;
-   // initial-exec makes it one load instead of a call, twice on every line.
-   [[gnu::tls_model("initial-exec")]] static thread_local char marker;
-   return &marker;
-}
-
-bool LogOutputLock::IsWriteLockedByMe() const {
-   return _owner.load(std::memory_order_relaxed) == Self();
-}
-
 uint32_t LogOutputLock::Await(uint32_t seen) {
    if (!(seen & kWaiting) &&
        !_state.compare_exchange_strong(seen, seen | kWaiting, std::memory_order_relaxed)) {
@@ -232,12 +221,7 @@ void LogOutputLock::ReadUnlock() {
    }
 }
 
-void LogOutputLock::WriteLock() {
-   const void* self = Self();
-   if (_owner.load(std::memory_order_relaxed) == self) {
-      ++_depth;
-      return;
-   }
+void LogOutputLock::WriteLockContended(const void* self) {
    uint32_t state = 0;
    int spins = kLogLockSpins;
    // A waiting mark alone does not keep a writer out; it stays for the others.
@@ -259,13 +243,6 @@ void LogOutputLock::WriteLock() {
    }
    _owner.store(self, std::memory_order_relaxed);
    _depth = 1;
-}
-
-void LogOutputLock::WriteUnlock() {
-   PELMORA_VERIFY(IsWriteLockedByMe());
-   if (--_depth > 0) return;
-   _owner.store(nullptr, std::memory_order_relaxed);
-   if (_state.exchange(0, std::memory_order_release) & kWaiting) _state.notify_all();
 }
 
 // ---- outputs

@@ -169,17 +169,43 @@ public:
    void ReadLock();
    // False when a writer holds the lock.
    bool TryReadLock();
-   void WriteLock();
+   // Inline where it costs one compare-and-swap: every line takes it.
+   void WriteLock() {
+      const void* self = Self();
+      if (_owner.load(std::memory_order_relaxed) == self) {
+         ++_depth;
+         return;
+      }
+      uint32_t state = 0;
+      if (!_state.compare_exchange_strong(state, kWriter, std::memory_order_acquire,
+                                          std::memory_order_relaxed)) {
+         return WriteLockContended(self);
+      }
+      _owner.store(self, std::memory_order_relaxed);
+      _depth = 1;
+   }
    void ReadUnlock();
-   void WriteUnlock();
-   bool IsWriteLockedByMe() const;
+   void WriteUnlock() {
+      PELMORA_VERIFY(IsWriteLockedByMe());
+      if (--_depth > 0) return;
+      _owner.store(nullptr, std::memory_order_relaxed);
+      if (_state.exchange(0, std::memory_order_release) & kWaiting) _state.notify_all();
+   }
+   bool IsWriteLockedByMe() const { return _owner.load(std::memory_order_relaxed) == Self(); }
 
 private:
    static constexpr uint32_t kWriter = 1u << 31;
    static constexpr uint32_t kWaiting = 1u << 30;  // someone sleeps on _state
    static constexpr uint32_t kReaders = kWaiting - 1;
 
-   static const void* Self();
+   // The address of a thread-local object names the thread without a system call;
+   // initial-exec makes it one load instead of a call.
+   static const void* Self() {
+      [[gnu::tls_model("initial-exec")]] static thread_local char marker;
+      return &marker;
+   }
+   // WriteLock when the lock was not free at first sight.
+   void WriteLockContended(const void* self);
    // Sleeps until _state differs from `seen`, after marking that someone waits; returns
    // the state found then.
    uint32_t Await(uint32_t seen);

@@ -37,6 +37,37 @@ void CopyBytes(char* to, const char* from, size_t length) {
    Internal::CopyShort(to, from, length);
 }
 
+// "000" to "999", three divisions fewer a line.
+struct MillisTexts {
+   constexpr MillisTexts() : text() {
+      for (int i = 0; i < 1000; ++i) {
+         text[i][0] = static_cast<char>('0' + i / 100);
+         text[i][1] = static_cast<char>('0' + i / 10 % 10);
+         text[i][2] = static_cast<char>('0' + i % 10);
+      }
+   }
+   char text[1000][4];
+};
+constexpr MillisTexts kMillisTexts;
+
+// Whether `a` and `b` hold the same `length` bytes; subsystem names are short, and the
+// overlapping word compares cost less than a call.
+bool SameText(const char* a, const char* b, size_t length) {
+   auto same = [a, b](size_t at, auto word) {
+      decltype(word) x, y;
+      memcpy(&x, a + at, sizeof(x));
+      memcpy(&y, b + at, sizeof(y));
+      return x == y;
+   };
+   if (length > 16) return memcmp(a, b, length) == 0;
+   if (length >= 8) return same(0, uint64_t()) && same(length - 8, uint64_t());
+   if (length >= 4) return same(0, uint32_t()) && same(length - 4, uint32_t());
+   for (size_t i = 0; i < length; ++i) {
+      if (a[i] != b[i]) return false;
+   }
+   return true;
+}
+
 // Builds one line for one output at a time, Begin to End. The chunk holds the line until
 // it fills; a line that fits reaches the output in one locked call, a longer one keeps
 // the output's write lock from its first flush to its end.
@@ -201,19 +232,17 @@ private:
       // kPrefixLimit bytes with its terminator as a bounded printf would; assembled from
       // the cached texts because a printf here costs a third of a short line.
       unsigned millis = static_cast<unsigned>(now.tv_nsec / 1000000) % 1000u;
-      char millisText[3] = {static_cast<char>('0' + millis / 100),
-                            static_cast<char>('0' + millis / 10 % 10),
-                            static_cast<char>('0' + millis % 10)};
+      const char* millisText = kMillisTexts.text[millis];
       if (context.empty()) {
          if (_prefixSize == 0 || _prefixLevel != _level ||
              subsystem.size() != static_cast<size_t>(_prefixNameSize) ||
-             memcmp(subsystem.data(), _prefix + _prefixNameAt, subsystem.size()) != 0) {
+             !SameText(subsystem.data(), _prefix + _prefixNameAt, subsystem.size())) {
             CachePrefix(subsystem);
          }
          if (_prefixSize > 0 && kChunkSize - _chunkPos >= kPrefixCache) {
             char* out = _chunk + _chunkPos;
             memcpy(out, _prefix, kPrefixCache);
-            memcpy(out + _stamp.size, millisText, sizeof(millisText));
+            memcpy(out + _stamp.size, millisText, 3);
             _chunkPos += _prefixSize;
             return;
          }
@@ -227,7 +256,7 @@ private:
          // set into the cached text of this second.
          char* out = _chunk + _chunkPos;
          CopyBytes(out, _stampedTail.data, static_cast<size_t>(_stampedTail.size));
-         memcpy(out + _stamp.size, millisText, sizeof(millisText));
+         memcpy(out + _stamp.size, millisText, 3);
          out += _stampedTail.size;
          CopyBytes(out, levelName, levelSize);
          out += levelSize;
@@ -240,7 +269,7 @@ private:
          return;
       }
       BoundedText head = _stamp;
-      head.Append(millisText, sizeof(millisText));
+      head.Append(millisText, 3);
       head.Append(_tail.data, static_cast<size_t>(_tail.size));
       head.Append(levelName, levelSize);
       head.Append(" '", 2);

@@ -43,20 +43,31 @@ public:
    };
    using FormatFunction = void (*)(Writer*, const FormatValue&, const char* option);
 
-   PrintFormatter(bool value, const char* option = nullptr);
-   PrintFormatter(char value, const char* option = nullptr);
-   PrintFormatter(int value, const char* option = nullptr);
-   PrintFormatter(unsigned int value, const char* option = nullptr);
-   PrintFormatter(long value, const char* option = nullptr);
-   PrintFormatter(unsigned long value, const char* option = nullptr);
-   PrintFormatter(long long value, const char* option = nullptr);
-   PrintFormatter(unsigned long long value, const char* option = nullptr);
+   // Inline, as every log call builds one per argument.
+   PrintFormatter(bool value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.boolean = value}, option, FormatBoolean) {}
+   PrintFormatter(char value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.character = value}, option, FormatChar) {}
+   PrintFormatter(int value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.int32 = value}, option, FormatInt) {}
+   PrintFormatter(unsigned int value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.uint32 = value}, option, FormatUInt) {}
+   PrintFormatter(long value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.int64 = value}, option, FormatLong) {}
+   PrintFormatter(unsigned long value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.uint64 = value}, option, FormatULong) {}
+   PrintFormatter(long long value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.int64 = value}, option, FormatLong) {}
+   PrintFormatter(unsigned long long value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.uint64 = value}, option, FormatULong) {}
    PrintFormatter(float value, const char* option = nullptr);
    PrintFormatter(double value, const char* option = nullptr);
    PrintFormatter(const void* value, const char* option = nullptr);
-   PrintFormatter(const char* value, const char* option = nullptr);
+   PrintFormatter(const char* value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.string = value}, option, FormatString) {}
    PrintFormatter(std::nullptr_t, const char* option = nullptr);
-   PrintFormatter(const std::string& value, const char* option = nullptr);
+   PrintFormatter(const std::string& value, const char* option = nullptr)
+      : PrintFormatter(FormatValue{.stlString = &value}, option, FormatSTLString) {}
    PrintFormatter(const std::string_view& value, const char* option = nullptr);
    PrintFormatter(const Object* value, const char* option = nullptr);
    PrintFormatter(const Object& value, const char* option = nullptr);
