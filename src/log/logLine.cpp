@@ -181,56 +181,7 @@ private:
                        const std::map<std::string, std::string>& context) {
       struct timespec now;
       clock_gettime(CLOCK_REALTIME, &now);
-      if (now.tv_sec != _second) {
-         // localtime_r takes a process-wide lock: once a second per thread is enough.
-         struct tm local;
-         localtime_r(&now.tv_sec, &local);
-         _second = now.tv_sec;
-         _prefixSize = 0;
-         if (local.tm_year != _dateYear || local.tm_mon != _dateMonth ||
-             local.tm_mday != _dateDay) {
-            snprintf(_dateText, sizeof(_dateText), "%04u-%02u-%02u",
-                     static_cast<unsigned>(local.tm_year + 1900) % 10000u,
-                     static_cast<unsigned>(local.tm_mon + 1) % 100u,
-                     static_cast<unsigned>(local.tm_mday) % 100u);
-            _dateYear = local.tm_year;
-            _dateMonth = local.tm_mon;
-            _dateDay = local.tm_mday;
-         }
-         if (local.tm_gmtoff != _bias || _biasText[0] == 0) {
-            long bias = local.tm_gmtoff;
-            char sign = bias < 0 ? '-' : '+';
-            if (bias < 0) bias = -bias;
-            snprintf(_biasText, sizeof(_biasText), "%c%02lu:%02lu", sign,
-                     static_cast<unsigned long>(bias / 3600) % 100ul,
-                     static_cast<unsigned long>(bias / 60) % 60ul);
-            _bias = local.tm_gmtoff;
-         }
-         snprintf(_secondText, sizeof(_secondText), "%02u:%02u:%02u.",
-                  static_cast<unsigned>(local.tm_hour) % 100u,
-                  static_cast<unsigned>(local.tm_min) % 100u,
-                  static_cast<unsigned>(local.tm_sec) % 100u);
-         // What the prefix holds before and after the milliseconds, for the next lines
-         // of this second.
-         BoundedText stamp;
-         stamp.Append(_dateText);
-         stamp.Append("T");
-         stamp.Append(_secondText);
-         _stamp = stamp;
-         BoundedText tail;
-         tail.Append(_biasText);
-         tail.Append(" [");
-         tail.Append(_threadText);
-         tail.Append(" ");
-         _tail = tail;
-         BoundedText stampedTail = stamp;
-         stampedTail.Append("000");
-         stampedTail.Append(tail.data, static_cast<size_t>(tail.size));
-         _stampedTail = stampedTail;
-      }
-      // "%sT%s%s [%p %s '" with the date, time, bias, thread and level texts, bounded to
-      // kPrefixLimit bytes with its terminator as a bounded printf would; assembled from
-      // the cached texts because a printf here costs a third of a short line.
+      if (now.tv_sec != _second) NewSecond(now.tv_sec);
       unsigned millis = static_cast<unsigned>(now.tv_nsec / 1000000) % 1000u;
       const char* millisText = kMillisTexts.text[millis];
       if (context.empty()) {
@@ -247,6 +198,64 @@ private:
             return;
          }
       }
+      WriteFullPrefix(subsystem, context, millisText);
+   }
+
+   // Out of line, so that the usual line pays for neither its frame nor its code.
+   [[gnu::noinline]] void NewSecond(time_t second) {
+      struct tm local;
+      // localtime_r takes a process-wide lock: once a second per thread is enough.
+      localtime_r(&second, &local);
+      _second = second;
+      _prefixSize = 0;
+      if (local.tm_year != _dateYear || local.tm_mon != _dateMonth ||
+          local.tm_mday != _dateDay) {
+         snprintf(_dateText, sizeof(_dateText), "%04u-%02u-%02u",
+                  static_cast<unsigned>(local.tm_year + 1900) % 10000u,
+                  static_cast<unsigned>(local.tm_mon + 1) % 100u,
+                  static_cast<unsigned>(local.tm_mday) % 100u);
+         _dateYear = local.tm_year;
+         _dateMonth = local.tm_mon;
+         _dateDay = local.tm_mday;
+      }
+      if (local.tm_gmtoff != _bias || _biasText[0] == 0) {
+         long bias = local.tm_gmtoff;
+         char sign = bias < 0 ? '-' : '+';
+         if (bias < 0) bias = -bias;
+         snprintf(_biasText, sizeof(_biasText), "%c%02lu:%02lu", sign,
+                  static_cast<unsigned long>(bias / 3600) % 100ul,
+                  static_cast<unsigned long>(bias / 60) % 60ul);
+         _bias = local.tm_gmtoff;
+      }
+      snprintf(_secondText, sizeof(_secondText), "%02u:%02u:%02u.",
+               static_cast<unsigned>(local.tm_hour) % 100u,
+               static_cast<unsigned>(local.tm_min) % 100u,
+               static_cast<unsigned>(local.tm_sec) % 100u);
+      // What the prefix holds before and after the milliseconds, for the next lines
+      // of this second.
+      BoundedText stamp;
+      stamp.Append(_dateText);
+      stamp.Append("T");
+      stamp.Append(_secondText);
+      _stamp = stamp;
+      BoundedText tail;
+      tail.Append(_biasText);
+      tail.Append(" [");
+      tail.Append(_threadText);
+      tail.Append(" ");
+      _tail = tail;
+      BoundedText stampedTail = stamp;
+      stampedTail.Append("000");
+      stampedTail.Append(tail.data, static_cast<size_t>(tail.size));
+      _stampedTail = stampedTail;
+   }
+
+   // "%sT%s%s [%p %s '" with the date, time, bias, thread and level texts, bounded to
+   // kPrefixLimit bytes with its terminator as a bounded printf would; assembled from
+   // the cached texts because a printf here costs a third of a short line.
+   [[gnu::noinline]] void WriteFullPrefix(const std::string& subsystem,
+                                          const std::map<std::string, std::string>& context,
+                                          const char* millisText) {
       const char* levelName = GetCombinedLevelName(_level);
       size_t levelSize = strlen(levelName);
       int usualSize = _stampedTail.size + static_cast<int>(levelSize) + 2;
