@@ -93,12 +93,12 @@ private:
 // is not running there held it at fork time.
 class LogManagerMutex final : public virtual System::Mutex, public ObjectImpl {
 public:
-   void Lock() PELMORA_ACQUIRE() override PELMORA_NO_THREAD_SAFETY_ANALYSIS {
+   void Lock() PELMORA_ACQUIRE() PELMORA_NO_THREAD_SAFETY_ANALYSIS override {
       PELMORA_VERIFY(!IsLocked());
       _word.lock();
       _owner.store(pthread_self(), std::memory_order_relaxed);
    }
-   void Unlock() PELMORA_RELEASE() override PELMORA_NO_THREAD_SAFETY_ANALYSIS {
+   void Unlock() PELMORA_RELEASE() PELMORA_NO_THREAD_SAFETY_ANALYSIS override {
       PELMORA_VERIFY(IsLocked());
       _owner.store(0, std::memory_order_relaxed);
       _word.unlock();
