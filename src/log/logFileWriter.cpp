@@ -245,6 +245,10 @@ private:
          // Renames that find no file (one deleted from outside) cost a call each, at
          // most one per index up to the highest present.
          int top = std::min(_highestRolled + 1, _options.maxFileNum - 1);
+         // The file that falls out goes first: a rename over an existing file makes the
+         // file system write the renamed one out at once (tens of milliseconds for a
+         // large log, with every logging thread waiting), a rename to a free name does not.
+         unlink(RolledName(_options.path, top).c_str());
          for (int i = top; i >= 2; --i) {
             _ops.rename(RolledName(_options.path, i - 1).c_str(),
                         RolledName(_options.path, i).c_str());

@@ -211,6 +211,24 @@ TEST(LogFileWriterTest, RollRenamesOnlyTheRolledFilesThereAre) {
    EXPECT_FALSE(fs::exists(options.path + ".6"));
 }
 
+TEST(LogFileWriterTest, RollDropsTheOldestFileBeforeRenamingNoneOverAnother) {
+   Files f;
+   LogFileOptions options;
+   options.maxFileSize = 1;
+   options.maxFileNum = 3;
+   options.bufferSize = 0;
+   f.AddFile(options, "full.log", FileOps::Ops());
+   FileOps::renamesOverFiles = 0;
+   for (int i = 0; i < 6; ++i) PELMORA_LOG_INFO(f.logger.Get(), "line %1", i);
+   EXPECT_EQ(FileOps::renamesOverFiles, 0);
+   for (int i = 0; i < 3; ++i) {
+      std::string name = options.path + (i == 0 ? "" : "." + std::to_string(i));
+      EXPECT_NE(ReadFile(name).find("] line " + std::to_string(5 - i) + "\n"), std::string::npos)
+          << name;
+   }
+   EXPECT_FALSE(fs::exists(options.path + ".3"));
+}
+
 TEST(LogFileWriterTest, SlowDiskUnderTheFlusherHoldsUpOnlyItsOwnWriter) {
    Files f;
    LogFileOptions options;

@@ -144,8 +144,11 @@ struct FileOps {
       }
       return ::write(fd, data, length);
    }
+   static inline std::atomic<int> renamesOverFiles{0};
+
    static int Rename(const char* from, const char* to) {
       ++renames;
+      if (access(to, F_OK) == 0) ++renamesOverFiles;
       return ::rename(from, to);
    }
    static const LogFileOps& Ops() {
