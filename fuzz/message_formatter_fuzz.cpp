@@ -3,7 +3,8 @@
 // with a fuzzed conversion text. Only InvalidFormatStringException may leave a formatting
 // call; any other exception escapes and ends the run as a crash. The walk that joins
 // pieces must write what the plain walk writes, and so must the walk into a buffer (of a
-// size from the input's first byte) whenever it does not decline.
+// size from the input's first byte) whenever it does not decline, and the walk over the
+// parsed format whenever the format could be parsed.
 
 #include <algorithm>
 #include <cstdint>
@@ -106,6 +107,22 @@ void CheckBufferWalk(const std::string& format, const std::vector<PrintFormatter
    Check(buffer.substr(0, static_cast<size_t>(length)) == plain.text, "buffer walk");
 }
 
+// The walk over the parsed format agrees with the walk into a buffer: the same length or
+// decline, the same bytes, nothing past `capacity`.
+void CheckParsedWalk(const std::string& format, const std::vector<PrintFormatter>& args,
+                     size_t capacity) {
+   ParsedFormat parsed;
+   if (!ParsedFormat::Parse(format.c_str(), parsed)) return;
+   int count = static_cast<int>(args.size());
+   std::string expected(capacity + 16, '#'), buffer(capacity + 16, '#');
+   int expectedLength =
+       MessageFormatter::PrintPlainArgs(expected.data(), capacity, format.c_str(), args.data(), count);
+   int length = MessageFormatter::PrintPlainParsed(buffer.data(), capacity, parsed, args.data(), count);
+   Check(buffer.compare(capacity, 16, std::string(16, '#')) == 0, "parsed walk stays in room");
+   Check(length == expectedLength, "parsed walk length");
+   if (length >= 0) Check(buffer.compare(0, length, expected, 0, length) == 0, "parsed walk");
+}
+
 template <class T>
 void CheckDefault(const PrintFormatter& formatter, const char* printfFormat, T value) {
    char expected[64];
@@ -205,6 +222,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
    }
    CheckJoinedWalk(format, args);
    CheckBufferWalk(format, args, capacity);
+   CheckParsedWalk(format, args, capacity);
    for (const PrintFormatter& arg : args) {
       try {
          std::string text;

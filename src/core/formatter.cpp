@@ -404,6 +404,42 @@ void MessageFormatter::PrintArgsJoined(Writer* writer, const char* format,
    pieces.Drain();
 }
 
+namespace {
+
+// Appends the plain form of `arg` at `out`: 1 when done, 0 when it does not fit, -1 when
+// the argument is not of a plain kind.
+int AppendPlainArgument(char*& out, char* end, const PrintFormatter::FormatValue& value,
+                        PrintFormatter::FormatFunction function, const char* option) {
+   auto append = [&out, end](const char* data, size_t length) {
+      if (length > static_cast<size_t>(end - out)) return 0;
+      Internal::CopyShort(out, data, length);
+      out += length;
+      return 1;
+   };
+   if (function == PrintFormatter::FormatSTLString && value.stlString) {
+      return append(value.stlString->data(), value.stlString->size());
+   }
+   if (function == PrintFormatter::FormatString && value.string) {
+      return append(value.string, std::strlen(value.string));
+   }
+   if (option != nullptr) return -1;
+   if (function == PrintFormatter::FormatInt) return AppendNumber(out, end, value.int32);
+   if (function == PrintFormatter::FormatUInt) return AppendNumber(out, end, value.uint32);
+   if (function == PrintFormatter::FormatLong) return AppendNumber(out, end, value.int64);
+   if (function == PrintFormatter::FormatULong) return AppendNumber(out, end, value.uint64);
+   if (function == PrintFormatter::FormatChar) {
+      if (out == end) return 0;
+      *out++ = value.character;
+      return 1;
+   }
+   if (function == PrintFormatter::FormatBoolean) {
+      return value.boolean ? append("true", 4) : append("false", 5);
+   }
+   return -1;
+}
+
+}  // namespace
+
 int MessageFormatter::PrintPlainArgs(char* buffer, size_t capacity, const char* format,
                                      const PrintFormatter* args, int count) {
    char* out = buffer;
@@ -435,32 +471,56 @@ int MessageFormatter::PrintPlainArgs(char* buffer, size_t capacity, const char* 
       int number = next - '0';
       if (number > count) return -1;
       const PrintFormatter& arg = args[number - 1];
-      const PrintFormatter::FormatValue& value = arg._value;
-      PrintFormatter::FormatFunction function = arg._function;
-      bool done;
-      if (function == PrintFormatter::FormatSTLString && value.stlString) {
-         done = append(value.stlString->data(), value.stlString->size());
-      } else if (function == PrintFormatter::FormatString && value.string) {
-         done = append(value.string, std::strlen(value.string));
-      } else if (arg._option != nullptr) {
-         return -1;
-      } else if (function == PrintFormatter::FormatInt) {
-         done = AppendNumber(out, end, value.int32);
-      } else if (function == PrintFormatter::FormatUInt) {
-         done = AppendNumber(out, end, value.uint32);
-      } else if (function == PrintFormatter::FormatLong) {
-         done = AppendNumber(out, end, value.int64);
-      } else if (function == PrintFormatter::FormatULong) {
-         done = AppendNumber(out, end, value.uint64);
-      } else if (function == PrintFormatter::FormatChar) {
-         done = out != end;
-         if (done) *out++ = value.character;
-      } else if (function == PrintFormatter::FormatBoolean) {
-         done = value.boolean ? append("true", 4) : append("false", 5);
+      if (AppendPlainArgument(out, end, arg._value, arg._function, arg._option) <= 0) return -1;
+   }
+   return static_cast<int>(out - buffer);
+}
+
+bool ParsedFormat::Parse(const char* format, ParsedFormat& out) {
+   out.format = format;
+   out.count = 0;
+   out.arguments = 0;
+   size_t run = 0;  // where the current literal run starts
+   size_t at = 0;
+   auto add = [&out](size_t start, size_t length, int argument) {
+      if (out.count == kMaxPieces) return false;
+      out.pieces[out.count++] = {static_cast<uint16_t>(start), static_cast<uint16_t>(length),
+                                 static_cast<int8_t>(argument)};
+      return true;
+   };
+   for (;;) {
+      const char* percent = strchrnul(format + at, '%');
+      size_t position = static_cast<size_t>(percent - format);
+      if (position > 0xFFFF) return false;
+      char next = *percent == '\0' ? '\0' : percent[1];
+      if (next == '\0') return add(run, position - run, -1);  // a lone '%' ends the text
+      if (next >= '1' && next <= '9') {
+         if (!add(run, position - run, next - '1')) return false;
+         if (next - '0' > out.arguments) out.arguments = next - '0';
+         run = at = position + 2;
+      } else if (next == '%') {
+         // The first '%' ends the run; the second is skipped.
+         if (!add(run, position + 1 - run, -1)) return false;
+         run = at = position + 2;
       } else {
-         return -1;
+         at = position + 2;  // "%x" stays in the run as it is
       }
-      if (!done) return -1;
+   }
+}
+
+int MessageFormatter::PrintPlainParsed(char* buffer, size_t capacity, const ParsedFormat& parsed,
+                                       const PrintFormatter* args, int count) {
+   if (parsed.arguments > count) return -1;
+   char* out = buffer;
+   char* const end = buffer + capacity;
+   const ParsedFormat::Piece* piece = parsed.pieces;
+   for (const ParsedFormat::Piece* last = piece + parsed.count; piece != last; ++piece) {
+      if (piece->length > static_cast<size_t>(end - out)) return -1;
+      Internal::CopyShort(out, parsed.format + piece->at, piece->length);
+      out += piece->length;
+      if (piece->argument < 0) continue;
+      const PrintFormatter& arg = args[piece->argument];
+      if (AppendPlainArgument(out, end, arg._value, arg._function, arg._option) <= 0) return -1;
    }
    return static_cast<int>(out - buffer);
 }

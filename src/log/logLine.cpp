@@ -9,6 +9,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <new>
 #include <vector>
 
 #include "pelmora/exception/panic.h"
@@ -91,10 +92,12 @@ public:
       snprintf(_threadText, sizeof(_threadText), "%p", _threadId);
    }
 
-   void Begin(Logger::CombinedLevel level, const std::string& subsystem, LogOutput* output,
-              const std::map<std::string, std::string>& context) {
+   // `logger` began the line; LogInternal knows its own lines by it.
+   void Begin(const Logger* logger, Logger::CombinedLevel level, const std::string& subsystem,
+              LogOutput* output, const std::map<std::string, std::string>& context) {
       if (output == nullptr) PanicVerify("__null != output", __FILE__, __LINE__);
       if (_output) PanicVerify("__null == _output", __FILE__, __LINE__);
+      _begunBy = logger;
       _output = output;
       _level = level;
       _locked = false;
@@ -132,6 +135,15 @@ public:
 
    void Close() override {}
 
+   // As WritePlain, over a parsed format.
+   bool WriteParsed(const ParsedFormat& parsed, const PrintFormatter* args, int count) {
+      size_t room = static_cast<size_t>(std::min(kChunkSize - _chunkPos, kLargePiece));
+      int length = MessageFormatter::PrintPlainParsed(_chunk + _chunkPos, room, parsed, args, count);
+      if (length < 0) return false;
+      _chunkPos += length;
+      return true;
+   }
+
    // Formats a message of plain arguments straight into the chunk; false (and nothing
    // written) when it needs the general walk. A message longer than a large piece goes
    // that way too, so that it reaches the output as it always has.
@@ -154,6 +166,7 @@ public:
             }
             self->_chunkPos = 0;
             self->_output = nullptr;
+            self->_begunBy = nullptr;
          }
       } release{this};
       if (g_fastPath.load(std::memory_order_relaxed) && !_locked) {
@@ -175,6 +188,7 @@ public:
    }
 
    bool IsActive() const { return _output != nullptr; }
+   const Logger* BegunBy() const { return _begunBy; }
 
 private:
    void WriteLogPrefix(const std::string& subsystem,
@@ -325,6 +339,7 @@ private:
    // Kept alive by the logger that began the line; a counted reference here would cost
    // two atomic operations a line.
    LogOutput* _output = nullptr;
+   const Logger* _begunBy = nullptr;
    bool _locked = false;
    Logger::CombinedLevel _level = 0;
    // Caches: the date text for its day, the bias text for its bias, the clock fields
@@ -420,7 +435,7 @@ void LoggerImpl::BeginCombined(CombinedLevel level) {
    size_t depth = state.Depth();
    TlsBufferedLogWriter* writer = state.Push();
    try {
-      writer->Begin(level, _name, _output.Get(), state.context);
+      writer->Begin(this, level, _name, _output.Get(), state.context);
    } catch (...) {
       state.Pop();
       throw;
@@ -452,11 +467,60 @@ void LoggerImpl::End() {
    writer->EndLine();
 }
 
-void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
-                     const PrintFormatter* args, int count) noexcept {
+namespace {
+
+// Stands for a format that could not be parsed: its null format matches none.
+constexpr ParsedFormat kUnparsed{};
+
+// The parsed format that `site` keeps for `format`, parsed on the site's first call;
+// null when it cannot be kept. Lives until exit, as the site does.
+const ParsedFormat* SiteFormat(LogFormatSite* site, const char* format) noexcept {
+   const ParsedFormat* parsed = site->parsed.load(std::memory_order_acquire);
+   if (parsed == nullptr) {
+      ParsedFormat* made = new (std::nothrow) ParsedFormat;
+      if (made == nullptr) return nullptr;
+      const ParsedFormat* kept = made;
+      if (!ParsedFormat::Parse(format, *made)) {
+         delete made;
+         kept = &kUnparsed;
+      }
+      if (site->parsed.compare_exchange_strong(parsed, kept, std::memory_order_acq_rel,
+                                               std::memory_order_acquire)) {
+         parsed = kept;
+      } else if (kept != &kUnparsed) {
+         delete made;  // another thread's line came first
+      }
+   }
+   return parsed->format == format ? parsed : nullptr;
+}
+
+void WriteLine(Logger* logger, Logger::LogLevel level, const char* format,
+               const ParsedFormat* parsed, const PrintFormatter* args, int count) noexcept {
    try {
       logger->Begin(level);
    } catch (...) {
+      return;
+   }
+   LoggerTlsState* state = t_state;
+   TlsBufferedLogWriter* top = state ? state->Top() : nullptr;
+   if (top != nullptr && top->BegunBy() == logger) {
+      // The line this call began in this thread's writer: written and ended here, without
+      // asking the logger again.
+      try {
+         bool written = parsed ? top->WriteParsed(*parsed, args, count)
+                               : top->WritePlain(format, args, count);
+         if (!written) MessageFormatter::PrintArgsJoined(top, format, args, count);
+      } catch (...) {
+         // A bad argument or format ends the line here; logging never throws.
+      }
+      struct PopOnExit {
+         LoggerTlsState* state;
+         ~PopOnExit() { state->Pop(); }
+      } pop{state};
+      try {
+         top->EndLine();
+      } catch (...) {
+      }
       return;
    }
    try {
@@ -464,9 +528,10 @@ void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
       // This thread's own line writer takes a message of plain arguments into its chunk
       // as it is formatted; any other goes through one Write per joined run.
       TlsBufferedLogWriter* own = t_state ? t_state->Top() : nullptr;
-      if (own == nullptr || line != own || !own->WritePlain(format, args, count)) {
-         MessageFormatter::PrintArgsJoined(line ? line : logger, format, args, count);
-      }
+      bool written = own != nullptr && line == own &&
+                     (parsed ? own->WriteParsed(*parsed, args, count)
+                             : own->WritePlain(format, args, count));
+      if (!written) MessageFormatter::PrintArgsJoined(line ? line : logger, format, args, count);
    } catch (...) {
       // A bad argument or format ends the line here; logging never throws.
    }
@@ -474,6 +539,18 @@ void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
       logger->End();
    } catch (...) {
    }
+}
+
+}  // namespace
+
+void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
+                     const PrintFormatter* args, int count) noexcept {
+   WriteLine(logger, level, format, nullptr, args, count);
+}
+
+void LogInternalSiteArgs(LogFormatSite* site, Logger* logger, Logger::LogLevel level,
+                         const char* format, const PrintFormatter* args, int count) noexcept {
+   WriteLine(logger, level, format, site ? SiteFormat(site, format) : nullptr, args, count);
 }
 
 void SetLogContext(const std::string& key, const std::string& value) {

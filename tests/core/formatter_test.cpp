@@ -139,6 +139,17 @@ TEST(MessageFormatterTest, PlainWalkIntoABufferMatchesThePlainWalkOrDeclines) {
       std::string buffer(capacity, '\0');
       int length = MessageFormatter::PrintPlainArgs(buffer.data(), capacity, format,
                                                     args.begin(), static_cast<int>(args.size()));
+      // The walk over the parsed format writes the same, or declines alike.
+      ParsedFormat parsed;
+      if (ParsedFormat::Parse(format, parsed)) {
+         std::string again(capacity, '\0');
+         int parsedLength = MessageFormatter::PrintPlainParsed(
+             again.data(), capacity, parsed, args.begin(), static_cast<int>(args.size()));
+         EXPECT_EQ(parsedLength, length) << format;
+         if (length >= 0) {
+            EXPECT_EQ(again, buffer) << format;
+         }
+      }
       if (length < 0) return std::string("declined");
       EXPECT_LE(static_cast<size_t>(length), capacity);
       return buffer.substr(0, static_cast<size_t>(length));
@@ -158,6 +169,18 @@ TEST(MessageFormatterTest, PlainWalkIntoABufferMatchesThePlainWalkOrDeclines) {
       EXPECT_EQ(plain(format, args), into(format, args)) << format;
    }
    EXPECT_EQ("false||", into("%1|%2|%3", {false, empty, ""}));
+   EXPECT_EQ("%% 1%% %", into("%%%% %1%%% %%%", {1}));
+   EXPECT_EQ("declined", into("%1 %3", {1, 2}));
+
+   // A format of more pieces than a parsed one holds is not parsed; the last that fits is.
+   ParsedFormat parsed;
+   std::string pieces;
+   for (int i = 0; i < ParsedFormat::kMaxPieces - 1; ++i) pieces += "%%";
+   EXPECT_TRUE(ParsedFormat::Parse(pieces.c_str(), parsed));
+   EXPECT_EQ(parsed.count, ParsedFormat::kMaxPieces);
+   pieces += "%1";
+   EXPECT_FALSE(ParsedFormat::Parse(pieces.c_str(), parsed));
+   EXPECT_FALSE(ParsedFormat::Parse(std::string(70000, 'x').c_str(), parsed));
 
    // Exactly enough room, and one byte short at each kind of piece.
    EXPECT_EQ("id 12345 ok", into("id %1 ok", {12345}, 11));

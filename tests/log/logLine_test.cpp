@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <cstring>
 #include <fstream>
 #include <regex>
 #include <string>
@@ -73,6 +74,38 @@ TEST(LogLineTest, EachLineNamesItsOwnLoggerAndLevelWhateverCameBefore) {
       std::string rest = std::string(levels[i]) + " '" + order[i]->GetSubsystemName() +
                          "'\\] n=" + std::to_string(i);
       EXPECT_TRUE(Matches(lines[i], rest)) << lines[i];
+   }
+}
+
+// A call site keeps its format parsed only when the format is a literal: a format in a
+// buffer that changes between calls through one site gives each line its own text, and
+// threads racing to a literal site's first line all get theirs whole.
+TEST(LogLineTest, ACallSiteKeepsOnlyALiteralFormatParsed) {
+   TestLogger t;
+   char format[32];
+   for (const char* text : {"first %1 line", "second %1 row"}) {
+      strcpy(format, text);
+      PELMORA_LOG_INFO(t.logger.Get(), format, 7);
+   }
+   std::vector<std::thread> threads;
+   for (int i = 0; i < 4; ++i) {
+      threads.emplace_back([&t, i] {
+         for (int k = 0; k < 50; ++k) PELMORA_LOG_INFO(t.logger.Get(), "%% thread %1 line %2 %x", i, k);
+      });
+   }
+   for (std::thread& thread : threads) thread.join();
+
+   std::vector<std::string> lines = t.Lines();
+   ASSERT_EQ(lines.size(), 202u);
+   EXPECT_TRUE(Matches(lines[0], "info 'sub'\\] first 7 line")) << lines[0];
+   EXPECT_TRUE(Matches(lines[1], "info 'sub'\\] second 7 row")) << lines[1];
+   std::vector<int> next(4, 0);
+   for (size_t i = 2; i < lines.size(); ++i) {
+      std::smatch match;
+      ASSERT_TRUE(std::regex_search(lines[i], match, std::regex("\\] % thread (\\d) line (\\d+) %x$")))
+          << lines[i];
+      int thread = std::stoi(match[1]);
+      EXPECT_EQ(std::stoi(match[2]), next[thread]++) << lines[i];
    }
 }
 

@@ -5,12 +5,32 @@
 // 1 followed by "0". A placeholder beyond the arguments throws
 // InvalidFormatStringException with the format string as its message. Thread-safe.
 
+#include <cstdint>
 #include <string>
 
 #include "pelmora/object/export.h"
 #include "pelmora/formatter/printFormatter.h"
 
 namespace Pelmora {
+
+// A format string taken apart once: its literal runs, each followed by the index of an
+// argument or by none. Only for a format whose text never changes (a string literal), so
+// that a call site can keep it and skip the placeholder scan on later calls.
+struct ParsedFormat {
+   static constexpr int kMaxPieces = 12;
+   struct Piece {
+      uint16_t at;      // the run's first byte in the format
+      uint16_t length;
+      int8_t argument;  // 0-based; -1 when the run ends the text
+   };
+   const char* format = nullptr;
+   int count = 0;
+   int arguments = 0;  // the highest argument number used
+   Piece pieces[kMaxPieces];
+
+   // False when `format` needs more than kMaxPieces pieces or is longer than 65535 bytes.
+   PELMORA_EXPORT static bool Parse(const char* format, ParsedFormat& out);
+};
 
 class PELMORA_EXPORT MessageFormatter {
 public:
@@ -41,6 +61,9 @@ public:
    // with PrintArgsJoined.
    static int PrintPlainArgs(char* buffer, size_t capacity, const char* format,
                              const PrintFormatter* args, int count);
+   // PrintPlainArgs for the format that `parsed` was made from, without scanning it.
+   static int PrintPlainParsed(char* buffer, size_t capacity, const ParsedFormat& parsed,
+                               const PrintFormatter* args, int count);
    static std::string ASPrintArgs(const char* format, const PrintFormatter* args, int count);
 };
 

@@ -4,17 +4,46 @@
 // load and one test and no argument is evaluated. Nothing here throws to its caller: a
 // failure while formatting still ends the line and is dropped.
 
+#include <atomic>
 #include <string>
 
 #include "pelmora/object/export.h"
 #include "pelmora/formatter/printFormatter.h"
 #include "pelmora/service/logger.h"
 
+namespace Pelmora {
+struct ParsedFormat;
+}
+
 namespace Pelmora::Service {
 
 // Writes one line always (the caller tested the level): Begin, the message, End.
 PELMORA_EXPORT void LogInternalArgs(Logger* logger, Logger::LogLevel level, const char* format,
                      const PrintFormatter* args, int count) noexcept;
+
+// Where a PELMORA_LOG call site keeps its format, parsed by the site's first line, so that
+// later lines skip the placeholder scan. Only a string literal may use one: its text
+// cannot change under the site. Constant-initialised, so a site costs no guard.
+struct LogFormatSite {
+   std::atomic<const ParsedFormat*> parsed{nullptr};
+};
+
+// LogInternalArgs for a call site: `site` may be null (a format that is not a literal).
+PELMORA_EXPORT void LogInternalSiteArgs(LogFormatSite* site, Logger* logger,
+                                        Logger::LogLevel level, const char* format,
+                                        const PrintFormatter* args, int count) noexcept;
+
+template <class... Args>
+inline void LogInternalAt(LogFormatSite* site, Logger* logger, Logger::LogLevel level,
+                          const char* format, const Args&... args) noexcept {
+   static_assert(sizeof...(Args) <= 9, "at most nine arguments");
+   if constexpr (sizeof...(Args) == 0) {
+      LogInternalSiteArgs(site, logger, level, format, nullptr, 0);
+   } else {
+      const PrintFormatter formatters[] = {PrintFormatter(args)...};
+      LogInternalSiteArgs(site, logger, level, format, formatters, sizeof...(Args));
+   }
+}
 
 inline void LogInternal(Logger* logger, Logger::LogLevel level, const char* format) noexcept {
    LogInternalArgs(logger, level, format, nullptr, 0);
@@ -94,13 +123,19 @@ PELMORA_EXPORT void WriteFaultToMemoryBuffer(Logger* logger, const PrintFormatte
 }  // namespace Pelmora::Service
 
 // PELMORA_LOG(logger, level, format, args...): `logger` is evaluated once; the format and
-// the arguments only when the level is wanted.
-#define PELMORA_LOG(logger, level, ...)                                           \
-   do {                                                                           \
-      ::Pelmora::Service::Logger* pelmoraLogger_ = (logger);                      \
-      if (pelmoraLogger_->IsLevelWanted(level)) {                                 \
-         ::Pelmora::Service::LogInternal(pelmoraLogger_, (level), __VA_ARGS__);   \
-      }                                                                           \
+// the arguments only when the level is wanted. A format that the compiler knows to be
+// constant (a string literal) is parsed once per call site.
+#define PELMORA_LOG_FORMAT_(format, ...) format
+#define PELMORA_LOG(logger, level, ...)                                                   \
+   do {                                                                                   \
+      ::Pelmora::Service::Logger* pelmoraLogger_ = (logger);                              \
+      if (pelmoraLogger_->IsLevelWanted(level)) {                                         \
+         static ::Pelmora::Service::LogFormatSite pelmoraSite_;                           \
+         ::Pelmora::Service::LogInternalAt(                                               \
+             __builtin_constant_p(PELMORA_LOG_FORMAT_(__VA_ARGS__, 0)) ? &pelmoraSite_    \
+                                                                       : nullptr,         \
+             pelmoraLogger_, (level), __VA_ARGS__);                                       \
+      }                                                                                   \
    } while (0)
 
 #define PELMORA_LOG_QUIET(logger, ...) \
