@@ -1,10 +1,13 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <cstdint>
+#include <cstring>
 #include <memory>
 #include <thread>
 #include <vector>
 
+#include "pelmora/object/scoreboard.h"
 #include "src/core/scoreboardHash2D.h"
 #include "tests/support/watchdog.h"
 
@@ -80,6 +83,24 @@ TEST(ScoreboardHash2DTest, ConcurrentClaimsLoseNoCountOfAClaimedKey) {
    board->Serialize(text);
    EXPECT_NE(std::string::npos, text.find("N7Pelmora5ThingE - 5\n")) << text;
    EXPECT_EQ(5, board->GetSize());  // no row holds more than five of these
+}
+
+// Code built apart from the library (plugins) reaches the scoreboard through its table of
+// virtual operations, so the order Increment, Decrement, Serialize, GetSize is fixed and
+// new operations go after them.
+TEST(ScoreboardTest, VirtualOperationsKeepTheirSlotOrder) {
+   // A pointer to a virtual member holds one plus the operation's offset in the table.
+   auto slot = [](auto member) {
+      static_assert(sizeof(member) == 2 * sizeof(uintptr_t));
+      uintptr_t words[2];
+      std::memcpy(words, &member, sizeof(words));
+      EXPECT_EQ(1u, words[0] % sizeof(void*)) << "not a virtual operation";
+      return (words[0] - 1) / sizeof(void*);
+   };
+   size_t increment = slot(&Scoreboard::Increment);
+   EXPECT_EQ(increment + 1, slot(&Scoreboard::Decrement));
+   EXPECT_EQ(increment + 2, slot(&Scoreboard::Serialize));
+   EXPECT_EQ(increment + 3, slot(&Scoreboard::GetSize));
 }
 
 }  // namespace

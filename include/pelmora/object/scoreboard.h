@@ -19,12 +19,6 @@ public:
    void GetStats(PerfCounter::LwStatsBuilder& builder) override = 0;
    virtual void Increment(const char* name) = 0;
    virtual void Decrement(const char* name) = 0;
-   // Counts `delta` instances at once (negative: fewer), for code that makes or drops
-   // objects by the thousand. By default one Increment or Decrement per instance.
-   virtual void Add(const char* name, int delta) {
-      for (; delta > 0; --delta) Increment(name);
-      for (; delta < 0; ++delta) Decrement(name);
-   }
    // One line "(row, cell) => name - count" per counted class.
    virtual void Serialize(std::string& out) const = 0;
    // The number of classes counted.
@@ -34,6 +28,13 @@ public:
    // be a moment old.
    using ClassVisitor = void (*)(void* context, const char* name, int count);
    virtual void VisitClasses(ClassVisitor visitor, void* context) const = 0;
+   // Counts `delta` instances at once (negative: fewer), for code that makes or drops
+   // objects by the thousand. By default one Increment or Decrement per instance. Last,
+   // so that the operations before it keep their places for code built earlier.
+   virtual void Add(const char* name, int delta) {
+      for (; delta > 0; --delta) Increment(name);
+      for (; delta < 0; ++delta) Decrement(name);
+   }
 };
 
 // The process-wide scoreboard; null until the first object is referenced. Lives until exit.
