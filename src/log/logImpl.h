@@ -30,10 +30,11 @@ constexpr Logger::CombinedLevel kSevereLevels = Logger::LOG_QUIET | Logger::LOG_
 // exceeds 65535, by the highest set bit.
 const char* GetCombinedLevelName(Logger::CombinedLevel level);
 
-// A line holds a log lock for about as long as copying it takes, far less than the two
-// system calls of a futex sleep and wake-up: a thread that finds one held watches it this
-// many rounds before it sleeps, so that under contention the lock usually changes hands
-// in user space.
+// A short line holds a log lock for about as long as copying it into a buffer takes, far
+// less than the two system calls of a futex sleep and wake-up: a thread that finds one
+// held watches it this many rounds before it sleeps, so that under contention the lock
+// usually changes hands in user space. (A writer that sends or writes out under its lock,
+// or a long line, holds it longer; then the watcher sleeps.)
 constexpr int kLogLockSpins = 64;
 
 inline void RelaxCpu() {
@@ -88,28 +89,41 @@ private:
    std::atomic<uint32_t> _state{kFree};
 };
 
-// The log manager's mutex: the library's owner-checked Mutex over a LogWriterMutex, so
-// that a report child takes it over, as it does the writers' locks, when a thread that
-// is not running there held it at fork time.
+// The log manager's mutex: owner-checked like the library's Mutex (with its panic texts),
+// over a LogWriterMutex, so that a report child takes it over, as it does the writers'
+// locks, when a thread that is not running there held it at fork time.
 class LogManagerMutex final : public virtual System::Mutex, public ObjectImpl {
 public:
    void Lock() PELMORA_ACQUIRE() PELMORA_NO_THREAD_SAFETY_ANALYSIS override {
-      PELMORA_VERIFY(!IsLocked());
-      _word.lock();
-      _owner.store(pthread_self(), std::memory_order_relaxed);
+      PELMORA_VERIFY(!_mutex.IsLocked());
+      _mutex.Lock();
    }
    void Unlock() PELMORA_RELEASE() PELMORA_NO_THREAD_SAFETY_ANALYSIS override {
-      PELMORA_VERIFY(IsLocked());
-      _owner.store(0, std::memory_order_relaxed);
-      _word.unlock();
+      PELMORA_VERIFY(_mutex.IsLocked());
+      _mutex.Unlock();
    }
-   bool IsLocked() const override {
-      return _owner.load(std::memory_order_relaxed) == pthread_self();
-   }
+   bool IsLocked() const override { return _mutex.IsLocked(); }
 
 private:
-   LogWriterMutex _word;
-   std::atomic<pthread_t> _owner{0};
+   // The lock word and the thread that holds it.
+   class OwnedWord {
+   public:
+      void Lock() {
+         _word.lock();
+         _owner.store(pthread_self(), std::memory_order_relaxed);
+      }
+      void Unlock() {
+         _owner.store(0, std::memory_order_relaxed);
+         _word.unlock();
+      }
+      bool IsLocked() const { return _owner.load(std::memory_order_relaxed) == pthread_self(); }
+
+   private:
+      LogWriterMutex _word;
+      std::atomic<pthread_t> _owner{0};
+   };
+
+   OwnedWord _mutex;
 };
 
 // A writer over a target Writer, filtered by a mask; its mutex serialises the target

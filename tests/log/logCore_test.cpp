@@ -270,3 +270,16 @@ TEST(LogMemoryTest, RingKeepsWholeRecentLinesAtMemoryLevelsAndIsWrittenOutOnRequ
    LogMemoryBuffer(t.logger.Get(), Logger::LOG_ERROR, "again");  // writing out does not feed it
    EXPECT_EQ(t.target->Text().find("Recent log lines (full)", after), std::string::npos);
 }
+
+// The manager's lock is the library's mutex: misuse panics with the mutex's own texts.
+TEST(LogManagerDeathTest, RelockingAndForeignUnlockPanicWithTheMutexTexts) {
+   Ref<LogManager> manager;
+   CreateLogManager(manager);
+   EXPECT_DEATH(
+       {
+          manager->Lock();
+          manager->Lock();
+       },
+       "Assert Failed: \"!_mutex.IsLocked\\(\\)\"");
+   EXPECT_DEATH(manager->Unlock(), "Assert Failed: \"_mutex.IsLocked\\(\\)\"");
+}
