@@ -81,8 +81,9 @@ FloorFile& MatchedFloor() {
    return *floor;
 }
 
-// User and system CPU time of the whole process, taken by thread 0 around the measured
-// loop of all threads (the loop's start and end wait for every thread).
+// User and system CPU time of the whole process, read by thread 0 before its measured
+// loop and after it. The loop's end waits for every thread; what the others do before
+// their loops start is next to nothing.
 class ProcessCpuPerLine {
 public:
    explicit ProcessCpuPerLine(benchmark::State& state) : _state(state) {
