@@ -51,7 +51,12 @@ private:
    size_t _allocated = 0;  // by the creator's thread only
    bool _building = true;
    bool _firstBlockIsSpare = false;  // of the first size: goes to the spare slot
-   std::vector<char*> _blocks;
+   struct Block {
+      char* start;
+      bool mapped;  // from MapBlock rather than the heap
+   };
+   std::vector<Block> _blocks;
+   size_t _taken = 0;  // bytes in all blocks
    char* _cursor = nullptr;
    char* _end = nullptr;
    // The names made here, newest first, to be destroyed with the arena.
