@@ -142,9 +142,15 @@ public:
       IncNodeCountAndValidate(name.size());
       std::unique_ptr<ElementNodeImpl> element(
           new (_arena) ElementNodeImpl(_names.Find(name, _arena), line, column, _arena));
-      for (const char** attribute = attributes; *attribute; attribute += 2)
-         ValidateByteCount(std::strlen(attribute[0]) + std::strlen(attribute[1]));
-      element->DefineParsedAttributes(attributes);
+      // Each length is taken once, for the limit and for the copy.
+      _attributes.clear();
+      for (const char** attribute = attributes; *attribute; attribute += 2) {
+         size_t nameLength = std::strlen(attribute[0]);
+         size_t valueLength = std::strlen(attribute[1]);
+         ValidateByteCount(nameLength + valueLength);
+         _attributes.push_back({attribute[0], nameLength, attribute[1], valueLength});
+      }
+      element->DefineParsedAttributes(_attributes.data(), _attributes.size());
       Push(std::move(element));
    }
 
@@ -275,6 +281,8 @@ private:
    Ref<DocumentImpl> _document;
    NodeArena* _arena = nullptr;
    NameTable _names;
+   // The attributes of the start tag at hand; the vector keeps its capacity.
+   std::vector<ElementNodeImpl::ParsedAttribute> _attributes;
    // Character data not yet made into a node; the buffer keeps its capacity.
    std::string _text;
    bool _textOpen = false;

@@ -4,8 +4,11 @@
 #include <algorithm>
 #include <array>
 #include <cstddef>
+#include <cstring>
 #include <string_view>
+#include <tuple>
 #include <typeinfo>
+#include <utility>
 #include <vector>
 
 #include "pelmora/exception/exceptions.h"
@@ -417,19 +420,20 @@ void ElementNodeImpl::DefineAttribute(const std::string& name, const char* value
    DefineAttribute(name, std::string(value));
 }
 
-void ElementNodeImpl::DefineParsedAttributes(const char** attributes) {
-   size_t count = 0;
-   while (attributes[count * 2]) ++count;
+void ElementNodeImpl::DefineParsedAttributes(ParsedAttribute* attributes, size_t count) {
    if (count == 0) return;
-   _attributes.reserve(_attributes.size() + count);
-   for (const char** attribute = attributes; *attribute; attribute += 2)
-      _attributes.emplace_back(attribute[0], attribute[1]);
-   // Names are unique: ordering by name alone orders the pairs.
-   auto byName = [](const AttributeList::value_type& a, const AttributeList::value_type& b) {
-      return a.first < b.first;
+   // Ordered while they are still C strings: moving pairs of strings about costs more.
+   // strcmp orders bytes as the strings' comparison does, and names are unique.
+   auto byName = [](const ParsedAttribute& a, const ParsedAttribute& b) {
+      return std::strcmp(a.name, b.name) < 0;
    };
-   if (!std::is_sorted(_attributes.begin(), _attributes.end(), byName))
-      std::sort(_attributes.begin(), _attributes.end(), byName);
+   if (!std::is_sorted(attributes, attributes + count, byName))
+      std::sort(attributes, attributes + count, byName);
+   _attributes.reserve(count);
+   for (const ParsedAttribute* attribute = attributes; attribute != attributes + count; ++attribute)
+      _attributes.emplace_back(std::piecewise_construct,
+                               std::forward_as_tuple(attribute->name, attribute->nameLength),
+                               std::forward_as_tuple(attribute->value, attribute->valueLength));
 }
 
 void ElementNodeImpl::RemoveAttribute(const std::string& name) {

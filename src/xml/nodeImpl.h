@@ -198,9 +198,16 @@ public:
 
    // The attribute's value, or null; no copy.
    const std::string* FindAttribute(const std::string& name) const;
-   // For the parser: defines the attributes of a start tag (name, value, ..., null), whose
-   // names expat has made unique.
-   void DefineParsedAttributes(const char** attributes);
+   // An attribute of a start tag, as the parser hands it over.
+   struct ParsedAttribute {
+      const char* name;
+      size_t nameLength;
+      const char* value;
+      size_t valueLength;
+   };
+   // For the parser: defines the attributes of a start tag on an element that has none
+   // yet. Expat has made the names unique; `attributes` is reordered by name.
+   void DefineParsedAttributes(ParsedAttribute* attributes, size_t count);
 
    // The serialiser's halves of an element, so that nesting needs no recursion. The start
    // tag answers whether children follow (otherwise it was written as an empty tag).

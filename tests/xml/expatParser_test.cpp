@@ -84,6 +84,24 @@ TEST_F(ParserTest, BuildsTheDocumentWithEveryKindOfNode) {
    EXPECT_TRUE(Sink().Take().empty());
 }
 
+// Lookups search the parsed attributes by the byte order of their names, as built ones.
+TEST_F(ParserTest, ParsedAttributesAreOrderedByTheBytesOfTheirNames) {
+   Ref<Document> document =
+       Parse(NewParser().Get(),
+             "<e \xc3\xa9='5' ab='3' Z='1' a='2' x:n='4' b=''><f b='2' a='1'/></e>");
+   ElementNode* e = document->GetRoot();
+   EXPECT_EQ("<e Z=\"1\" a=\"2\" ab=\"3\" b=\"\" x:n=\"4\" \xc3\xa9=\"5\"><f a=\"1\" b=\"2\"/></e>",
+             Write(e));
+   std::string values;
+   for (const char* name : {"Z", "a", "ab", "b", "x:n", "\xc3\xa9"}) {
+      std::string value;
+      EXPECT_TRUE(e->GetAttribute(name, value)) << name;
+      values += value + ",";
+   }
+   EXPECT_EQ("1,2,3,,4,5,", values);
+   EXPECT_FALSE(e->GetAttribute("n", values));
+}
+
 TEST_F(ParserTest, ASerialisedDocumentParsesBackToTheSameSerialisation) {
    Ref<XMLParser> parser = NewParser();
    std::string first = Reparse(parser.Get(),
