@@ -78,43 +78,45 @@ NodeImpl::~NodeImpl() {
    // its count is cleared, its destructor run, and the memory, the arena references and
    // the scoreboard counts are given back in bulk. Atomic steps per node were most of the
    // cost of dropping a large document. One still referenced elsewhere keeps its subtree
-   // and merely loses its parent. A flat work list: no frame per level of the tree.
-   // The reference tracker wants every last release itself, so with one the nodes go
-   // through DecRef one by one.
+   // and merely loses its parent. The reference tracker wants every last release itself,
+   // so with one the nodes go through DecRef one by one.
+   // The walk takes each node once, in document order, which for a parsed tree is the
+   // order of its memory: the reads stream forwards through the arena. It remembers one
+   // next sibling per level it is inside, not the children of a node all at once (for a
+   // wide node that was a chase through the whole document ahead of the walk).
    bool bulk = GetRefTracker() == nullptr;
    int dropped[kProcessingInstructionNode + 1] = {};
    NodeDisposal disposal;
-   std::vector<NodeImpl*> orphans;
-   // Children are stacked last first, so that they are taken in document order, which for
-   // a parsed tree is the order of their memory: the reads run forwards through the arena.
-   auto adopt = [&orphans](NodeImpl* parent) {
-      size_t first = orphans.size();
-      for (NodeImpl* child = parent->_firstChild; child; child = child->_nextSibling) {
-         __builtin_prefetch(reinterpret_cast<char*>(child) + kReadAhead);
-         orphans.push_back(child);
+   std::vector<NodeImpl*> resume;
+   NodeImpl* node = _firstChild;
+   _firstChild = _lastChild = nullptr;
+   while (node) {
+      __builtin_prefetch(reinterpret_cast<char*>(node) + kReadAhead);
+      NodeImpl* next = node->_nextSibling;
+      if (node->ObjectImpl::GetRefCount() != 1) {
+         node->_parent = node->_nextSibling = node->_prevSibling = nullptr;
+         node->ObjectImpl::DecRef();
+      } else {
+         if (NodeImpl* child = node->_firstChild) {
+            if (next) resume.push_back(next);
+            next = child;
+            node->_firstChild = node->_lastChild = nullptr;
+         }
+         if (bulk) {
+            ++dropped[node->GetNodeType()];
+            void* memory = dynamic_cast<void*>(node);
+            node->_refCount.Write(0);
+            node->~NodeImpl();
+            disposal.Free(memory);
+         } else {
+            node->ObjectImpl::DecRef();
+         }
       }
-      std::reverse(orphans.begin() + static_cast<ptrdiff_t>(first), orphans.end());
-      parent->_firstChild = parent->_lastChild = nullptr;
-   };
-   adopt(this);
-   while (!orphans.empty()) {
-      NodeImpl* orphan = orphans.back();
-      orphans.pop_back();
-      if (orphan->ObjectImpl::GetRefCount() != 1) {
-         orphan->_parent = orphan->_nextSibling = orphan->_prevSibling = nullptr;
-         orphan->ObjectImpl::DecRef();
-         continue;
+      if (!next && !resume.empty()) {
+         next = resume.back();
+         resume.pop_back();
       }
-      if (orphan->_firstChild) adopt(orphan);
-      if (!bulk) {
-         orphan->ObjectImpl::DecRef();
-         continue;
-      }
-      ++dropped[orphan->GetNodeType()];
-      void* memory = dynamic_cast<void*>(orphan);
-      orphan->_refCount.Write(0);
-      orphan->~NodeImpl();
-      disposal.Free(memory);
+      node = next;
    }
    disposal.Flush();
    if (Scoreboard* scoreboard = bulk ? GetScoreboard() : nullptr) {

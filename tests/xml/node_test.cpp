@@ -1,7 +1,9 @@
 #include <gtest/gtest.h>
 
+#include <cstdlib>
 #include <map>
 #include <string>
+#include <typeinfo>
 
 #include "pelmora/exception.h"
 #include "pelmora/object/scoreboard.h"
@@ -131,6 +133,51 @@ TEST(NodeTest, DroppingATreeKeepsEveryNodeHeldElsewhere) {
    EXPECT_EQ("<c x=\"1\">deep text</c>", Testing::Write(deep.Get()));
    // The document the moved node came from is untouched by its loss.
    EXPECT_EQ("<o/>", Testing::Write(other->GetRoot()));
+}
+
+// Drops a parsed tree holding a node with a subtree and one leaf from different levels:
+// every other node must go, the held ones keep what is theirs.
+void DropATreeThatHasHeldNodes() {
+   std::map<std::string, int> before = NodeCounts();
+   auto delta = [&before](int type) {
+      const char* name = NodeImpl::ScoreboardName(type);
+      return NodeCounts()[name] - before[name];
+   };
+   Ref<ElementNode> held;
+   Ref<TextNode> leaf;
+   {
+      Ref<Document> document =
+          Testing::Parse("<r><a><b/>t1</a><held><x/>in</held><c><d>t2</d></c>t3<!--z--></r>");
+      held = dynamic_cast<ElementNode*>(document->GetRoot()->GetFirstChild()->GetNextSibling());
+      leaf = dynamic_cast<TextNode*>(document->GetRoot()->GetLastChild()->GetPrevSibling());
+   }
+   EXPECT_EQ(0, delta(kDocumentNode));
+   EXPECT_EQ(2, delta(kElementNode));
+   EXPECT_EQ(2, delta(kTextNode));
+   EXPECT_EQ(0, delta(kCommentNode));
+   EXPECT_EQ(nullptr, held->GetParent());
+   EXPECT_EQ(nullptr, held->GetNextSibling());
+   EXPECT_EQ("<held><x/>in</held>", Testing::Write(held.Get()));
+   EXPECT_EQ(nullptr, leaf->GetPrevSibling());
+   EXPECT_EQ("t3", leaf->GetText());
+   held.Reset();
+   leaf.Reset();
+   EXPECT_EQ(0, delta(kElementNode));
+   EXPECT_EQ(0, delta(kTextNode));
+}
+
+// Without a reference tracker the nodes go in bulk, with one each through its own last
+// release; the tracker, once installed, stays for the process, hence the child process.
+TEST(NodeTest, DroppingATreeFreesWhatNobodyElseHoldsWithOrWithoutATracker) {
+   DropATreeThatHasHeldNodes();
+   EXPECT_EXIT(
+       {
+          Ref<RefTracker> tracker;
+          CreateRefTracker({TypeName(typeid(ElementNodeImpl))}, tracker);
+          DropATreeThatHasHeldNodes();
+          std::_Exit(testing::Test::HasFailure() ? 1 : 0);
+       },
+       testing::ExitedWithCode(0), "");
 }
 
 // The parser counts its nodes on the scoreboard a document at a time, and a tree dropped
