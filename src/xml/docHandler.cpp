@@ -9,6 +9,7 @@
 #include <string>
 #include <string_view>
 #include <mutex>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -120,7 +121,7 @@ public:
       ReleaseArena();
       _arena = new NodeArena();
       _document = new (_arena) DocumentImpl();
-      _stack.push_back(_document.Get());
+      _stack.push_back({_document.Get(), kDocumentNode});
       // The reference tracker wants to see every first reference itself.
       _countInBulk = GetRefTracker() == nullptr;
       result = _document.Get();
@@ -206,13 +207,20 @@ public:
 private:
    // Appends `node` to the top node and makes it the top. Until the tree holds it, the
    // node is owned here, so a refused insertion frees it.
+   // The kind of node is known here, which spares the checks and calls that find it out.
    template <class T>
    void Push(std::unique_ptr<T> node) {
+      constexpr int kKind = KindOf<T>();
       NodeImpl* added = node.get();
-      _stack.back()->AppendParsedChild(added, !_countInBulk);
+      const Open& parent = _stack.back();
+      if (parent.kind == kElementNode && kKind != kProcessingInstructionNode) {
+         parent.node->AppendParsedChildOfElement(added, !_countInBulk);
+      } else {
+         parent.node->AppendParsedChild(added, !_countInBulk);
+      }
       static_cast<void>(node.release());  // the tree holds it now
-      if (_countInBulk) ++_made[added->GetNodeType()];
-      _stack.push_back(added);
+      if (_countInBulk) ++_made[kKind];
+      _stack.push_back({added, kKind});
       if (_restricted && _stack.size() > _maxDepth) {
          LogXml(kXmlLogWarning, "XML document too deep: %1 (max: %2)", _stack.size(), _maxDepth);
          throw ParsingAbortedException();
@@ -270,8 +278,23 @@ private:
       if (_arena) std::exchange(_arena, nullptr)->ReleaseCreator();
    }
 
+   template <class T>
+   static constexpr int KindOf() {
+      if constexpr (std::is_same_v<T, ElementNodeImpl>) return kElementNode;
+      if constexpr (std::is_same_v<T, TextNodeImpl>) return kTextNode;
+      if constexpr (std::is_same_v<T, CDataNodeImpl>) return kCDataNode;
+      if constexpr (std::is_same_v<T, CommentNodeImpl>) return kCommentNode;
+      if constexpr (std::is_same_v<T, ProcessingInstructionNodeImpl>) {
+         return kProcessingInstructionNode;
+      }
+   }
+
+   struct Open {
+      NodeImpl* node;
+      int kind;
+   };
    // Open nodes, the document at the bottom. A vector keeps its capacity between documents.
-   std::vector<NodeImpl*> _stack;
+   std::vector<Open> _stack;
    uint64_t _maxChars;
    uint64_t _maxNodes;
    uint64_t _maxDepth;

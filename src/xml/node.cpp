@@ -201,19 +201,7 @@ void NodeImpl::Insert(NodeImpl* child, NodeImpl* before) {
 
 void NodeImpl::AppendParsedChild(NodeImpl* child, bool counted) {
    VerifyInsertAllowed(child);
-   if (counted) {
-      child->ObjectImpl::IncRef();
-   } else {
-      child->_refCount.Write(1);
-   }
-   child->_parent = this;
-   child->_prevSibling = _lastChild;
-   if (_lastChild) {
-      _lastChild->_nextSibling = child;
-   } else {
-      _firstChild = child;
-   }
-   _lastChild = child;
+   LinkParsed(child, counted);
    PostInsertProcessing(child);
 }
 

@@ -106,6 +106,9 @@ public:
    // `counted` false the node is not reported to the scoreboard; the caller reports it
    // (with the others of its document, at once) under ScoreboardName.
    void AppendParsedChild(NodeImpl* child, bool counted);
+   // As AppendParsedChild, on an element, for a child of a kind elements take: nothing to
+   // check, and an element does nothing after an insertion.
+   void AppendParsedChildOfElement(NodeImpl* child, bool counted) { LinkParsed(child, counted); }
    // The name under which the scoreboard counts the nodes of a kind (a NodeType).
    static const char* ScoreboardName(int nodeType);
 
@@ -123,6 +126,22 @@ private:
    void VerifyInsert(Node* node, Node* pos, bool hasPos);
    // The invariants of a node about to be linked: no parent and no next sibling.
    void VerifyFree() const;
+   // Links a new child last and gives it the parent's reference.
+   void LinkParsed(NodeImpl* child, bool counted) {
+      if (counted) {
+         child->ObjectImpl::IncRef();
+      } else {
+         child->_refCount.Write(1);
+      }
+      child->_parent = this;
+      child->_prevSibling = _lastChild;
+      if (_lastChild) {
+         _lastChild->_nextSibling = child;
+      } else {
+         _firstChild = child;
+      }
+      _lastChild = child;
+   }
 
    NodeImpl* _firstChild = nullptr;
    NodeImpl* _lastChild = nullptr;
