@@ -46,10 +46,6 @@ constexpr size_t kHeaderSize = kAlignment;
 // small free chunks first.
 std::atomic<char*> g_spareFirstBlock{nullptr};
 
-size_t RoundUp(size_t size) {
-   return (size + kAlignment - 1) & ~(kAlignment - 1);
-}
-
 bool HugePagesOnRequest() {
    static const bool offered = [] {
       std::ifstream setting("/sys/kernel/mm/transparent_hugepage/enabled");
@@ -114,40 +110,27 @@ const ElementName* NodeArena::NewName(std::string_view qualifiedName, std::strin
    return &name->name;
 }
 
-void* NodeArena::Allocate(size_t size) {
-   void* memory = AllocateRaw(size);
-   ++_allocated;
-   return memory;
-}
-
-void* NodeArena::AllocateRaw(size_t size) {
-   size = RoundUp(size);
-   if (static_cast<size_t>(_end - _cursor) < size) {
-      size_t blockSize = _blocks.empty()
-                             ? kFirstBlockSize
-                             : std::min(2 * static_cast<size_t>(_end - _blocks.back().start),
-                                        kLargestBlockSize);
-      bool mapped =
-          _taken >= kLargeDocumentBytes && size <= kMappedBlockSize && HugePagesOnRequest();
-      if (mapped) blockSize = kMappedBlockSize;
-      blockSize = std::max(blockSize, size);
-      _blocks.reserve(_blocks.size() + 1);
-      char* block = nullptr;
-      if (mapped) {
-         block = MapBlock();
-      } else if (_blocks.empty() && blockSize == kFirstBlockSize) {
-         block = g_spareFirstBlock.exchange(nullptr, std::memory_order_acq_rel);
-         _firstBlockIsSpare = true;
-      }
-      if (!block) block = static_cast<char*>(::operator new(blockSize));
-      _blocks.push_back({block, mapped});
-      _taken += blockSize;
-      _cursor = block;
-      _end = block + blockSize;
+void NodeArena::StartBlock(size_t size) {
+   size_t blockSize = _blocks.empty()
+                          ? kFirstBlockSize
+                          : std::min(2 * static_cast<size_t>(_end - _blocks.back().start),
+                                     kLargestBlockSize);
+   bool mapped = _taken >= kLargeDocumentBytes && size <= kMappedBlockSize && HugePagesOnRequest();
+   if (mapped) blockSize = kMappedBlockSize;
+   blockSize = std::max(blockSize, size);
+   _blocks.reserve(_blocks.size() + 1);
+   char* block = nullptr;
+   if (mapped) {
+      block = MapBlock();
+   } else if (_blocks.empty() && blockSize == kFirstBlockSize) {
+      block = g_spareFirstBlock.exchange(nullptr, std::memory_order_acq_rel);
+      _firstBlockIsSpare = true;
    }
-   void* memory = _cursor;
-   _cursor += size;
-   return memory;
+   if (!block) block = static_cast<char*>(::operator new(blockSize));
+   _blocks.push_back({block, mapped});
+   _taken += blockSize;
+   _cursor = block;
+   _end = block + blockSize;
 }
 
 void NodeArena::Release() { Drop(1); }

@@ -22,9 +22,19 @@ public:
    NodeArena& operator=(const NodeArena&) = delete;
 
    // Memory for one node, pointer-aligned; the node holds a reference until it dies.
-   void* Allocate(size_t size);
-   // As Allocate, for memory that holds no node reference.
-   void* AllocateRaw(size_t size);
+   void* Allocate(size_t size) {
+      ++_allocated;
+      return AllocateRaw(size);
+   }
+   // As Allocate, for memory that holds no node reference. Inline: a parse calls it per
+   // node, and a new block is rare.
+   void* AllocateRaw(size_t size) {
+      size = (size + alignof(void*) - 1) & ~(alignof(void*) - 1);
+      if (static_cast<size_t>(_end - _cursor) < size) StartBlock(size);
+      void* memory = _cursor;
+      _cursor += size;
+      return memory;
+   }
    // Drops a node's reference; the last frees every block.
    void Release();
    // Drops the references of `count` nodes at once.
@@ -46,6 +56,8 @@ private:
 
    ~NodeArena();
    void Drop(size_t references);
+   // Makes a new block, with room for `size` bytes, the one allocated from.
+   void StartBlock(size_t size);
 
    std::atomic<size_t> _references{kCreatorBias};
    size_t _allocated = 0;  // by the creator's thread only
