@@ -23,6 +23,9 @@
 namespace Pelmora::Xml {
 namespace {
 
+// The character data buffer a handler keeps between texts: larger ones are given back.
+constexpr size_t kKeptTextBytes = 64 * 1024;
+
 // The limits of handlers created without explicit ones; whoever owns the configuration
 // sets them (SetDefaultDocLimits), the defaults stand until then.
 std::mutex g_defaultLimitsMutex;
@@ -242,8 +245,10 @@ private:
    void CloseText() {
       if (!_textOpen) return;
       _textOpen = false;
-      AppendLeaf(std::unique_ptr<TextNodeImpl>(
-          new (_arena) TextNodeImpl(_text.data(), static_cast<int>(_text.size()))));
+      AppendLeaf(std::unique_ptr<TextNodeImpl>(new (_arena) TextNodeImpl(_text.data(), _text.size())));
+      // A handler may live as long as the process (a pooled parser): it keeps the buffer
+      // of the usual small texts, not of the largest it ever saw.
+      if (_text.capacity() > kKeptTextBytes) std::string().swap(_text);
    }
 
    // Counts the nodes made since the last call on the scoreboard, one step per kind. The
@@ -306,7 +311,7 @@ private:
    NameTable _names;
    // The attributes of the start tag at hand; the vector keeps its capacity.
    std::vector<ElementNodeImpl::ParsedAttribute> _attributes;
-   // Character data not yet made into a node; the buffer keeps its capacity.
+   // Character data not yet made into a node; the buffer keeps up to kKeptTextBytes.
    std::string _text;
    bool _textOpen = false;
    // Nodes linked into the tree but not yet on the scoreboard, by kind.

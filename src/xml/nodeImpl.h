@@ -239,7 +239,8 @@ private:
    // The name to change, made this element's own first if it was shared.
    ElementName& OwnName();
 
-   // Allocated on the first DefineAttribute: most elements carry no attributes.
+   // Empty until the first attribute: most elements carry none. A parsed element's list
+   // comes from its document's arena.
    AttributeList _attributes;
    const ElementName* _name;
    int _line;
@@ -253,7 +254,7 @@ public:
 
    TextNodeImpl() = default;
    explicit TextNodeImpl(const std::string& text) : _text(text) {}
-   TextNodeImpl(const char* data, int length) : _text(data, static_cast<size_t>(length)) {}
+   TextNodeImpl(const char* data, size_t length) : _text(data, length) {}
 
    int GetNodeType() const override { return kTextNode; }
    const std::string& GetText() const override { return _text; }
