@@ -3,14 +3,14 @@
 
 #include "src/xml/nodeArena.h"
 
+#include <fcntl.h>
 #include <sys/mman.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cstdint>
-#include <fstream>
-#include <iterator>
 #include <new>
-#include <string>
+#include <string_view>
 #include <utility>
 
 #include "src/xml/nodeImpl.h"
@@ -48,10 +48,15 @@ std::atomic<char*> g_spareFirstBlock{nullptr};
 
 bool HugePagesOnRequest() {
    static const bool offered = [] {
-      std::ifstream setting("/sys/kernel/mm/transparent_hugepage/enabled");
-      std::string text((std::istreambuf_iterator<char>(setting)), std::istreambuf_iterator<char>());
-      return text.find("[always]") != std::string::npos ||
-             text.find("[madvise]") != std::string::npos;
+      int fd = open("/sys/kernel/mm/transparent_hugepage/enabled", O_RDONLY | O_CLOEXEC);
+      if (fd < 0) return false;
+      char text[128];
+      ssize_t length = read(fd, text, sizeof(text) - 1);
+      close(fd);
+      if (length <= 0) return false;
+      std::string_view setting(text, static_cast<size_t>(length));
+      return setting.find("[always]") != std::string_view::npos ||
+             setting.find("[madvise]") != std::string_view::npos;
    }();
    return offered;
 }

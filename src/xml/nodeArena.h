@@ -1,8 +1,10 @@
 #pragma once
-// Memory for the nodes of one parsed document: bump allocation from large blocks, all
-// freed together when the last node taken from it is destroyed. A parser builds and a
-// document's release destroys nodes by the million, where the general heap is the cost.
-// The price: one node kept alive keeps its whole document's node memory.
+// Memory for the nodes of one parsed document, their names and their parsed attribute
+// lists: bump allocation from large blocks, all given back together when the last node
+// taken from it is destroyed (the first block is kept, one for the whole process, for the
+// next document). A parser builds and a document's release destroys nodes by the million,
+// where the general heap is the cost. The price: one node kept alive keeps its whole
+// document's node memory.
 // Allocate belongs to the building thread; Release may run on any thread.
 
 #include <atomic>
