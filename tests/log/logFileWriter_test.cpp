@@ -188,12 +188,18 @@ TEST(LogFileWriterTest, FailedOpenAfterARollKeepsTheFilesAndHoldsLinesUntilAnOpe
    EXPECT_TRUE(std::regex_match(ReadFile(options.path), std::regex("[^\\n]*\\] last\\n")));
 }
 
-TEST(LogFileWriterTest, RollRenamesOnlyTheRolledFilesThereAre) {
-   Files f;
+// Unbuffered, rolling over at every line.
+LogFileOptions RollingEveryLine(int maxFileNum) {
    LogFileOptions options;
    options.maxFileSize = 1;
-   options.maxFileNum = 100000;
+   options.maxFileNum = maxFileNum;
    options.bufferSize = 0;
+   return options;
+}
+
+TEST(LogFileWriterTest, RollRenamesOnlyTheRolledFilesThereAre) {
+   Files f;
+   LogFileOptions options = RollingEveryLine(100000);
    std::ofstream(f.dir + "/many.log.1") << "old 1\n";
    std::ofstream(f.dir + "/many.log.2") << "old 2\n";
    std::ofstream(f.dir + "/many.log.x") << "not a rolled file\n";
@@ -213,10 +219,7 @@ TEST(LogFileWriterTest, RollRenamesOnlyTheRolledFilesThereAre) {
 
 TEST(LogFileWriterTest, RollDropsTheOldestFileBeforeRenamingNoneOverAnother) {
    Files f;
-   LogFileOptions options;
-   options.maxFileSize = 1;
-   options.maxFileNum = 3;
-   options.bufferSize = 0;
+   LogFileOptions options = RollingEveryLine(3);
    f.AddFile(options, "full.log", FileOps::Ops());
    FileOps::renamesOverFiles = 0;
    for (int i = 0; i < 6; ++i) PELMORA_LOG_INFO(f.logger.Get(), "line %1", i);
