@@ -223,7 +223,6 @@ void LogOutputLock::ReadUnlock() {
 
 void LogOutputLock::WriteLockContended(const void* self) {
    uint32_t state = 0;
-   int spins = kLogLockSpins;
    // A waiting mark alone does not keep a writer out; it stays for the others.
    while (!_state.compare_exchange_weak(state, kWriter | (state & kWaiting),
                                         std::memory_order_acquire, std::memory_order_relaxed)) {
@@ -231,12 +230,6 @@ void LogOutputLock::WriteLockContended(const void* self) {
          // Taken over: its holders do not run in a report child.
          _state.store(kWriter, std::memory_order_relaxed);
          break;
-      }
-      // Watched with loads first, then slept on.
-      while ((state & ~kWaiting) && spins > 0) {
-         --spins;
-         RelaxCpu();
-         state = _state.load(std::memory_order_relaxed);
       }
       if (state & ~kWaiting) state = Await(state);
       state &= kWaiting;
