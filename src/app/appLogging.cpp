@@ -110,6 +110,7 @@ void AppImpl::InitializeLogging() {
          int flushMs = options.flushIntervalMs;
          view->Get("log/flushIntervalMs", &flushMs);
          options.flushIntervalMs = flushMs;
+         view->Get("log/threadBufferSize", &options.threadBufferSize);
          try {
             Ref<LogWriter> file;
             CreateFileLogWriter(kFileWriter, options, file);

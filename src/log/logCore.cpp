@@ -1,6 +1,8 @@
 // The level table, loggers, their manager, outputs and the plain writers.
 
+#include <algorithm>
 #include <atomic>
+#include <climits>
 #include <cstdio>
 #include <cstring>
 #include <thread>
@@ -243,6 +245,8 @@ void LogOutputLock::WriteLockContended(const void* self) {
 void LogOutputImpl::AddWriter(const std::string& name, LogWriter* writer) {
    if (!writer) throw InvalidArgumentException("null log writer");
    _lock.WriteLock();
+   // Batched lines go to the writers they were written for.
+   HandOnAll();
    bool added = _writers.emplace(name, writer).second;
    if (added) Reorder();
    _lock.WriteUnlock();
@@ -251,6 +255,7 @@ void LogOutputImpl::AddWriter(const std::string& name, LogWriter* writer) {
 
 void LogOutputImpl::RemoveWriter(const std::string& name, Ref<LogWriter>& out) {
    _lock.WriteLock();
+   HandOnAll();
    auto it = _writers.find(name);
    if (it == _writers.end()) {
       out.Reset();
@@ -264,7 +269,13 @@ void LogOutputImpl::RemoveWriter(const std::string& name, Ref<LogWriter>& out) {
 
 void LogOutputImpl::Reorder() {
    _order.clear();
-   for (auto& [name, writer] : _writers) _order.push_back(writer.Get());
+   int batchBytes = _writers.empty() ? 0 : INT_MAX;
+   for (auto& [name, writer] : _writers) {
+      _order.push_back(writer.Get());
+      auto* impl = dynamic_cast<LogWriterImpl*>(writer.Get());
+      batchBytes = std::min(batchBytes, impl ? impl->GetLineBatchBytes() : 0);
+   }
+   _batchBytes.store(batchBytes, std::memory_order_relaxed);
 }
 
 void LogOutputImpl::GetWriter(const std::string& name, Ref<LogWriter>& out) {
@@ -288,6 +299,8 @@ void LogOutputImpl::Write(Logger::CombinedLevel level, const char* data, int len
 
 void LogOutputImpl::WriteMessage(Logger::CombinedLevel level, const char* data, int length) {
    _lock.WriteLock();
+   // Lines the threads keep came before this one.
+   HandOnAll();
    try {
       Write(level, data, length);
    } catch (...) {
@@ -317,18 +330,23 @@ bool LogOutputImpl::TrySnapshot(std::chrono::steady_clock::time_point deadline,
 }
 
 void LogOutputImpl::Flush() {
+   DrainBatches();
    for (Ref<LogWriter>& writer : Snapshot()) writer->Flush();
 }
 
 void LogOutputImpl::Reopen() {
+   // Lines written before the rotation belong in the file it renamed.
+   DrainBatches();
    for (Ref<LogWriter>& writer : Snapshot()) writer->Reopen();
 }
 
 void LogOutputImpl::Close() {
    RefMap<std::string, LogWriter> writers;
    _lock.WriteLock();
+   HandOnAll();
    writers.swap(_writers);
    _order.clear();
+   _batchBytes.store(0, std::memory_order_relaxed);
    _lock.WriteUnlock();
    for (auto& [name, writer] : writers) writer->Close();
 }
@@ -337,7 +355,8 @@ void LogOutputImpl::Close() {
 
 LoggerImpl::LoggerImpl(const std::string& name, CombinedLevel mask, LoggerImpl* parent,
                        LogManagerImpl* manager, LogOutput* output)
-   : _name(name), _parent(parent), _manager(manager), _output(output) {
+   : _name(name), _parent(parent), _manager(manager), _output(output),
+     _outputImpl(dynamic_cast<LogOutputImpl*>(output)) {
    PELMORA_VERIFY(manager != nullptr);
    SetCombinedMask(mask);
    manager->RegisterLogger(this);

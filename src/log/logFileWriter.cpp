@@ -94,6 +94,7 @@ public:
       if (_options.maxFileNum < 1) _options.maxFileNum = 1;
       if (_options.bufferSize < 0) _options.bufferSize = 0;
       if (_options.maxHeldBytes < 0) _options.maxHeldBytes = 0;
+      if (_options.threadBufferSize < 0) _options.threadBufferSize = 0;
       _buffer.resize(static_cast<size_t>(_options.bufferSize));
       if (!TryOpen()) {
          throw SystemException(errno, "cannot open log file " + _options.path + ": " +
@@ -110,6 +111,17 @@ public:
    }
 
    uint64_t GetLostCount() const override { return _lost.load(std::memory_order_relaxed); }
+
+   int GetLineBatchBytes() const override {
+      return _options.bufferSize > 0 && _options.flushIntervalMs > 0 ? _options.threadBufferSize
+                                                                     : 0;
+   }
+
+   void Flush() override {
+      // Lines that threads keep for this writer come first.
+      DrainLineBatches();
+      LogWriterImpl::Flush();
+   }
 
    void Reopen() override {
       std::lock_guard<LogWriterMutex> lock(_mutex);
@@ -131,6 +143,41 @@ public:
 
 protected:
    void WriteLocked(Logger::CombinedLevel level, const char* data, int length) override {
+      // Several lines at once (a thread's batch) go one by one where a line boundary
+      // matters: a roll falls due among them, or the file is closed and they are held or
+      // dropped each whole.
+      if (_atLineStart && (_fd < 0 || (_options.maxFileSize > 0 &&
+                                       _size + length > _options.maxFileSize))) {
+         const char* end = data + length;
+         auto* first = static_cast<const char*>(memchr(data, '\n', static_cast<size_t>(length)));
+         if (first != nullptr && first + 1 < end) {
+            while (data < end) {
+               auto* newline =
+                   static_cast<const char*>(memchr(data, '\n', static_cast<size_t>(end - data)));
+               const char* stop = newline ? newline + 1 : end;
+               WritePiece(level, data, static_cast<int>(stop - data));
+               data = stop;
+            }
+            return;
+         }
+      }
+      WritePiece(level, data, length);
+   }
+
+   void FlushLocked() override {
+      if (_fd < 0) RetryOpen(Clock::now());
+      WriteBuffer();
+   }
+
+   void CloseLocked() override {
+      WriteBuffer();
+      if (_fd >= 0) close(_fd);
+      _fd = -1;
+   }
+
+private:
+   // A piece of one line or the whole of one or more.
+   void WritePiece(Logger::CombinedLevel level, const char* data, int length) {
       bool endsLine = data[length - 1] == '\n';
       if (_atLineStart) _dropping = false;
       if (_dropping) {
@@ -154,18 +201,6 @@ protected:
       if (_atLineStart && (level & kSevereLevels) != 0) WriteBuffer();
    }
 
-   void FlushLocked() override {
-      if (_fd < 0) RetryOpen(Clock::now());
-      WriteBuffer();
-   }
-
-   void CloseLocked() override {
-      WriteBuffer();
-      if (_fd >= 0) close(_fd);
-      _fd = -1;
-   }
-
-private:
    // Opens `path`; on success writes the held lines first. On failure errno tells why and
    // the next try waits reopenRetryMs.
    bool TryOpen() {
@@ -341,6 +376,9 @@ void LogFileFlusher::Run() {
          continue;
       }
       _wake.wait_for(lock, std::chrono::milliseconds(std::max(1, shortest / 2)));
+      lock.unlock();
+      DrainLineBatches();
+      lock.lock();
       Clock::time_point now = Clock::now();
       ForEachUnlocked(lock, [now](LogFileWriterImpl* writer) { writer->FlushIfDue(now); });
    }

@@ -122,6 +122,9 @@ public:
    bool SetLevelByName(const std::string& name) override;
    Writer* GetTarget() const override { return _target.Get(); }
    bool IsMemoryWriter() const { return _memory; }
+   // Bytes of whole lines of one level that a thread may keep for this writer before
+   // handing them on together; 0 when every line must reach it at once.
+   virtual int GetLineBatchBytes() const { return 0; }
 
 protected:
    // With _mutex held.
@@ -209,6 +212,59 @@ private:
    int _depth = 0;  // of the owner's write (and nested read) holds
 };
 
+// Whole lines of one level that one thread wrote to one output and has not handed on yet.
+// The thread appends under `mutex` alone; handing the lines to the writers takes the
+// output's write lock first, then `mutex`.
+class LogLineBatch final : public ObjectImpl {
+public:
+   explicit LogLineBatch(int capacity) : capacity(capacity), data(new char[capacity]) {}
+   ~LogLineBatch() override { delete[] data; }
+
+   LogWriterMutex mutex;
+   const int capacity;
+   char* const data;
+   int size = 0;
+   Logger::CombinedLevel level = 0;
+   bool orphaned = false;  // its thread has ended: dropped once handed on
+   bool detached = false;  // its output is gone: the thread makes a new one
+};
+
+class LogOutputImpl;
+
+// The calling thread's batches, one per output it wrote whole lines to. Only its thread
+// uses it; its end orphans the batches, whose lines their outputs hand on later.
+class LogThreadBatches {
+public:
+   LogThreadBatches() = default;
+   LogThreadBatches(const LogThreadBatches&) = delete;
+   LogThreadBatches& operator=(const LogThreadBatches&) = delete;
+   ~LogThreadBatches();
+
+   // This thread's batch for `output`, or null.
+   LogLineBatch* Find(const LogOutputImpl* output) const;
+   // As Find, making and registering the batch when there is none. Inline for the usual
+   // case, the output of the thread's last line.
+   LogLineBatch* Get(LogOutputImpl* output, int capacity);
+
+private:
+   LogLineBatch* GetOther(LogOutputImpl* output, int capacity);
+   LogLineBatch* Make(LogOutputImpl* output, int capacity);
+
+   struct Entry {
+      const LogOutputImpl* output;
+      uint64_t id;
+      Ref<LogLineBatch> batch;
+   };
+   std::vector<Entry> _entries;
+   // The entry found last.
+   const LogOutputImpl* _lastOutput = nullptr;
+   uint64_t _lastId = 0;
+   LogLineBatch* _last = nullptr;
+};
+
+// Hands every thread's batched lines to their writers, in every output that has batches.
+void DrainLineBatches();
+
 // The system calls a file log writer goes through. Tests replace one to make a step fail
 // or to count it; everything else uses the defaults.
 struct LogFileOps {
@@ -222,7 +278,8 @@ void CreateFileLogWriter(const std::string& name, const LogFileOptions& options,
 
 class LogOutputImpl final : public virtual LogOutput, public ObjectImpl {
 public:
-   explicit LogOutputImpl(const std::string& name) : _name(name) {}
+   explicit LogOutputImpl(const std::string& name);
+   ~LogOutputImpl() override;
 
    const std::string& GetName() const override { return _name; }
    void AddWriter(const std::string& name, LogWriter* writer) override;
@@ -238,6 +295,18 @@ public:
    void ReadUnlock() override { _lock.ReadUnlock(); }
    void WriteUnlock() override { _lock.WriteUnlock(); }
 
+   // One whole line from the calling thread, whose batches are `mine`: kept in the
+   // thread's batch while every writer takes batches and the line is not severe; written
+   // at once otherwise, after the thread's earlier lines.
+   void WriteLine(LogThreadBatches& mine, Logger::CombinedLevel level, const char* data,
+                  int length);
+   // With the write lock held (a line that spans several pieces): writes the thread's
+   // batched lines out first, so that its lines stay in order.
+   void HandOnBatch(LogThreadBatches& mine);
+   // Hands every thread's batched lines to the writers.
+   void DrainBatches();
+   uint64_t GetId() const { return _id; }
+
    // The writers at this moment, copied under the read lock.
    RefVector<LogWriter> Snapshot();
    // As Snapshot, trying for the read lock until `deadline`; false if it never came.
@@ -246,6 +315,13 @@ public:
 private:
    // With the write lock held: makes _order follow _writers again.
    void Reorder();
+   // With the write lock held: writes the batch's lines to the writers and empties it.
+   void HandOn(LogLineBatch* batch);
+   // With the write lock held: HandOn for every batch, forgetting orphaned ones.
+   void HandOnAll();
+   friend class LogThreadBatches;
+   friend void DrainLineBatches();
+   void AddBatch(const Ref<LogLineBatch>& batch);
 
    const std::string _name;
    // On a cache line of its own: every line writes it, from whichever thread logs, and
@@ -255,7 +331,21 @@ private:
    // The writers of _writers in its order, which every line walks: a vector walk costs
    // less than the map's, and the map keeps them alive.
    std::vector<LogWriter*> _order;
+   // Names this output among all made, for a thread's batches; its address may be reused.
+   const uint64_t _id;
+   // The batch size every writer takes, 0 when one does not; changed under the write lock.
+   std::atomic<int> _batchBytes{0};
+   // Every thread's batch for this output, under the write lock.
+   RefVector<LogLineBatch> _batches;
+   std::atomic<bool> _hasBatches{false};
+   // DrainLineBatches calls under way on this output; its destructor waits for none.
+   std::atomic<int> _drainers{0};
 };
+
+inline LogLineBatch* LogThreadBatches::Get(LogOutputImpl* output, int capacity) {
+   if (output == _lastOutput && output->GetId() == _lastId) return _last;
+   return GetOther(output, capacity);
+}
 
 class LoggerImpl : public virtual Logger, public ObjectImpl {
 public:
@@ -292,6 +382,8 @@ private:
    Ref<LoggerImpl> _parent;
    Ref<LogManagerImpl> _manager;
    Ref<LogOutput> _output;
+   // _output as this library's output, which can batch a thread's lines; null for another.
+   LogOutputImpl* const _outputImpl;
 };
 
 class LogManagerImpl : public virtual LogManager, public System::LockableObjectImpl {

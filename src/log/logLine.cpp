@@ -93,12 +93,17 @@ public:
    }
 
    // `logger` began the line; LogInternal knows its own lines by it.
+   // `outputImpl`: `output` when it is this library's, which batches whole lines in
+   // `batches`, the thread's.
    void Begin(const Logger* logger, Logger::CombinedLevel level, const std::string& subsystem,
-              LogOutput* output, const std::map<std::string, std::string>& context) {
+              LogOutput* output, LogOutputImpl* outputImpl, LogThreadBatches* batches,
+              const std::map<std::string, std::string>& context) {
       if (output == nullptr) PanicVerify("__null != output", __FILE__, __LINE__);
       if (_output) PanicVerify("__null == _output", __FILE__, __LINE__);
       _begunBy = logger;
       _output = output;
+      _outputImpl = outputImpl;
+      _batches = batches;
       _level = level;
       _locked = false;
       _chunkPos = 0;
@@ -126,6 +131,8 @@ public:
       if (!_locked) {
          _output->RecursiveWriteLock();
          _locked = true;
+         // The thread's batched lines come before this one's first piece.
+         if (_outputImpl) _outputImpl->HandOnBatch(*_batches);
       }
       int pos = _chunkPos;
       _chunkPos = 0;
@@ -166,11 +173,18 @@ public:
             }
             self->_chunkPos = 0;
             self->_output = nullptr;
+            self->_outputImpl = nullptr;
             self->_begunBy = nullptr;
          }
       } release{this};
       if (g_fastPath.load(std::memory_order_relaxed) && !_locked) {
-         if (_chunkPos > 0) _output->WriteMessage(_level, _chunk, _chunkPos);
+         if (_chunkPos > 0) {
+            if (_outputImpl) {
+               _outputImpl->WriteLine(*_batches, _level, _chunk, _chunkPos);
+            } else {
+               _output->WriteMessage(_level, _chunk, _chunkPos);
+            }
+         }
       } else {
          Flush();
       }
@@ -339,6 +353,8 @@ private:
    // Kept alive by the logger that began the line; a counted reference here would cost
    // two atomic operations a line.
    LogOutput* _output = nullptr;
+   LogOutputImpl* _outputImpl = nullptr;
+   LogThreadBatches* _batches = nullptr;
    const Logger* _begunBy = nullptr;
    bool _locked = false;
    Logger::CombinedLevel _level = 0;
@@ -383,6 +399,8 @@ public:
    size_t Depth() const { return _depth; }
 
    std::map<std::string, std::string> context;
+   // Destroyed after the writers, whose lines may still be in it.
+   LogThreadBatches batches;
 
 private:
    std::vector<Ref<TlsBufferedLogWriter>> _writers;
@@ -435,7 +453,8 @@ void LoggerImpl::BeginCombined(CombinedLevel level) {
    size_t depth = state.Depth();
    TlsBufferedLogWriter* writer = state.Push();
    try {
-      writer->Begin(this, level, _name, _output.Get(), state.context);
+      writer->Begin(this, level, _name, _output.Get(), _outputImpl, &state.batches,
+                    state.context);
    } catch (...) {
       state.Pop();
       throw;

@@ -1,0 +1,220 @@
+// Per-thread batches of whole lines: while every writer of an output is a buffered file
+// writer, a thread keeps its lines and hands them on a batch at a time, so that threads
+// logging at once do not pass the output's and the writer's locks between them on every
+// line. A batch is handed on when it is full, before a line of another level or one that
+// spans pieces, with every severe line (all threads' batches then), on the output's
+// Flush, Reopen and Close, before its writers change, and every half flush interval by
+// the file writers' flushing thread. Lines of different threads may therefore reach a
+// file out of their time order, by at most one batch each; a thread's own lines never.
+
+#include <algorithm>
+#include <cstring>
+#include <thread>
+#include <vector>
+
+#include "src/log/logImpl.h"
+
+namespace Pelmora::Service {
+
+namespace {
+
+// The outputs that have had batches. Lives until exit, like the outputs that may be
+// drained then; its lock is one a report child may take over.
+struct BatchRegistry {
+   LogWriterMutex mutex;
+   std::vector<LogOutputImpl*> outputs;
+};
+
+BatchRegistry& Registry() {
+   static BatchRegistry* const registry = new BatchRegistry();
+   return *registry;
+}
+
+std::atomic<uint64_t> g_nextOutputId{1};
+
+}  // namespace
+
+// ---- the thread's side
+
+LogThreadBatches::~LogThreadBatches() {
+   for (Entry& entry : _entries) {
+      std::lock_guard<LogWriterMutex> lock(entry.batch->mutex);
+      entry.batch->orphaned = true;
+   }
+}
+
+LogLineBatch* LogThreadBatches::Find(const LogOutputImpl* output) const {
+   // An entry whose output has gone may name a new output at the same address: the id
+   // tells them apart.
+   for (const Entry& entry : _entries) {
+      if (entry.output == output && entry.id == output->GetId()) return entry.batch.Get();
+   }
+   return nullptr;
+}
+
+LogLineBatch* LogThreadBatches::GetOther(LogOutputImpl* output, int capacity) {
+   LogLineBatch* batch = Find(output);
+   if (batch == nullptr) batch = Make(output, capacity);
+   _lastOutput = output;
+   _lastId = output->GetId();
+   _last = batch;
+   return batch;
+}
+
+LogLineBatch* LogThreadBatches::Make(LogOutputImpl* output, int capacity) {
+   // Entries of outputs that have gone are dropped here, the only time the list grows.
+   std::erase_if(_entries, [](Entry& entry) {
+      std::lock_guard<LogWriterMutex> lock(entry.batch->mutex);
+      return entry.batch->detached;
+   });
+   Ref<LogLineBatch> batch = new LogLineBatch(capacity);
+   _entries.push_back(Entry{output, output->GetId(), batch});
+   try {
+      output->AddBatch(batch);
+   } catch (...) {
+      _entries.pop_back();
+      throw;
+   }
+   return batch.Get();
+}
+
+// ---- the output's side
+
+LogOutputImpl::LogOutputImpl(const std::string& name)
+   : _name(name), _id(g_nextOutputId.fetch_add(1, std::memory_order_relaxed)) {}
+
+LogOutputImpl::~LogOutputImpl() {
+   if (!_hasBatches.load(std::memory_order_acquire)) return;
+   {
+      BatchRegistry& registry = Registry();
+      std::lock_guard<LogWriterMutex> lock(registry.mutex);
+      std::erase(registry.outputs, this);
+   }
+   // A drain that found this output before it left the registry finishes first.
+   while (_drainers.load(std::memory_order_acquire) > 0) std::this_thread::yield();
+   _lock.WriteLock();
+   for (Ref<LogLineBatch>& batch : _batches) {
+      std::lock_guard<LogWriterMutex> lock(batch->mutex);
+      HandOn(batch.Get());
+      batch->detached = true;
+   }
+   _batches.clear();
+   _lock.WriteUnlock();
+}
+
+void LogOutputImpl::AddBatch(const Ref<LogLineBatch>& batch) {
+   _lock.WriteLock();
+   try {
+      _batches.push_back(batch);
+   } catch (...) {
+      _lock.WriteUnlock();
+      throw;
+   }
+   bool first = !_hasBatches.exchange(true, std::memory_order_acq_rel);
+   _lock.WriteUnlock();
+   if (first) {
+      BatchRegistry& registry = Registry();
+      std::lock_guard<LogWriterMutex> lock(registry.mutex);
+      registry.outputs.push_back(this);
+   }
+}
+
+void LogOutputImpl::HandOn(LogLineBatch* batch) {
+   if (batch->size == 0) return;
+   int size = batch->size;
+   batch->size = 0;
+   Write(batch->level, batch->data, size);
+}
+
+void LogOutputImpl::HandOnAll() {
+   if (!_hasBatches.load(std::memory_order_relaxed)) return;
+   std::erase_if(_batches, [this](Ref<LogLineBatch>& batch) {
+      std::lock_guard<LogWriterMutex> lock(batch->mutex);
+      HandOn(batch.Get());
+      return batch->orphaned;
+   });
+}
+
+void LogOutputImpl::HandOnBatch(LogThreadBatches& mine) {
+   if (!_hasBatches.load(std::memory_order_relaxed)) return;
+   if (LogLineBatch* batch = mine.Find(this)) {
+      std::lock_guard<LogWriterMutex> lock(batch->mutex);
+      HandOn(batch);
+   }
+}
+
+void LogOutputImpl::DrainBatches() {
+   if (!_hasBatches.load(std::memory_order_acquire)) return;
+   _lock.WriteLock();
+   HandOnAll();
+   _lock.WriteUnlock();
+}
+
+void LogOutputImpl::WriteLine(LogThreadBatches& mine, Logger::CombinedLevel level,
+                              const char* data, int length) {
+   int bytes = _batchBytes.load(std::memory_order_relaxed);
+   if (bytes > 0 && length <= bytes && (level & kSevereLevels) == 0) {
+      LogLineBatch* batch = nullptr;
+      try {
+         batch = mine.Get(this, bytes);
+      } catch (...) {
+         // Without a batch the line goes the unbatched way.
+      }
+      if (batch) {
+         batch->mutex.lock();
+         // Read again under the batch's lock: a change of writers sets it before it
+         // hands the batches on, so a line kept here is handed on with them.
+         bool batching = _batchBytes.load(std::memory_order_relaxed) > 0 &&
+                         length <= batch->capacity;
+         if (batching && (batch->size == 0 || (batch->level == level &&
+                                               batch->size + length <= batch->capacity))) {
+            memcpy(batch->data + batch->size, data, static_cast<size_t>(length));
+            batch->size += length;
+            batch->level = level;
+            batch->mutex.unlock();
+            return;
+         }
+         batch->mutex.unlock();
+         // Full, or of another level: hand it on, then keep the line.
+         _lock.WriteLock();
+         batch->mutex.lock();
+         HandOn(batch);
+         batching = _batchBytes.load(std::memory_order_relaxed) > 0 && length <= batch->capacity;
+         if (batching) {
+            memcpy(batch->data, data, static_cast<size_t>(length));
+            batch->size = length;
+            batch->level = level;
+         }
+         batch->mutex.unlock();
+         if (!batching) Write(level, data, length);
+         _lock.WriteUnlock();
+         return;
+      }
+   }
+   _lock.WriteLock();
+   // A severe line brings every thread's earlier lines with it, for a report that may
+   // end the process; any other line this thread's own.
+   if ((level & kSevereLevels) != 0) {
+      HandOnAll();
+   } else {
+      HandOnBatch(mine);
+   }
+   Write(level, data, length);
+   _lock.WriteUnlock();
+}
+
+void DrainLineBatches() {
+   std::vector<LogOutputImpl*> outputs;
+   BatchRegistry& registry = Registry();
+   {
+      std::lock_guard<LogWriterMutex> lock(registry.mutex);
+      outputs = registry.outputs;
+      for (LogOutputImpl* output : outputs) output->_drainers.fetch_add(1, std::memory_order_acq_rel);
+   }
+   for (LogOutputImpl* output : outputs) {
+      output->DrainBatches();
+      output->_drainers.fetch_sub(1, std::memory_order_acq_rel);
+   }
+}
+
+}  // namespace Pelmora::Service

@@ -1,0 +1,250 @@
+// Per-thread batches of whole lines: order, nothing lost, and when they are handed on.
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <functional>
+#include <map>
+#include <mutex>
+#include <regex>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "pelmora/io.h"
+#include "pelmora/service.h"
+#include "src/log/logImpl.h"
+#include "tests/support/logWriters.h"
+#include "tests/support/watchdog.h"
+
+using namespace Pelmora;
+using namespace Pelmora::Service;
+using namespace Pelmora::TestSupport;
+
+namespace {
+
+std::vector<std::string> Lines(const std::string& text) {
+   std::vector<std::string> lines;
+   std::stringstream in(text);
+   for (std::string line; std::getline(in, line);) lines.push_back(line);
+   return lines;
+}
+
+bool WaitFor(const std::string& path, const std::string& text) {
+   auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+   while (ReadFile(path).find(text) == std::string::npos) {
+      if (std::chrono::steady_clock::now() >= deadline) return false;
+      std::this_thread::sleep_for(std::chrono::milliseconds(2));
+   }
+   return true;
+}
+
+// A thread that logs what it is told and then waits, alive, for the next order.
+class Logging {
+public:
+   Logging() : _thread([this] { Run(); }) {}
+   ~Logging() {
+      Do([] {});
+      {
+         std::lock_guard<std::mutex> lock(_mutex);
+         _stop = true;
+      }
+      _changed.notify_all();
+      Testing::Join(_thread, "the logging thread");
+   }
+   // Runs `work` on the thread and waits for it.
+   void Do(std::function<void()> work) {
+      std::unique_lock<std::mutex> lock(_mutex);
+      _work = std::move(work);
+      _changed.notify_all();
+      _changed.wait(lock, [this] { return !_work; });
+   }
+
+private:
+   void Run() {
+      std::unique_lock<std::mutex> lock(_mutex);
+      for (;;) {
+         _changed.wait(lock, [this] { return _stop || _work; });
+         if (_work) {
+            _work();
+            _work = nullptr;
+            _changed.notify_all();
+         } else if (_stop) {
+            return;
+         }
+      }
+   }
+
+   std::mutex _mutex;
+   std::condition_variable _changed;
+   std::function<void()> _work;
+   bool _stop = false;
+   std::thread _thread;
+};
+
+}  // namespace
+
+TEST(LogBatchTest, EachThreadsLinesArriveAllAndInOrderAcrossLevelsAndLongLines) {
+   Files f;
+   LogFileOptions options;
+   options.level = "trivia";
+   options.maxFileSize = 64 * 1024;  // rolls fall inside batches
+   options.maxFileNum = 50;
+   f.AddFile(options, "threads.log");
+   constexpr int kThreads = 4, kLines = 1500;
+   const std::string longText(3000, 'x');  // several pieces: goes around the batch
+   std::vector<std::thread> threads;
+   for (int t = 0; t < kThreads; ++t) {
+      threads.emplace_back([&, t] {
+         for (int i = 0; i < kLines; ++i) {
+            if (i % 300 == 299) {
+               PELMORA_LOG_INFO(f.logger.Get(), "thread %1 line %2 %3", t, i, longText);
+            } else if (i % 7 == 0) {
+               PELMORA_LOG_VERBOSE(f.logger.Get(), "thread %1 line %2", t, i);
+            } else {
+               PELMORA_LOG_INFO(f.logger.Get(), "thread %1 line %2", t, i);
+            }
+         }
+      });
+   }
+   Testing::JoinAll(threads, "the logging threads");
+   f.logger->GetLogManager()->Flush();
+
+   std::string text;
+   for (int i = options.maxFileNum - 1; i >= 1; --i) {
+      text += ReadFile(options.path + "." + std::to_string(i));
+   }
+   text += ReadFile(options.path);
+   std::map<int, int> next;
+   std::regex rule(".*\\] thread (\\d+) line (\\d+)( x+)?");
+   for (const std::string& line : Lines(text)) {
+      std::smatch match;
+      ASSERT_TRUE(std::regex_match(line, match, rule)) << line.substr(0, 200);
+      int t = std::stoi(match[1]), i = std::stoi(match[2]);
+      ASSERT_EQ(i, next[t]) << "thread " << t;
+      EXPECT_EQ(match[3].length() > 0, i % 300 == 299) << line.substr(0, 200);
+      next[t] = i + 1;
+   }
+   for (int t = 0; t < kThreads; ++t) EXPECT_EQ(next[t], kLines) << "thread " << t;
+}
+
+TEST(LogBatchTest, SevereLinesFlushesAndTheFlushIntervalHandOnEveryThreadsLines) {
+   Files f;
+   LogFileOptions options;
+   options.flushIntervalMs = 60 * 1000;  // the interval's own part comes last
+   f.AddFile(options, "severe.log");
+   Logging other;
+
+   other.Do([&] { PELMORA_LOG_INFO(f.logger.Get(), "kept by the other thread"); });
+   PELMORA_LOG_INFO(f.logger.Get(), "kept by this one");
+   PELMORA_LOG_ERROR(f.logger.Get(), "an error");
+   std::vector<std::string> lines = Lines(ReadFile(options.path));
+   ASSERT_EQ(lines.size(), 3u) << ReadFile(options.path);
+   EXPECT_NE(lines[0].find("kept by the other thread"), std::string::npos);
+   EXPECT_NE(lines[1].find("kept by this one"), std::string::npos);
+   EXPECT_NE(lines[2].find("an error"), std::string::npos);
+
+   // The writer's own Flush brings what threads keep for it, the output's as well.
+   other.Do([&] { PELMORA_LOG_INFO(f.logger.Get(), "before the writer's flush"); });
+   Ref<LogWriter> writer;
+   f.logger->GetLogOutput()->GetWriter("file", writer);
+   writer->Flush();
+   EXPECT_NE(ReadFile(options.path).find("before the writer's flush\n"), std::string::npos);
+   other.Do([&] { PELMORA_LOG_INFO(f.logger.Get(), "before the output's flush"); });
+   f.logger->GetLogOutput()->Flush();
+   EXPECT_NE(ReadFile(options.path).find("before the output's flush\n"), std::string::npos);
+
+   // Nothing asked for: the interval brings the lines of a thread that logs no more, and
+   // of one that has ended.
+   Files g;
+   LogFileOptions quick;
+   quick.flushIntervalMs = 20;
+   g.AddFile(quick, "interval.log");
+   Logging idle;
+   idle.Do([&] { PELMORA_LOG_INFO(g.logger.Get(), "from an idle thread"); });
+   EXPECT_TRUE(WaitFor(quick.path, "from an idle thread\n"));
+   std::thread ended([&] { PELMORA_LOG_INFO(g.logger.Get(), "from an ended thread"); });
+   Testing::Join(ended, "the short thread");
+   EXPECT_TRUE(WaitFor(quick.path, "from an ended thread\n"));
+}
+
+TEST(LogBatchTest, AnotherKindOfWriterTakesEveryLineAtOnceAndBatchesGoToTheirOwnWriters) {
+   Files f;
+   LogFileOptions options;
+   options.flushIntervalMs = 60 * 1000;
+   f.AddFile(options, "mixed.log");
+   LogOutput* output = f.logger->GetLogOutput();
+   PELMORA_LOG_INFO(f.logger.Get(), "before the plain writer");
+
+   // A writer of another kind joins: the kept line goes to the file alone, and every
+   // later line to both at once.
+   Ref<StringWriter> text;
+   CreateStringWriter(text);
+   Ref<LogWriter> plain;
+   CreateLogWriter("plain", text.Get(), "trivia", plain);
+   output->AddWriter("plain", plain.Get());
+   PELMORA_LOG_INFO(f.logger.Get(), "with the plain writer");
+   EXPECT_EQ(text->GetString().find("before the plain writer"), std::string::npos);
+   EXPECT_NE(text->GetString().find("with the plain writer\n"), std::string::npos);
+
+   // It leaves: lines are kept again, and go to the file alone.
+   Ref<LogWriter> removed;
+   output->RemoveWriter("plain", removed);
+   PELMORA_LOG_INFO(f.logger.Get(), "after the plain writer");
+   EXPECT_EQ(ReadFile(options.path).find("after the plain writer"), std::string::npos);
+   output->Flush();
+   std::vector<std::string> lines = Lines(ReadFile(options.path));
+   ASSERT_EQ(lines.size(), 3u);
+   EXPECT_NE(lines[0].find("before the plain writer"), std::string::npos);
+   EXPECT_NE(lines[1].find("with the plain writer"), std::string::npos);
+   EXPECT_NE(lines[2].find("after the plain writer"), std::string::npos);
+   EXPECT_EQ(text->GetString().find("after the plain writer"), std::string::npos);
+
+   // A thread's batch outlives its output: the output's end writes it out, and a new
+   // output (perhaps at the same address) gets a batch of its own.
+   std::string path;
+   {
+      Files gone;
+      LogFileOptions goneOptions;
+      goneOptions.flushIntervalMs = 60 * 1000;
+      gone.AddFile(goneOptions, "gone.log");
+      path = goneOptions.path;
+      PELMORA_LOG_INFO(gone.logger.Get(), "kept when the output went");
+      gone.logger.Reset();
+      EXPECT_NE(ReadFile(path).find("kept when the output went\n"), std::string::npos);
+   }
+   for (int i = 0; i < 3; ++i) {
+      Files next;
+      LogFileOptions nextOptions;
+      next.AddFile(nextOptions, "next.log");
+      PELMORA_LOG_INFO(next.logger.Get(), "to output %1", i);
+      next.logger->GetLogManager()->Flush();
+      EXPECT_NE(ReadFile(nextOptions.path).find("to output " + std::to_string(i) + "\n"),
+                std::string::npos);
+   }
+}
+
+TEST(LogBatchTest, ABatchThatFindsTheFileClosedIsHeldAndDroppedLineByLine) {
+   Files f;
+   LogFileOptions options;
+   options.maxHeldBytes = 1000;
+   options.reopenRetryMs = 0;
+   options.flushIntervalMs = 60 * 1000;
+   Ref<FileLogWriter> writer = f.AddFile(options, "closed.log", FileOps::Ops());
+   FileOps::failOpen = true;
+   f.logger->GetLogManager()->Reopen();
+   for (int i = 0; i < 20; ++i) PELMORA_LOG_INFO(f.logger.Get(), "held %1", i);
+   f.logger->GetLogOutput()->Flush();
+   FileOps::failOpen = false;
+   f.logger->GetLogManager()->Flush();
+   std::vector<std::string> lines = Lines(ReadFile(options.path));
+   ASSERT_FALSE(lines.empty());
+   for (size_t i = 0; i < lines.size(); ++i) {
+      EXPECT_NE(lines[i].find("] held " + std::to_string(i)), std::string::npos) << lines[i];
+   }
+   EXPECT_EQ(lines.size() + writer->GetLostCount(), 20u);
+   EXPECT_GT(writer->GetLostCount(), 0u);
+}
