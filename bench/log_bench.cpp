@@ -1,10 +1,11 @@
-// Logging: a call below the logger's level, and a short line to a file with one and two
-// threads, against spdlog's synchronous file sink and against the floor, a preformatted
-// line written with fwrite under a mutex. The floor's default stdio buffer makes far more
-// write(2) calls than our buffered file writer; the matched floor gives its FILE our
-// buffer size, so that both sides pay for about as many. Each file benchmark also reports
-// the process's CPU time per line ("proc_cpu_ns"): our flusher thread's share counts. Our
-// file rolls over every 64 MiB, as a daemon's would; the floor's file never does, so each
+// Logging: a call below the logger's level, and a short line to a file (and to a file
+// and the memory ring, as in a daemon) with one and two threads, against spdlog's
+// synchronous file sink and against the floor, a preformatted line written with fwrite
+// under a mutex. The floor's default stdio buffer makes far more write(2) calls than our
+// buffered file writer; the matched floor gives its FILE our buffer size, so that both
+// sides pay for about as many. Each file benchmark also reports the process's CPU time
+// per line ("proc_cpu_ns"): our flusher thread's share counts. Our file rolls over every
+// 64 MiB, as a daemon's would; the floor's file never does, so each
 // roll's cost is ours alone.
 
 #include <spdlog/sinks/basic_file_sink.h>
@@ -47,6 +48,27 @@ Logger* PelmoraFileLogger() {
       Ref<LogWriter> writer;
       CreateFileLogWriter("file", options, writer);
       logger->GetLogOutput()->AddWriter("file", writer.Get());
+      return logger.Release();
+   }();
+   return logger;
+}
+
+// As a daemon's: the file and the 256 KiB memory ring, both taking every info line.
+Logger* PelmoraFileAndRingLogger() {
+   static Logger* const logger = [] {
+      Ref<Logger> logger;
+      CreateLogger(nullptr, "bench", "info", nullptr, logger);
+      logger->SetMemLevelByName("info");
+      LogFileOptions options;
+      options.path = Dir() + "/pelmora-ring.log";
+      options.maxFileSize = 64ll << 20;
+      options.maxFileNum = 2;
+      Ref<LogWriter> writer;
+      CreateFileLogWriter("file", options, writer);
+      logger->GetLogOutput()->AddWriter("file", writer.Get());
+      Ref<LogWriter> ring;
+      CreateMemLogWriter(LogManager::kMemoryOutput, 256, "trivia", ring);
+      logger->GetLogOutput()->AddWriter(LogManager::kMemoryOutput, ring.Get());
       return logger.Release();
    }();
    return logger;
@@ -143,6 +165,18 @@ void BM_PelmoraFile(benchmark::State& state) {
 }
 BENCHMARK(BM_PelmoraFile)->Threads(1)->Threads(2)->UseRealTime();
 
+void BM_PelmoraFileAndRing(benchmark::State& state) {
+   Logger* logger = PelmoraFileAndRingLogger();
+   int i = 0;
+   ProcessCpuPerLine cpu(state);
+   for (auto _ : state) {
+      PELMORA_LOG_INFO(logger, "request %1 served for client %2 in time", ++i, kClient);
+   }
+   cpu.Report();
+   state.SetItemsProcessed(state.iterations());
+}
+BENCHMARK(BM_PelmoraFileAndRing)->Threads(1)->Threads(2)->UseRealTime();
+
 void BM_SpdlogFile(benchmark::State& state) {
    spdlog::logger* logger = SpdlogFileLogger();
    int i = 0;
@@ -184,6 +218,8 @@ int main(int argc, char** argv) {
         {"BM_PelmoraFile/real_time/threads:2", "BM_SpdlogFile/real_time/threads:2"},
         {"BM_PelmoraFile/real_time/threads:1", "BM_FloorFwrite/real_time/threads:1"},
         {"BM_PelmoraFile/real_time/threads:2", "BM_FloorFwrite/real_time/threads:2"},
+        {"BM_PelmoraFileAndRing/real_time/threads:1", "BM_FloorFwrite/real_time/threads:1"},
+        {"BM_PelmoraFileAndRing/real_time/threads:2", "BM_FloorFwrite/real_time/threads:2"},
         {"BM_PelmoraFile/real_time/threads:1", "BM_FloorFwriteMatched/real_time/threads:1"},
         {"BM_PelmoraFile/real_time/threads:2", "BM_FloorFwriteMatched/real_time/threads:2"}},
        {"proc_cpu_ns"});

@@ -1,11 +1,12 @@
-// Per-thread batches of whole lines: while every writer of an output is a buffered file
-// writer, a thread keeps its lines and hands them on a batch at a time, so that threads
-// logging at once do not pass the output's and the writer's locks between them on every
-// line. A batch is handed on when it is full, before a line of another level or one that
-// spans pieces, with every severe line (all threads' batches then), on the output's
-// Flush, Reopen and Close, before its writers change, and every half flush interval by
-// the file writers' flushing thread. Lines of different threads may therefore reach a
-// file out of their time order, by at most one batch each; a thread's own lines never.
+// Per-thread batches of whole lines: while every writer of an output takes them (buffered
+// file writers, which set their size, and the memory ring), a thread keeps its lines and
+// hands them on a batch at a time, so that threads logging at once do not pass the
+// output's and the writers' locks between them on every line. A batch is handed on when
+// it is full, before a line of another level or one that spans pieces, with every severe
+// line (all threads' batches then), on the output's Flush, Reopen and Close, before its
+// writers change, when the ring is read, and every half flush interval by the file
+// writers' flushing thread. Lines of different threads may therefore reach a writer out
+// of their time order, by at most one batch each; a thread's own lines never.
 
 #include <algorithm>
 #include <cstring>
@@ -135,8 +136,9 @@ void LogOutputImpl::HandOnAll() {
    });
 }
 
-void LogOutputImpl::HandOnBatch(LogThreadBatches& mine) {
+void LogOutputImpl::HandOnBefore(LogThreadBatches& mine, Logger::CombinedLevel level) {
    if (!_hasBatches.load(std::memory_order_relaxed)) return;
+   if ((level & kSevereLevels) != 0) return HandOnAll();
    if (LogLineBatch* batch = mine.Find(this)) {
       std::lock_guard<LogWriterMutex> lock(batch->mutex);
       HandOn(batch);
@@ -192,13 +194,7 @@ void LogOutputImpl::WriteLine(LogThreadBatches& mine, Logger::CombinedLevel leve
       }
    }
    _lock.WriteLock();
-   // A severe line brings every thread's earlier lines with it, for a report that may
-   // end the process; any other line this thread's own.
-   if ((level & kSevereLevels) != 0) {
-      HandOnAll();
-   } else {
-      HandOnBatch(mine);
-   }
+   HandOnBefore(mine, level);
    Write(level, data, length);
    _lock.WriteUnlock();
 }

@@ -121,11 +121,15 @@ void MemLogWriterImpl::WriteLocked(Logger::CombinedLevel level, const char* data
 }
 
 std::string MemLogWriterImpl::GetText() {
+   DrainLineBatches();
    std::lock_guard<LogWriterMutex> lock(_mutex);
    return GetTextLocked();
 }
 
 std::string MemLogWriterImpl::GetTextForReport(std::chrono::steady_clock::time_point deadline) {
+   // Only a report child may hand the batches on without waiting: it takes over the locks
+   // that threads held when it was made. Elsewhere the report's own line has done it.
+   if (Internal::InReportChild()) DrainLineBatches();
    std::unique_lock<LogWriterMutex> lock(_mutex, std::try_to_lock);
    while (!lock.owns_lock() && std::chrono::steady_clock::now() < deadline) {
       std::this_thread::yield();
@@ -269,13 +273,18 @@ void LogOutputImpl::RemoveWriter(const std::string& name, Ref<LogWriter>& out) {
 
 void LogOutputImpl::Reorder() {
    _order.clear();
-   int batchBytes = _writers.empty() ? 0 : INT_MAX;
+   // Lines are batched when every writer takes batches and one of them sets a size.
+   int batchBytes = INT_MAX;
+   bool sized = false;
    for (auto& [name, writer] : _writers) {
       _order.push_back(writer.Get());
       auto* impl = dynamic_cast<LogWriterImpl*>(writer.Get());
-      batchBytes = std::min(batchBytes, impl ? impl->GetLineBatchBytes() : 0);
+      int bytes = impl ? impl->GetLineBatchBytes() : 0;
+      if (bytes == LogWriterImpl::kAnyLineBatch) continue;
+      batchBytes = std::min(batchBytes, bytes);
+      sized = true;
    }
-   _batchBytes.store(batchBytes, std::memory_order_relaxed);
+   _batchBytes.store(sized ? batchBytes : 0, std::memory_order_relaxed);
 }
 
 void LogOutputImpl::GetWriter(const std::string& name, Ref<LogWriter>& out) {

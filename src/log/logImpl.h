@@ -123,8 +123,10 @@ public:
    Writer* GetTarget() const override { return _target.Get(); }
    bool IsMemoryWriter() const { return _memory; }
    // Bytes of whole lines of one level that a thread may keep for this writer before
-   // handing them on together; 0 when every line must reach it at once.
+   // handing them on together; 0 when every line must reach it at once, kAnyLineBatch
+   // when it takes the batches its output's other writers ask for.
    virtual int GetLineBatchBytes() const { return 0; }
+   static constexpr int kAnyLineBatch = -1;
 
 protected:
    // With _mutex held.
@@ -149,6 +151,9 @@ public:
    // As GetText for a dying process: waits for the lock until `deadline`, then reads
    // without it (in a report child, the thread that held it no longer runs).
    std::string GetTextForReport(std::chrono::steady_clock::time_point deadline);
+
+   // Lines reach it in their threads' batches; reading it hands every batch on first.
+   int GetLineBatchBytes() const override { return kAnyLineBatch; }
 
 protected:
    void WriteLocked(Logger::CombinedLevel level, const char* data, int length) override;
@@ -300,9 +305,10 @@ public:
    // at once otherwise, after the thread's earlier lines.
    void WriteLine(LogThreadBatches& mine, Logger::CombinedLevel level, const char* data,
                   int length);
-   // With the write lock held (a line that spans several pieces): writes the thread's
-   // batched lines out first, so that its lines stay in order.
-   void HandOnBatch(LogThreadBatches& mine);
+   // With the write lock held, before a line at `level` goes to the writers unbatched:
+   // hands on the thread's batch, so that its lines stay in order, and for a severe line
+   // every thread's, for a report that may end the process.
+   void HandOnBefore(LogThreadBatches& mine, Logger::CombinedLevel level);
    // Hands every thread's batched lines to the writers.
    void DrainBatches();
    uint64_t GetId() const { return _id; }

@@ -132,7 +132,7 @@ public:
          _output->RecursiveWriteLock();
          _locked = true;
          // The thread's batched lines come before this one's first piece.
-         if (_outputImpl) _outputImpl->HandOnBatch(*_batches);
+         if (_outputImpl) _outputImpl->HandOnBefore(*_batches, _level);
       }
       int pos = _chunkPos;
       _chunkPos = 0;

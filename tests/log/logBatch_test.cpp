@@ -1,6 +1,7 @@
 // Per-thread batches of whole lines: order, nothing lost, and when they are handed on.
 
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <chrono>
@@ -14,6 +15,7 @@
 #include <thread>
 #include <vector>
 
+#include "pelmora/exception/panic.h"
 #include "pelmora/io.h"
 #include "pelmora/service.h"
 #include "src/log/logImpl.h"
@@ -247,4 +249,63 @@ TEST(LogBatchTest, ABatchThatFindsTheFileClosedIsHeldAndDroppedLineByLine) {
    }
    EXPECT_EQ(lines.size() + writer->GetLostCount(), 20u);
    EXPECT_GT(writer->GetLostCount(), 0u);
+}
+
+TEST(LogBatchTest, TheRingTakesBatchesAndReadingItHandsEveryThreadsLinesOn) {
+   Files f;
+   LogFileOptions options;
+   options.flushIntervalMs = 60 * 1000;
+   f.AddFile(options, "ring.log");
+   LogOutput* output = f.logger->GetLogOutput();
+   Ref<LogWriter> ring;
+   CreateMemLogWriter("ring", 64, "trivia", ring);
+   ring->SetMask(Logger::LOG_INFO);  // its file half, so that every info line reaches it
+   output->AddWriter("ring", ring.Get());
+   Logging other;
+   other.Do([&] { PELMORA_LOG_INFO(f.logger.Get(), "from the other thread"); });
+   PELMORA_LOG_INFO(f.logger.Get(), "from this one");
+   // Kept, not written yet: the ring alone does not stop the batching.
+   EXPECT_EQ(ReadFile(options.path), "");
+   std::string text = dynamic_cast<MemLogWriterImpl*>(ring.Get())->GetText();
+   std::vector<std::string> lines = Lines(text);
+   ASSERT_EQ(lines.size(), 2u) << text;
+   EXPECT_NE(lines[0].find("from the other thread"), std::string::npos);
+   EXPECT_NE(lines[1].find("from this one"), std::string::npos);
+   output->Flush();
+   EXPECT_EQ(Lines(ReadFile(options.path)).size(), 2u);
+}
+
+// The default output with a file and the ring alone batches its lines; a panic's report
+// still carries another thread's kept line, in the file and in the ring's dump.
+TEST(LogBatchDeathTest, APanicReportCarriesTheLinesOtherThreadsKept) {
+   // The child (a new run of this binary) names the file after its parent, this process.
+   std::string path = "/tmp/pelmora-batch-panic-" + std::to_string(getpid()) + ".log";
+   EXPECT_DEATH(
+       {
+          LogOutput* output = GetDefaultLogger()->GetLogOutput();
+          Ref<LogWriter> console;
+          output->RemoveWriter("console", console);
+          LogFileOptions options;
+          options.path = "/tmp/pelmora-batch-panic-" + std::to_string(getppid()) + ".log";
+          options.level = "trivia";
+          options.flushIntervalMs = 60 * 1000;
+          Ref<LogWriter> file;
+          CreateFileLogWriter("file", options, file);
+          output->AddWriter("file", file.Get());
+          std::atomic<bool> logged{false};
+          std::thread([&] {
+             PELMORA_LOG_WARNING(GetDefaultLogger(), "kept by another thread");
+             logged.store(true);
+             for (;;) pause();
+          }).detach();
+          while (!logged.load()) std::this_thread::yield();
+          PELMORA_VERIFY(1 + 1 == 3);
+       },
+       "");
+   std::string text = ReadFile(path);
+   unlink(path.c_str());
+   EXPECT_TRUE(std::regex_search(
+       text, std::regex("kept by another thread\n(.|\n)*Panic: Assert Failed(.|\n)*"
+                        "Recent log lines(.|\n)*kept by another thread")))
+       << text;
 }

@@ -24,15 +24,16 @@ namespace Pelmora::Service {
 // Flush, and otherwise about `flushIntervalMs` after they were written (checked every
 // half interval by one process-wide thread, which writes outside the lock that making
 // and destroying file writers take, so a slow disk holds up only its own writer).
-// While every writer of a log output is a file writer with a buffer and a flush interval,
-// each thread keeps its lines of one level for that output, up to the smallest
-// `threadBufferSize` among them, and hands them on together (see LogOutput): when that is
-// full, before its next line of another level or longer than a chunk, with every line at
-// level error or more severe (every thread's then), on the output's Flush, Reopen and
-// Close and this writer's Flush, and within half a flush interval otherwise. So threads
-// that log at once do not hand a lock to each other on every line; their lines may reach
-// the file out of time order by up to one batch, a thread's own lines never, and a line
-// waits up to about two flush intervals before it is written.
+// While every writer of a log output is a file writer with a buffer and a flush interval
+// or the in-memory ring (and one is a file writer), each thread keeps its lines of one
+// level for that output, up to the smallest `threadBufferSize` among the files, and hands
+// them on together: when that is full, before its next line of another level or one that
+// spans pieces, with every line at level error or more severe (every thread's then), on
+// the output's Flush, Reopen and Close, this writer's Flush and a read of the ring, and
+// within half a flush interval otherwise. So threads that log at once do not hand a lock
+// to each other on every line; their lines may reach the file and the ring out of time
+// order by up to one batch (a thread's own lines never), and a line waits up to about
+// two flush intervals before it is written.
 // Reopen (the manager's, after an outside rotation renamed the file) writes the buffer
 // to the old file and opens `path` anew.
 // When `path` cannot be opened again (after a roll or Reopen; out of descriptors, say),
