@@ -5,8 +5,8 @@
 // buffered file writer; the matched floor gives its FILE our buffer size, so that both
 // sides pay for about as many. Each file benchmark also reports the process's CPU time
 // per line ("proc_cpu_ns"): our flusher thread's share counts. Our file rolls over every
-// 64 MiB, as a daemon's would; the floor's file never does, so each
-// roll's cost is ours alone.
+// 64 MiB, as a daemon's would; the floor's file never does, so each roll's cost is ours
+// alone.
 
 #include <spdlog/sinks/basic_file_sink.h>
 #include <spdlog/spdlog.h>
