@@ -16,6 +16,7 @@
 #include "pelmora/exception/panic.h"
 #include "pelmora/object/scoreboard.h"
 #include "pelmora/xml/parser.h"
+#include "src/xml/documentEvents.h"
 #include "src/xml/nodeArena.h"
 #include "src/xml/nodeImpl.h"
 #include "src/xml/xmlLog.h"
@@ -42,20 +43,26 @@ void VerifyLimits(const DocLimits& limits) {
 // a hash and a compare and a small document allocates nothing here.
 class NameTable {
 public:
-   const ElementName* Find(std::string_view qualifiedName, NodeArena* arena) {
+   // `qualifiedName` is null-terminated, as expat hands it over: its length is found in
+   // the same pass as its hash.
+   const ElementName* Find(const char* qualifiedName, NodeArena* arena, size_t& length) {
       if (_slots.empty()) _slots.resize(kFirstSize);
-      uint64_t hash = Hash(qualifiedName);
+      uint64_t hash = kHashBasis;  // FNV-1a
+      const char* end = qualifiedName;
+      for (; *end; ++end) hash = (hash ^ static_cast<unsigned char>(*end)) * kHashPrime;
+      length = static_cast<size_t>(end - qualifiedName);
+      std::string_view name(qualifiedName, length);
       size_t mask = _slots.size() - 1;
       for (size_t i = hash & mask;; i = (i + 1) & mask) {
          Slot& slot = _slots[i];
          if (!slot.name) {
-            slot.name = arena->NewName(qualifiedName, slot.key);
+            slot.name = arena->NewName(name, slot.key);
             slot.hash = hash;
             const ElementName* made = slot.name;
             if (++_count * 2 > _slots.size()) Grow();
             return made;
          }
-         if (slot.hash == hash && slot.key == qualifiedName) return slot.name;
+         if (slot.hash == hash && slot.key == name) return slot.name;
       }
    }
 
@@ -75,11 +82,8 @@ private:
       const ElementName* name = nullptr;
    };
 
-   static uint64_t Hash(std::string_view text) {
-      uint64_t hash = 14695981039346656037ull;  // FNV-1a
-      for (char c : text) hash = (hash ^ static_cast<unsigned char>(c)) * 1099511628211ull;
-      return hash;
-   }
+   static constexpr uint64_t kHashBasis = 14695981039346656037ull;
+   static constexpr uint64_t kHashPrime = 1099511628211ull;
 
    void Grow() {
       std::vector<Slot> old(_slots.size() * 2);
@@ -97,7 +101,7 @@ private:
    size_t _count = 0;
 };
 
-class XMLDocHandlerImpl final : public virtual XMLHandler, public ObjectImpl {
+class XMLDocHandlerImpl final : public virtual XMLHandler, public ObjectImpl, public DocumentEvents {
 public:
    explicit XMLDocHandlerImpl(const DocLimits& limits)
        : _maxChars(static_cast<uint64_t>(limits.maxChars)),
@@ -116,7 +120,8 @@ public:
    void StartNewDocument(bool restricted, Ref<Object>& result) override {
       ReportMadeNodes();
       _stack.clear();
-      _textOpen = false;
+      _openText = nullptr;
+      _collecting = false;
       _bytes = 0;
       _nodes = 0;
       _restricted = restricted;
@@ -134,7 +139,8 @@ public:
       // Before any node can go: the nodes' releases count down what this counted up.
       ReportMadeNodes();
       _stack.clear();
-      _textOpen = false;
+      _openText = nullptr;
+      _collecting = false;
       _names.Clear();
       _document.Reset();
       ReleaseArena();
@@ -142,10 +148,21 @@ public:
 
    void OnStartElement(const std::string& name, int line, int column,
                        const char** attributes) override {
+      StartElement(name.c_str(), line, column, attributes);
+   }
+   void OnEndElement(const std::string&) override { EndElement(); }
+   void OnCharacters(const char* data, int length) override { Characters(data, length); }
+   void OnStartCData() override { StartCData(); }
+   void OnEndCData() override { EndCData(); }
+   void OnComment(const std::string& text) override { AddComment(text.data(), text.size()); }
+
+   void StartElement(const char* name, int line, int column, const char** attributes) override {
       CloseText();
-      IncNodeCountAndValidate(name.size());
+      size_t nameLength;
+      const ElementName* elementName = _names.Find(name, _arena, nameLength);
+      IncNodeCountAndValidate(nameLength);
       std::unique_ptr<ElementNodeImpl> element(
-          new (_arena) ElementNodeImpl(_names.Find(name, _arena), line, column, _arena));
+          new (_arena) ElementNodeImpl(elementName, line, column, _arena));
       // Each length is taken once, for the limit and for the copy.
       _attributes.clear();
       for (const char** attribute = attributes; *attribute; attribute += 2) {
@@ -155,51 +172,59 @@ public:
          _attributes.push_back({attribute[0], nameLength, attribute[1], valueLength});
       }
       element->DefineParsedAttributes(_attributes.data(), _attributes.size());
-      Push(std::move(element));
+      Push(element.release());
    }
 
-   void OnEndElement(const std::string&) override {
+   void EndElement() override {
       CloseText();
       Pop();
    }
 
-   // Expat splits character data at line ends and references: one text node takes all,
-   // collected here first so that the node's text is allocated once, at its full size.
-   // The limits count each piece as it comes, the node with the first.
-   void OnCharacters(const char* data, int length) override {
-      if (_textOpen) {
-         ValidateByteCount(static_cast<uint64_t>(length));
-         _text.append(data, static_cast<size_t>(length));
+   // Expat splits character data at line ends and references: one text node takes all.
+   // The node is made with the first piece, which for most texts is the only one, so its
+   // text is copied once, straight from expat. Later pieces go into the node while they
+   // fit its storage; past that they are collected here, so that the node's text is
+   // allocated once more, at its full size. The limits count each piece as it comes, the
+   // node with the first.
+   void Characters(const char* data, int length) override {
+      size_t size = static_cast<size_t>(length);
+      if (!_openText) {
+         IncNodeCountAndValidate(size);
+         _openText = AddLeaf(new (_arena) TextNodeImpl(data, size));
          return;
       }
-      IncNodeCountAndValidate(static_cast<uint64_t>(length));
-      _text.assign(data, static_cast<size_t>(length));
-      _textOpen = true;
+      ValidateByteCount(size);
+      if (_collecting) {
+         _text.append(data, size);
+         return;
+      }
+      std::string& text = _openText->ParsedText();
+      if (size <= text.capacity() - text.size()) {
+         text.append(data, size);
+         return;
+      }
+      _text.reserve(text.size() + size);
+      _text.assign(text).append(data, size);
+      _collecting = true;
    }
 
-   void OnStartCData() override {
+   void StartCData() override {
       CloseText();
       IncNodeCountAndValidate(0);
-      Push(std::unique_ptr<CDataNodeImpl>(new (_arena) CDataNodeImpl()));
+      Push(new (_arena) CDataNodeImpl());
    }
 
-   void OnEndCData() override {
+   void EndCData() override {
       CloseText();
       Pop();
    }
 
-   // Comments and processing instructions hold text too, so their bytes count as well.
-   void OnComment(const std::string& text) override {
-      CloseText();
-      IncNodeCountAndValidate(text.size());
-      AppendLeaf(std::unique_ptr<CommentNodeImpl>(new (_arena) CommentNodeImpl(text)));
-   }
+   void Comment(const char* text) override { AddComment(text, std::strlen(text)); }
 
    void OnProcessingInstruction(const std::string& target, const std::string& data) override {
       CloseText();
       IncNodeCountAndValidate(target.size() + data.size());
-      AppendLeaf(std::unique_ptr<ProcessingInstructionNodeImpl>(
-          new (_arena) ProcessingInstructionNodeImpl(target, data)));
+      AddLeaf(new (_arena) ProcessingInstructionNodeImpl(target, data));
    }
 
    void OnXMLDeclaration(const std::string& version, const std::string& encoding, int) override {
@@ -208,26 +233,12 @@ public:
    }
 
 private:
-   // Appends `node` to the top node and makes it the top. Until the tree holds it, the
-   // node is owned here, so a refused insertion frees it.
-   // The kind of node is known here, which spares the checks and calls that find it out.
+   // Appends `node` to the top node and makes it the top.
    template <class T>
-   void Push(std::unique_ptr<T> node) {
-      constexpr int kKind = KindOf<T>();
-      NodeImpl* added = node.get();
-      const Open& parent = _stack.back();
-      if (parent.kind == kElementNode && kKind != kProcessingInstructionNode) {
-         parent.node->AppendParsedChildOfElement(added, !_countInBulk);
-      } else {
-         parent.node->AppendParsedChild(added, !_countInBulk);
-      }
-      static_cast<void>(node.release());  // the tree holds it now
-      if (_countInBulk) ++_made[kKind];
-      _stack.push_back({added, kKind});
-      if (_restricted && _stack.size() > _maxDepth) {
-         LogXml(kXmlLogWarning, "XML document too deep: %1 (max: %2)", _stack.size(), _maxDepth);
-         throw ParsingAbortedException();
-      }
+   void Push(T* node) {
+      Link(node);
+      _stack.push_back({node, KindOf<T>()});
+      VerifyDepth(_stack.size());
    }
 
    void Pop() {
@@ -235,17 +246,56 @@ private:
       _stack.pop_back();
    }
 
+   // Appends a node that takes no children (or none from the parser) to the top node. It
+   // counts towards the depth as if it were opened and closed.
    template <class T>
-   void AppendLeaf(std::unique_ptr<T> node) {
-      Push(std::move(node));
-      Pop();
+   T* AddLeaf(T* node) {
+      Link(node);
+      VerifyDepth(_stack.size() + 1);
+      return node;
    }
 
-   // Makes the text node of the character data collected so far.
+   // Links a node made for the top node as its last child. Until the tree holds it, the
+   // node is owned here, so a refused insertion frees it. The kind of node is known here,
+   // which spares the checks and calls that find it out.
+   template <class T>
+   void Link(T* node) {
+      constexpr int kKind = KindOf<T>();
+      const Open& parent = _stack.back();
+      if (parent.kind == kElementNode && kKind != kProcessingInstructionNode) {
+         parent.node->AppendParsedChildOfElement(node, !_countInBulk);
+      } else {
+         std::unique_ptr<T> owned(node);
+         parent.node->AppendParsedChild(node, !_countInBulk);
+         static_cast<void>(owned.release());  // the tree holds it now
+      }
+      if (_countInBulk) ++_made[kKind];
+   }
+
+   void VerifyDepth(size_t depth) {
+      if (_restricted && depth > _maxDepth) {
+         LogXml(kXmlLogWarning, "XML document too deep: %1 (max: %2)", depth, _maxDepth);
+         throw ParsingAbortedException();
+      }
+   }
+
+   // Comments and processing instructions hold text too, so their bytes count as well.
+   void AddComment(const char* text, size_t length) {
+      CloseText();
+      IncNodeCountAndValidate(length);
+      AddLeaf(new (_arena) CommentNodeImpl(text, length));
+   }
+
+   // Ends the text node that character data goes to, giving it what was collected.
    void CloseText() {
-      if (!_textOpen) return;
-      _textOpen = false;
-      AppendLeaf(std::unique_ptr<TextNodeImpl>(new (_arena) TextNodeImpl(_text.data(), _text.size())));
+      if (!_openText) return;
+      if (_collecting) FinishCollectedText();
+      _openText = nullptr;
+   }
+
+   void FinishCollectedText() {
+      _collecting = false;
+      _openText->ParsedText() = std::string(_text.data(), _text.size());
       // A handler may live as long as the process (a pooled parser): it keeps the buffer
       // of the usual small texts, not of the largest it ever saw.
       if (_text.capacity() > kKeptTextBytes) std::string().swap(_text);
@@ -311,9 +361,11 @@ private:
    NameTable _names;
    // The attributes of the start tag at hand; the vector keeps its capacity.
    std::vector<ElementNodeImpl::ParsedAttribute> _attributes;
-   // Character data not yet made into a node; the buffer keeps up to kKeptTextBytes.
+   // The text node character data goes to, until another event ends it, and whether its
+   // text is being collected in `_text`, which keeps up to kKeptTextBytes between texts.
+   TextNodeImpl* _openText = nullptr;
+   bool _collecting = false;
    std::string _text;
-   bool _textOpen = false;
    // Nodes linked into the tree but not yet on the scoreboard, by kind.
    bool _countInBulk = false;
    int _made[kProcessingInstructionNode + 1] = {};

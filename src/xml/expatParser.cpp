@@ -8,11 +8,13 @@
 #include <climits>
 #include <cstddef>
 #include <random>
+#include <type_traits>
 
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/exception/panic.h"
 #include "pelmora/io/readers.h"
 #include "pelmora/xml/parser.h"
+#include "src/xml/documentEvents.h"
 #include "src/xml/xmlLog.h"
 
 namespace Pelmora::Xml {
@@ -45,6 +47,9 @@ public:
    void SetXMLHandler(XMLHandler* handler) override {
       PELMORA_VERIFY(handler != NULL);
       _handler = handler;
+      _events = dynamic_cast<DocumentEvents*>(handler);
+      // Also when a handler is exchanged during a parse: the events go to the new one.
+      if (_parser) InstallCallbacks();
    }
 
    XMLHandler* GetXMLHandler() override { return _handler.Get(); }
@@ -92,7 +97,11 @@ private:
    void Forward(Event&& event) noexcept {
       if (_stopped) return;
       try {
-         event(_handler.Get());
+         if constexpr (std::is_invocable_v<Event, XMLHandler*>) {
+            event(_handler.Get());
+         } else {
+            event(_events);
+         }
       } catch (const ParsingAbortedException&) {
          Stop();  // the handler has logged why
       } catch (const Throwable& e) {
@@ -136,6 +145,29 @@ private:
    static void XMLCALL EndCData(void* userData) {
       Self(userData)->Forward([](XMLHandler* h) { h->OnEndCData(); });
    }
+   // The same events for the standard handler.
+   static void XMLCALL StartElementEvent(void* userData, const XML_Char* name,
+                                         const XML_Char** atts) {
+      XMLParserImpl* self = Self(userData);
+      int line = static_cast<int>(XML_GetCurrentLineNumber(self->_parser));
+      int column = static_cast<int>(XML_GetCurrentColumnNumber(self->_parser));
+      self->Forward([&](DocumentEvents* e) { e->StartElement(name, line, column, atts); });
+   }
+   static void XMLCALL EndElementEvent(void* userData, const XML_Char*) {
+      Self(userData)->Forward([](DocumentEvents* e) { e->EndElement(); });
+   }
+   static void XMLCALL CharactersEvent(void* userData, const XML_Char* data, int length) {
+      Self(userData)->Forward([&](DocumentEvents* e) { e->Characters(data, length); });
+   }
+   static void XMLCALL CommentEvent(void* userData, const XML_Char* text) {
+      Self(userData)->Forward([&](DocumentEvents* e) { e->Comment(text); });
+   }
+   static void XMLCALL StartCDataEvent(void* userData) {
+      Self(userData)->Forward([](DocumentEvents* e) { e->StartCData(); });
+   }
+   static void XMLCALL EndCDataEvent(void* userData) {
+      Self(userData)->Forward([](DocumentEvents* e) { e->EndCData(); });
+   }
    static void XMLCALL XmlDeclaration(void* userData, const XML_Char* version,
                                       const XML_Char* encoding, int standalone) {
       Self(userData)->Forward([&](XMLHandler* h) {
@@ -156,6 +188,8 @@ private:
    }
 
    Ref<XMLHandler> _handler;
+   // The handler's direct events when it is the standard handler, else null.
+   DocumentEvents* _events = nullptr;
    XML_Parser _parser = nullptr;
    bool _restricted = false;
    bool _stopped = false;
@@ -166,11 +200,18 @@ private:
 
 void XMLParserImpl::InstallCallbacks() {
    XML_SetUserData(_parser, this);
-   XML_SetElementHandler(_parser, StartElement, EndElement);
+   if (_events) {
+      XML_SetElementHandler(_parser, StartElementEvent, EndElementEvent);
+      XML_SetCdataSectionHandler(_parser, StartCDataEvent, EndCDataEvent);
+      XML_SetCommentHandler(_parser, CommentEvent);
+      XML_SetCharacterDataHandler(_parser, CharactersEvent);
+   } else {
+      XML_SetElementHandler(_parser, StartElement, EndElement);
+      XML_SetCdataSectionHandler(_parser, StartCData, EndCData);
+      XML_SetCommentHandler(_parser, Comment);
+      XML_SetCharacterDataHandler(_parser, Characters);
+   }
    XML_SetProcessingInstructionHandler(_parser, ProcessingInstruction);
-   XML_SetCdataSectionHandler(_parser, StartCData, EndCData);
-   XML_SetCommentHandler(_parser, Comment);
-   XML_SetCharacterDataHandler(_parser, Characters);
    XML_SetXmlDeclHandler(_parser, XmlDeclaration);
    XML_SetEntityDeclHandler(_parser, EntityDeclaration);
 }

@@ -264,6 +264,9 @@ public:
    void WriteNode(Writer* writer, int indent) const override;
    void VerifyInsertAllowed(Node* child) const override;
 
+   // For the parser, which adds the later pieces of a text to the node it made.
+   std::string& ParsedText() { return _text; }
+
 private:
    std::string _text;
 };
@@ -283,6 +286,7 @@ public:
 
    CommentNodeImpl() = default;
    explicit CommentNodeImpl(const std::string& comment) : _comment(comment) {}
+   CommentNodeImpl(const char* data, size_t length) : _comment(data, length) {}
 
    int GetNodeType() const override { return kCommentNode; }
    const std::string& GetComment() const override { return _comment; }

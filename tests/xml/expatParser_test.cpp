@@ -206,10 +206,10 @@ TEST_F(ParserTest, RestrictedParsesRefuseEntityDeclarationsAndBillionLaughs) {
    EXPECT_THAT(Sink().Take(), testing::ElementsAre(HasSubstr("\"lol\"")));
 }
 
-std::string Nested(int depth) {
+std::string Nested(int depth, const std::string& inside = "") {
    std::string open, close;
    for (int i = 0; i < depth; ++i) open += "<e>", close += "</e>";
-   return open + close;
+   return open + inside + close;
 }
 
 TEST_F(ParserTest, LimitsAcceptExactlyTheLimitAndApplyOnlyToRestrictedParses) {
@@ -229,6 +229,10 @@ TEST_F(ParserTest, LimitsAcceptExactlyTheLimitAndApplyOnlyToRestrictedParses) {
         "<root k='vv'>hello</root>",
         "<root k='vv'>hello!</root>",
         "8 XML document too long: 13 (max: 12)"},
+       // A text or comment counts as one level below its element.
+       {{.maxDepth = 50}, Nested(48, "t"), Nested(49, "t"), "8 XML document too deep: 51 (max: 50)"},
+       {{.maxDepth = 50}, Nested(48, "<!--c-->"), Nested(49, "<!--c-->"),
+        "8 XML document too deep: 51 (max: 50)"},
    };
    for (const auto& c : cases) {
       Ref<XMLParser> parser = NewParser(c.limits);
@@ -401,6 +405,10 @@ TEST_F(ParserTest, EventsReachTheHandlerInOrderAndCleanUpRunsOnEveryPath) {
    CreateXMLDocumentHandler(standard);
    parser->SetXMLHandler(standard.Get());
    EXPECT_EQ("<a/>", Reparse(parser.Get(), "<a/>"));
+   // And back: the standard handler's direct events stop with it.
+   parser->SetXMLHandler(handler.Get());
+   parser->Parse("<b>t<!--k--></b>", result);
+   EXPECT_EQ("start<b@1:0>'t'!k</b>", handler->events);
 }
 
 TEST(ParserDeathTest, MisuseAndNegativeLimitsPanic) {
