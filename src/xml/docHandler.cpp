@@ -141,6 +141,8 @@ public:
       _stack.clear();
       _openText = nullptr;
       _collecting = false;
+      // Also when a parse stopped while a large text was being collected.
+      if (_text.capacity() > kKeptTextBytes) std::string().swap(_text);
       _names.Clear();
       _document.Reset();
       ReleaseArena();

@@ -110,6 +110,13 @@ TEST(DocHandlerTest, ALargeTextLeavesNoMemoryBehindOnceItsDocumentIsGone) {
       parser->Parse("<r>" + std::string(size_t(64) << 20, 'x') + "</r>", false, result);
    }
    EXPECT_LT(inUse(), before + (size_t(8) << 20));
+
+   // Nor when the parse stops while the text is being put together from its pieces.
+   Ref<XMLParser> limited = NewParser({.maxChars = 32 << 20});
+   Ref<Object> result;
+   EXPECT_THROW(limited->Parse("<r>" + std::string(size_t(64) << 20, 'x') + "</r>", true, result),
+                XMLParseException);
+   EXPECT_LT(inUse(), before + (size_t(8) << 20));
 }
 
 }  // namespace
