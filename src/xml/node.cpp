@@ -72,8 +72,8 @@ namespace {
 constexpr size_t kReadAhead = 512;
 }  // namespace
 
-NodeImpl::~NodeImpl() {
-   if (!_firstChild) return;
+void NodeImpl::DropChildren() {
+   ParentNodeImpl* self = AsParent();
    // A descendant that only the tree references dies here without a DecRef of its own:
    // its count is cleared, its destructor run, and the memory, the arena references and
    // the scoreboard counts are given back in bulk. Atomic steps per node were most of the
@@ -88,8 +88,8 @@ NodeImpl::~NodeImpl() {
    int dropped[kProcessingInstructionNode + 1] = {};
    NodeDisposal disposal;
    std::vector<NodeImpl*> resume;
-   NodeImpl* node = _firstChild;
-   _firstChild = _lastChild = nullptr;
+   NodeImpl* node = self->_firstChild;
+   self->_firstChild = self->_lastChild = nullptr;
    while (node) {
       __builtin_prefetch(reinterpret_cast<char*>(node) + kReadAhead);
       NodeImpl* next = node->_nextSibling;
@@ -97,10 +97,10 @@ NodeImpl::~NodeImpl() {
          node->_parent = node->_nextSibling = node->_prevSibling = nullptr;
          node->ObjectImpl::DecRef();
       } else {
-         if (NodeImpl* child = node->_firstChild) {
+         if (NodeImpl* child = node->FirstChildImpl()) {
             if (next) resume.push_back(next);
             next = child;
-            node->_firstChild = node->_lastChild = nullptr;
+            node->AsParent()->_firstChild = node->AsParent()->_lastChild = nullptr;
          }
          if (bulk) {
             ++dropped[node->GetNodeType()];
@@ -138,10 +138,10 @@ Node* NodeImpl::GetParent() const {
    return _parent;
 }
 Node* NodeImpl::GetFirstChild() const {
-   return _firstChild;
+   return FirstChildImpl();
 }
 Node* NodeImpl::GetLastChild() const {
-   return _lastChild;
+   return LastChildImpl();
 }
 Node* NodeImpl::GetNextSibling() const {
    return _nextSibling;
@@ -181,20 +181,22 @@ void NodeImpl::VerifyInsert(Node* node, Node* pos, bool hasPos) {
 }
 
 void NodeImpl::Insert(NodeImpl* child, NodeImpl* before) {
+   // Only kinds that take children accept any: the others refused it already.
+   ParentNodeImpl* self = AsParent();
    child->VerifyFree();
    child->ObjectImpl::IncRef();
    child->_parent = this;
    child->_nextSibling = before;
-   child->_prevSibling = before ? before->_prevSibling : _lastChild;
+   child->_prevSibling = before ? before->_prevSibling : self->_lastChild;
    if (child->_prevSibling) {
       child->_prevSibling->_nextSibling = child;
    } else {
-      _firstChild = child;
+      self->_firstChild = child;
    }
    if (before) {
       before->_prevSibling = child;
    } else {
-      _lastChild = child;
+      self->_lastChild = child;
    }
    PostInsertProcessing(child);
 }
@@ -224,15 +226,16 @@ void NodeImpl::RemoveChild(Node* node) {
    PELMORA_VERIFY(node != NULL);
    PELMORA_VERIFY(node->GetParent() == this);
    NodeImpl* child = FromNode(node);
+   ParentNodeImpl* self = AsParent();  // it has a child
    if (child->_prevSibling) {
       child->_prevSibling->_nextSibling = child->_nextSibling;
    } else {
-      _firstChild = child->_nextSibling;
+      self->_firstChild = child->_nextSibling;
    }
    if (child->_nextSibling) {
       child->_nextSibling->_prevSibling = child->_prevSibling;
    } else {
-      _lastChild = child->_prevSibling;
+      self->_lastChild = child->_prevSibling;
    }
    child->_parent = child->_nextSibling = child->_prevSibling = nullptr;
    PostRemoveProcessing(child);
@@ -302,20 +305,22 @@ ElementName ElementName::FromQualified(std::string_view qualifiedName) {
 ElementNodeImpl::ElementNodeImpl(const std::string& qualifiedName, int line, int column)
     : _name(new ElementName(ElementName::FromQualified(qualifiedName))),
       _line(line),
-      _column(column),
-      _ownsName(true) {}
+      _column(column) {
+   _ownsName = true;
+}
 
 ElementNodeImpl::ElementNodeImpl(const std::string& prefix, const std::string& tag, int line,
                                  int column)
-    : _name(new ElementName{prefix, tag}), _line(line), _column(column), _ownsName(true) {}
+    : _name(new ElementName{prefix, tag}), _line(line), _column(column) {
+   _ownsName = true;
+}
 
 ElementNodeImpl::ElementNodeImpl(const ElementName* name, int line, int column,
                                  NodeArena* arena)
     : _attributes(NodePartAllocator<Attribute>(arena)),
       _name(name),
       _line(line),
-      _column(column),
-      _ownsName(false) {}
+      _column(column) {}
 
 ElementNodeImpl::~ElementNodeImpl() {
    if (_ownsName) delete _name;

@@ -1,7 +1,9 @@
 #pragma once
 // The implementations of the six node kinds. NodeImpl keeps the tree links and enforces
 // the insertion invariants; each kind says which children it accepts and how it writes
-// itself. The parser and the serialiser use the unchecked link accessors. Not locked.
+// itself. Only the kinds that take children (ParentNodeImpl) carry a child list: texts,
+// comments and instructions are most of a parsed document's nodes. The parser and the
+// serialiser use the unchecked link accessors. Not locked.
 
 #include <cstddef>
 #include <map>
@@ -57,6 +59,8 @@ struct ElementName {
 // written as an XML name.
 void VerifyName(const char* what, std::string_view name);
 
+class ParentNodeImpl;
+
 class NodeImpl : public virtual Node, public ObjectImpl {
 public:
    // Nodes come from the general heap, or from a parsed document's arena.
@@ -65,8 +69,7 @@ public:
    static void operator delete(void* node);
    static void operator delete(void* node, NodeArena* arena);
 
-   // Releases the children, without recursing once per level of the tree.
-   ~NodeImpl() override;
+   ~NodeImpl() override = default;
 
    Node* GetParent() const override;
    Node* GetFirstChild() const override;
@@ -93,8 +96,8 @@ public:
    virtual void PostRemoveProcessing(NodeImpl*) {}
 
    NodeImpl* ParentImpl() const { return _parent; }
-   NodeImpl* FirstChildImpl() const { return _firstChild; }
-   NodeImpl* LastChildImpl() const { return _lastChild; }
+   NodeImpl* FirstChildImpl() const;
+   NodeImpl* LastChildImpl() const;
    NodeImpl* NextSiblingImpl() const { return _nextSibling; }
    // AppendChild for callers that hold the implementation of a new node (no cycle check).
    void AppendChildImpl(NodeImpl* child) {
@@ -117,9 +120,16 @@ public:
    static const NodeImpl* FromNode(const Node* node);
 
 protected:
-   NodeImpl() = default;
+   explicit NodeImpl(bool takesChildren) : _takesChildren(takesChildren) {}
 
 private:
+   friend class ParentNodeImpl;
+
+   // Only for a node that takes children.
+   ParentNodeImpl* AsParent();
+   // For ~ParentNodeImpl: releases the children, without recursing once per level.
+   void DropChildren();
+
    // Links `child` before `before` (at the end when null) and takes one reference.
    void Insert(NodeImpl* child, NodeImpl* before);
    // The checks shared by the three insertion forms.
@@ -127,32 +137,76 @@ private:
    // The invariants of a node about to be linked: no parent and no next sibling.
    void VerifyFree() const;
    // Links a new child last and gives it the parent's reference.
-   void LinkParsed(NodeImpl* child, bool counted) {
-      if (counted) {
-         child->ObjectImpl::IncRef();
-      } else {
-         child->_refCount.Write(1);
-      }
-      child->_parent = this;
-      child->_prevSibling = _lastChild;
-      if (_lastChild) {
-         _lastChild->_nextSibling = child;
-      } else {
-         _firstChild = child;
-      }
-      _lastChild = child;
-   }
+   inline void LinkParsed(NodeImpl* child, bool counted);
 
-   NodeImpl* _firstChild = nullptr;
-   NodeImpl* _lastChild = nullptr;
+   // First, so that it takes the room the object's count leaves free.
+   const bool _takesChildren;
+
+protected:
+   // An element's: whether it owns its name. Kept here for the same free room.
+   bool _ownsName = false;
+
+private:
    NodeImpl* _nextSibling = nullptr;
    NodeImpl* _prevSibling = nullptr;
    NodeImpl* _parent = nullptr;
 };
 
+// A node that takes children: the document, elements and CDATA sections.
+class ParentNodeImpl : public NodeImpl {
+public:
+   ~ParentNodeImpl() override {
+      if (_firstChild) DropChildren();
+   }
+
+protected:
+   ParentNodeImpl() : NodeImpl(true) {}
+
+private:
+   friend class NodeImpl;
+
+   NodeImpl* _firstChild = nullptr;
+   NodeImpl* _lastChild = nullptr;
+};
+
+inline ParentNodeImpl* NodeImpl::AsParent() {
+   return static_cast<ParentNodeImpl*>(this);
+}
+
+inline NodeImpl* NodeImpl::FirstChildImpl() const {
+   return _takesChildren ? static_cast<const ParentNodeImpl*>(this)->_firstChild : nullptr;
+}
+
+inline NodeImpl* NodeImpl::LastChildImpl() const {
+   return _takesChildren ? static_cast<const ParentNodeImpl*>(this)->_lastChild : nullptr;
+}
+
+inline void NodeImpl::LinkParsed(NodeImpl* child, bool counted) {
+   if (counted) {
+      child->ObjectImpl::IncRef();
+   } else {
+      child->_refCount.Write(1);
+   }
+   ParentNodeImpl* self = AsParent();
+   child->_parent = this;
+   child->_prevSibling = self->_lastChild;
+   if (self->_lastChild) {
+      self->_lastChild->_nextSibling = child;
+   } else {
+      self->_firstChild = child;
+   }
+   self->_lastChild = child;
+}
+
+// A node that never holds children.
+class LeafNodeImpl : public NodeImpl {
+protected:
+   LeafNodeImpl() : NodeImpl(false) {}
+};
+
 class ElementNodeImpl;
 
-class DocumentImpl final : public virtual Document, public NodeImpl {
+class DocumentImpl final : public virtual Document, public ParentNodeImpl {
 public:
    using NodeImpl::WriteNode;
 
@@ -177,7 +231,7 @@ private:
    std::string _encoding;
 };
 
-class ElementNodeImpl final : public virtual ElementNode, public NodeImpl {
+class ElementNodeImpl final : public virtual ElementNode, public ParentNodeImpl {
 public:
    using AttributeMap = std::map<std::string, std::string>;
    // Sorted by name: the order of a map, at one allocation per element, which for a parsed
@@ -245,10 +299,9 @@ private:
    const ElementName* _name;
    int _line;
    int _column;
-   bool _ownsName;
 };
 
-class TextNodeImpl final : public virtual TextNode, public NodeImpl {
+class TextNodeImpl final : public virtual TextNode, public LeafNodeImpl {
 public:
    using NodeImpl::WriteNode;
 
@@ -271,7 +324,7 @@ private:
    std::string _text;
 };
 
-class CDataNodeImpl final : public virtual CDataNode, public NodeImpl {
+class CDataNodeImpl final : public virtual CDataNode, public ParentNodeImpl {
 public:
    using NodeImpl::WriteNode;
 
@@ -280,7 +333,7 @@ public:
    void VerifyInsertAllowed(Node* child) const override;
 };
 
-class CommentNodeImpl final : public virtual CommentNode, public NodeImpl {
+class CommentNodeImpl final : public virtual CommentNode, public LeafNodeImpl {
 public:
    using NodeImpl::WriteNode;
 
@@ -300,7 +353,7 @@ private:
 };
 
 class ProcessingInstructionNodeImpl final : public virtual ProcessingInstructionNode,
-                                            public NodeImpl {
+                                            public LeafNodeImpl {
 public:
    using NodeImpl::WriteNode;
 

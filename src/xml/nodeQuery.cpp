@@ -43,7 +43,7 @@ bool IsTrueValue(const std::string* value) {
 }  // namespace
 
 ElementNode* NodeImpl::GetChildElementByTag(const std::string& tag) const {
-   return FindByTag(_firstChild, tag);
+   return FindByTag(FirstChildImpl(), tag);
 }
 
 ElementNode* NodeImpl::GetSiblingElementByTag(const std::string& tag) const {
@@ -51,7 +51,7 @@ ElementNode* NodeImpl::GetSiblingElementByTag(const std::string& tag) const {
 }
 
 ElementNode* NodeImpl::GetChildElementByQName(const QName& name) const {
-   return FindByQName(_firstChild, name);
+   return FindByQName(FirstChildImpl(), name);
 }
 
 ElementNode* NodeImpl::GetSiblingElementByQName(const QName& name) const {

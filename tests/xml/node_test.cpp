@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
+#include <initializer_list>
 #include <map>
 #include <string>
 #include <typeinfo>
@@ -249,6 +250,12 @@ TEST(NodeTest, EachKindRefusesTheChildrenItCannotHold) {
       }
       EXPECT_EQ(nullptr, c.child->GetParent());
    }
+   // The kinds that take no children show none.
+   for (Node* leaf : std::initializer_list<Node*>{text.Get(), comment.Get(), pi.Get()}) {
+      EXPECT_EQ(nullptr, leaf->GetFirstChild());
+      EXPECT_EQ(nullptr, leaf->GetLastChild());
+      EXPECT_EQ(nullptr, leaf->GetChildElementByTag("x"));
+   }
    cdata->AppendChild(text.Get());  // what a CDATA node does accept
    EXPECT_EQ("#1 ", Children(cdata.Get()));
 }
@@ -286,6 +293,7 @@ TEST(NodeDeathTest, StructuralMisusePanicsWithTheFailedCondition) {
                 "\"pos->GetParent\\(\\) == this\"");
    EXPECT_DEATH(stranger->AppendChild(child.Get()), "\"GetParent\\(\\) == __null\"");
    EXPECT_DEATH(parent->RemoveChild(stranger.Get()), "\"node->GetParent\\(\\) == this\"");
+   EXPECT_DEATH(Text("t")->RemoveChild(child.Get()), "\"node->GetParent\\(\\) == this\"");
    // A node inserted below itself would never be released.
    EXPECT_DEATH(child->AppendChild(parent.Get()), "Assert Failed");
 }
