@@ -67,9 +67,11 @@ void VerifyName(const char* what, std::string_view name) {
 // ---- NodeImpl ----
 
 namespace {
-// How far ahead of a node the tear-down asks for memory: in a parsed tree the next few
-// nodes in document order lie there.
-constexpr size_t kReadAhead = 512;
+// How far ahead of a node the tear-down asks for memory: in a parsed tree the nodes that
+// follow in document order lie there. The walk streams through the node memory, so the
+// request must run far enough ahead to cover a memory access; nearer than a few KB, it
+// arrived too late.
+constexpr size_t kReadAhead = 4096;
 }  // namespace
 
 void NodeImpl::DropChildren() {
