@@ -9,6 +9,7 @@
 
 #include <atomic>
 #include <cstddef>
+#include <cstdint>
 #include <string_view>
 #include <vector>
 
@@ -29,12 +30,16 @@ public:
       return AllocateRaw(size);
    }
    // As Allocate, for memory that holds no node reference. Inline: a parse calls it per
-   // node, and a new block is rare.
+   // node, and a new block is rare. A request ahead of the end of a block is harmless.
    void* AllocateRaw(size_t size) {
       size = (size + alignof(void*) - 1) & ~(alignof(void*) - 1);
       if (static_cast<size_t>(_end - _cursor) < size) StartBlock(size);
       void* memory = _cursor;
       _cursor += size;
+      // Node memory is written once, in order: ask for what follows early.
+      __builtin_prefetch(reinterpret_cast<const void*>(reinterpret_cast<uintptr_t>(_cursor) +
+                                                       kWriteAhead),
+                         1);
       return memory;
    }
    // Drops a node's reference; the last frees every block.
@@ -51,6 +56,8 @@ public:
    const ElementName* NewName(std::string_view qualifiedName, std::string_view& stored);
 
 private:
+   // How far ahead of the next allocation the memory is asked for.
+   static constexpr size_t kWriteAhead = 4096;
    // The creator's reference counts as this many, so that nodes need no atomic increment
    // when they are made: nodes freed while the creator still holds it can never bring the
    // count to zero, and ReleaseCreator trades the bias for the nodes made meanwhile.
