@@ -26,6 +26,8 @@ namespace {
 
 // The character data buffer a handler keeps between texts: larger ones are given back.
 constexpr size_t kKeptTextBytes = 64 * 1024;
+// The attributes of a start tag a handler keeps room for between documents.
+constexpr size_t kKeptAttributes = 1024;
 
 // The limits of handlers created without explicit ones; whoever owns the configuration
 // sets them (SetDefaultDocLimits), the defaults stand until then.
@@ -143,6 +145,9 @@ public:
       _collecting = false;
       // Also when a parse stopped while a large text was being collected.
       if (_text.capacity() > kKeptTextBytes) std::string().swap(_text);
+      if (_attributes.capacity() > kKeptAttributes) {
+         std::vector<ElementNodeImpl::ParsedAttribute>().swap(_attributes);
+      }
       _names.Clear();
       _document.Reset();
       ReleaseArena();

@@ -5,6 +5,8 @@
 #include <expat.h>
 
 #include <algorithm>
+#include <atomic>
+#include <cstdlib>
 #include <climits>
 #include <cstddef>
 #include <random>
@@ -27,6 +29,72 @@ unsigned long NewHashSalt() {
    return salt;
 }
 
+// Expat's memory, counted per parser: a parser that grew for one huge token (a start tag
+// of many attributes) keeps that memory through a reset, so it is made anew instead.
+struct ExpatMemory {
+   std::atomic<size_t> bytes{0};
+};
+
+// The parser whose expat calls this thread is making; expat's allocation functions take
+// no context of their own.
+thread_local ExpatMemory* t_expatMemory = nullptr;
+
+// Makes `memory` the one this thread's expat allocations are counted in, for a scope.
+class CountExpatMemory {
+public:
+   explicit CountExpatMemory(ExpatMemory* memory) : _saved(t_expatMemory) {
+      t_expatMemory = memory;
+   }
+   ~CountExpatMemory() { t_expatMemory = _saved; }
+   CountExpatMemory(const CountExpatMemory&) = delete;
+   CountExpatMemory& operator=(const CountExpatMemory&) = delete;
+
+private:
+   ExpatMemory* const _saved;
+};
+
+// Before each block: who counted it and its size; as large as malloc's alignment.
+struct alignas(alignof(std::max_align_t)) BlockHeader {
+   ExpatMemory* owner;
+   size_t size;
+};
+
+void* ExpatMalloc(size_t size) {
+   auto* header = static_cast<BlockHeader*>(malloc(sizeof(BlockHeader) + size));
+   if (!header) return nullptr;
+   header->owner = t_expatMemory;
+   header->size = size;
+   if (header->owner) header->owner->bytes.fetch_add(size, std::memory_order_relaxed);
+   return header + 1;
+}
+
+void ExpatFree(void* block) {
+   if (!block) return;
+   BlockHeader* header = static_cast<BlockHeader*>(block) - 1;
+   if (header->owner) header->owner->bytes.fetch_sub(header->size, std::memory_order_relaxed);
+   free(header);
+}
+
+void* ExpatRealloc(void* block, size_t size) {
+   if (!block) return ExpatMalloc(size);
+   BlockHeader* header = static_cast<BlockHeader*>(block) - 1;
+   ExpatMemory* owner = header->owner;
+   size_t old = header->size;
+   auto* moved = static_cast<BlockHeader*>(realloc(header, sizeof(BlockHeader) + size));
+   if (!moved) return nullptr;
+   moved->size = size;
+   if (owner) {
+      owner->bytes.fetch_add(size, std::memory_order_relaxed);
+      owner->bytes.fetch_sub(old, std::memory_order_relaxed);
+   }
+   return moved + 1;
+}
+
+const XML_Memory_Handling_Suite kExpatMemorySuite = {ExpatMalloc, ExpatRealloc, ExpatFree};
+
+// Expat's memory a parser may keep between documents; above it the parser is made anew.
+constexpr size_t kKeptExpatBytes = 1 << 20;
+
 // Bytes read from the reader and handed to expat at a time.
 constexpr int kBlockSize = 10240;
 // Bytes of a text parse handed to expat at a time, so that one call stays bounded.
@@ -36,13 +104,15 @@ class XMLParserImpl final : public virtual XMLParser, public ObjectImpl {
 public:
    explicit XMLParserImpl(XMLHandler* handler) {
       SetXMLHandler(handler);
-      // No namespace separator: names arrive as written and the DOM splits them.
-      _parser = XML_ParserCreate_MM(nullptr, nullptr, nullptr);
+      _parser = NewExpatParser();
       if (!_parser) System::ThrowSystemMemoryException();
       InstallCallbacks();
    }
 
-   ~XMLParserImpl() override { XML_ParserFree(_parser); }
+   ~XMLParserImpl() override {
+      CountExpatMemory count(&_memory);
+      XML_ParserFree(_parser);
+   }
 
    void SetXMLHandler(XMLHandler* handler) override {
       PELMORA_VERIFY(handler != NULL);
@@ -63,6 +133,26 @@ public:
    void Parse(const std::string& text, Ref<Object>& result) override { Parse(text, false, result); }
 
 private:
+   XML_Parser NewExpatParser() {
+      CountExpatMemory count(&_memory);
+      // No namespace separator: names arrive as written and the DOM splits them.
+      return XML_ParserCreate_MM(nullptr, &kExpatMemorySuite, nullptr);
+   }
+
+   // After a document: a parser that grew past what it may keep is made anew (the old one
+   // stays when a new one cannot be had).
+   void ShedExpatMemory() noexcept {
+      if (_memory.bytes.load(std::memory_order_relaxed) <= kKeptExpatBytes) return;
+      XML_Parser fresh = NewExpatParser();
+      if (!fresh) return;
+      {
+         CountExpatMemory count(&_memory);
+         XML_ParserFree(_parser);
+      }
+      _parser = fresh;
+      InstallCallbacks();
+   }
+
    // Runs the handler's CleanUpDocument when the parse ends, whichever way.
    class CleanUpGuard {
    public:
@@ -190,6 +280,7 @@ private:
    Ref<XMLHandler> _handler;
    // The handler's direct events when it is the standard handler, else null.
    DocumentEvents* _events = nullptr;
+   ExpatMemory _memory;
    XML_Parser _parser = nullptr;
    bool _restricted = false;
    bool _stopped = false;
@@ -224,6 +315,7 @@ void XMLParserImpl::ThrowParseError() {
 
 template <class Input>
 void XMLParserImpl::ParseDocument(bool restricted, Ref<Object>& result, Input input) {
+   CountExpatMemory count(&_memory);
    // The reset clears the callbacks and the hash salt too.
    XML_ParserReset(_parser, nullptr);
    XML_SetHashSalt(_parser, _hashSalt);
@@ -231,6 +323,10 @@ void XMLParserImpl::ParseDocument(bool restricted, Ref<Object>& result, Input in
    _restricted = restricted;
    _stopped = false;
 
+   struct Shed {
+      XMLParserImpl* self;
+      ~Shed() { self->ShedExpatMemory(); }
+   } shed{this};
    // A handler replaced during the parse must outlive it.
    Ref<XMLHandler> handler = _handler;
    CleanUpGuard cleanUp(handler.Get());

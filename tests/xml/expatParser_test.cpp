@@ -1,6 +1,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <malloc.h>
+
 #include <algorithm>
 #include <memory>
 #include <stdexcept>
@@ -416,6 +418,42 @@ TEST(ParserDeathTest, MisuseAndNegativeLimitsPanic) {
    EXPECT_DEATH(CreateXMLParser(nullptr, parser), "Assert Failed: \"handler != __null\"");
    Ref<XMLHandler> handler;
    EXPECT_DEATH(CreateXMLDocumentHandler({.maxNodes = -1}, handler), "Assert Failed: \"out >= 0\"");
+}
+
+}  // namespace
+}  // namespace Pelmora::Xml
+
+namespace Pelmora::Xml {
+namespace {
+
+// A pooled parser lives as long as the process: what one huge start tag made the parser
+// grow (its input buffer, its attribute arrays) must go with the document, not stay for
+// every later one.
+TEST(ParserMemoryTest, AHugeStartTagLeavesNoMemoryBehindOnceItsDocumentIsGone) {
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+   GTEST_SKIP() << "the sanitizer's allocator does not report through mallinfo2";
+#endif
+   auto inUse = [] {
+      struct mallinfo2 info = mallinfo2();
+      return info.uordblks + info.hblkhd;
+   };
+   std::string tag = "<r";
+   for (int i = 0; i < 200000; ++i) tag += " a" + std::to_string(i) + "='v'";
+   const std::string text = tag + "/>";
+   Ref<XMLParser> parser = NewParser();
+   Parse(parser.Get(), "<warm-up a='1'>x</warm-up>");
+   size_t before = inUse();
+   for (int round = 0; round < 2; ++round) {
+      {
+         Ref<Document> document = Parse(parser.Get(), text);
+         std::string value;
+         ASSERT_TRUE(document->GetChildElementByTag("r")->GetAttribute("a199999", value));
+         EXPECT_EQ(value, "v");
+      }
+      EXPECT_LT(inUse(), before + (size_t(1) << 20)) << "round " << round;
+   }
+   // And the parser serves on as before.
+   EXPECT_EQ(Reparse(parser.Get(), "<a b='1'><c/></a>"), "<a b=\"1\"><c/></a>");
 }
 
 }  // namespace
