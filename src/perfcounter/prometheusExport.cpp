@@ -32,7 +32,7 @@ bool IsNameStart(char c) { return (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z
 bool IsNameChar(char c) { return IsNameStart(c) || (c >= '0' && c <= '9'); }
 
 // Name='value' with a usable label name; `quantile` belongs to summaries.
-bool AsLabel(std::string_view part, std::string& name, std::string& value) {
+bool AsLabel(std::string_view part, std::string_view& name, std::string_view& value) {
    size_t equals = part.find("='");
    if (equals == std::string_view::npos || equals == 0 || part.size() < equals + 3 ||
        part.back() != '\'') {
@@ -45,17 +45,28 @@ bool AsLabel(std::string_view part, std::string& name, std::string& value) {
    for (char c : labelName) {
       if (!IsNameChar(c)) return false;
    }
-   name = std::string(labelName);
-   value = std::string(part.substr(equals + 2, part.size() - equals - 3));
+   name = labelName;
+   value = part.substr(equals + 2, part.size() - equals - 3);
    return true;
 }
 
-// Fills `mapped` (reused across counters to keep its buffers).
+// Fills `mapped` (reused across counters to keep its buffers). The name and the pattern
+// are written into buffers sized once for the path and cut to length at the end: an
+// append per piece cost most of the export's time.
 void MapPath(std::string_view path, MappedPath& mapped) {
-   mapped.name.clear();
    mapped.labels.clear();
-   mapped.pattern.clear();
-   std::string labelName, labelValue;
+   // The name is at most the path and a leading '_'; the pattern at most the path and
+   // one more character per label (an empty value becomes '*').
+   mapped.name.resize(path.size() + 1);
+   mapped.pattern.resize(path.size() * 2 + 2);
+   char* const nameStart = mapped.name.data();
+   char* name = nameStart + 1;  // room for a leading '_'
+   char* pattern = mapped.pattern.data();
+   auto put = [](char*& to, std::string_view text) {
+      std::memcpy(to, text.data(), text.size());
+      to += text.size();
+   };
+   std::string_view labelName, labelValue;
    for (size_t start = 1; start <= path.size();) {
       size_t slash = path.find('/', start);
       // The last component names the measurement and is never a label.
@@ -67,21 +78,26 @@ void MapPath(std::string_view path, MappedPath& mapped) {
          bool taken = false;
          for (const auto& label : mapped.labels) taken = taken || label.first == labelName;
          if (!taken) {
-            mapped.pattern += '/';
-            mapped.pattern += labelName;
-            mapped.pattern += "='*'";
-            mapped.labels.emplace_back(std::move(labelName), std::move(labelValue));
+            *pattern++ = '/';
+            put(pattern, labelName);
+            put(pattern, "='*'");
+            mapped.labels.emplace_back(std::string(labelName), std::string(labelValue));
             continue;
          }
       }
-      mapped.pattern += '/';
-      mapped.pattern += part;
-      if (!mapped.name.empty()) mapped.name += '_';
-      for (char c : part) mapped.name += IsNameChar(c) ? c : '_';
+      *pattern++ = '/';
+      put(pattern, part);
+      if (name != nameStart + 1) *name++ = '_';
+      for (char c : part) *name++ = IsNameChar(c) ? c : '_';
    }
-   if (mapped.name.empty() || (mapped.name[0] >= '0' && mapped.name[0] <= '9')) {
-      mapped.name.insert(mapped.name.begin(), '_');
+   mapped.pattern.resize(static_cast<size_t>(pattern - mapped.pattern.data()));
+   const char* first = nameStart + 1;
+   if (name == first || (*first >= '0' && *first <= '9')) {
+      *nameStart = '_';
+      first = nameStart;
    }
+   mapped.name.erase(0, static_cast<size_t>(first - nameStart));
+   mapped.name.resize(static_cast<size_t>(name - first));
 }
 
 void AppendEscaped(std::string& out, std::string_view text, bool quotes) {
