@@ -2,13 +2,17 @@
 // file writers, which set their size, and the memory ring), a thread keeps its lines and
 // hands them on a batch at a time, so that threads logging at once do not pass the
 // output's and the writers' locks between them on every line. A batch is handed on when
-// it is full, before a line of another level or one that spans pieces, with every severe
-// line (all threads' batches then), on the output's Flush, Reopen and Close, before its
-// writers change, when the ring is read, and every half flush interval by the file
-// writers' flushing thread. Lines of different threads may therefore reach a writer out
-// of their time order, by at most one batch each; a thread's own lines never.
+// it is full, before a line of another level, to another output or of several pieces,
+// with every severe line (all threads' batches then), before the output's writers change
+// or it closes, and by drains: the output's Flush and Reopen, a file writer's Flush, a
+// read of the ring and every half flush interval from the file writers' flushing thread.
+// A drain never waits for an output's lock (it may be called with another output's lock
+// held, or at exit while a thread is stuck in a line); a busy output waits for the next.
+// Lines of different threads may therefore reach a writer out of their time order, by
+// at most one batch each; a thread's own lines not.
 
 #include <algorithm>
+#include <chrono>
 #include <cstring>
 #include <thread>
 #include <vector>
@@ -32,6 +36,10 @@ BatchRegistry& Registry() {
 }
 
 std::atomic<uint64_t> g_nextOutputId{1};
+
+// How long a thread that turns to another output waits to hand on its lines for the
+// last one, when another thread is in the middle of a line there.
+constexpr std::chrono::milliseconds kHandOnPatience{100};
 
 }  // namespace
 
@@ -77,6 +85,38 @@ LogLineBatch* LogThreadBatches::Make(LogOutputImpl* output, int capacity) {
       throw;
    }
    return batch.Get();
+}
+
+void LogThreadBatches::HandOnKept() {
+   const LogOutputImpl* output = _keptFor;
+   _keptFor = nullptr;
+   LogLineBatch* batch = nullptr;
+   uint64_t id = 0;
+   for (const Entry& entry : _entries) {
+      if (entry.output == output) {
+         batch = entry.batch.Get();
+         id = entry.id;
+      }
+   }
+   if (batch == nullptr) return;
+   // The output may be gone or going: only one still in the registry, counted among its
+   // drainers, is used, as DrainLineBatches does.
+   LogOutputImpl* live = nullptr;
+   {
+      BatchRegistry& registry = Registry();
+      std::lock_guard<LogWriterMutex> lock(registry.mutex);
+      for (LogOutputImpl* candidate : registry.outputs) {
+         if (candidate == output && candidate->GetId() == id) {
+            live = candidate;
+            live->_drainers.fetch_add(1, std::memory_order_acq_rel);
+         }
+      }
+   }
+   if (live == nullptr) return;  // its end wrote the batch out
+   // A bounded wait: this thread may hold another output's lock (a line logged while a
+   // longer one is being written), whose holder order it must not wait on for ever.
+   live->HandOnWithin(batch, kHandOnPatience);
+   live->_drainers.fetch_sub(1, std::memory_order_acq_rel);
 }
 
 // ---- the output's side
@@ -146,14 +186,28 @@ void LogOutputImpl::HandOnBefore(LogThreadBatches& mine, Logger::CombinedLevel l
 }
 
 void LogOutputImpl::DrainBatches() {
-   if (!_hasBatches.load(std::memory_order_acquire)) return;
-   _lock.WriteLock();
+   if (!_hasBatches.load(std::memory_order_acquire) || !_lock.TryWriteLock()) return;
    HandOnAll();
+   _lock.WriteUnlock();
+}
+
+void LogOutputImpl::HandOnWithin(LogLineBatch* batch, std::chrono::milliseconds patience) {
+   auto deadline = std::chrono::steady_clock::now() + patience;
+   while (!_lock.TryWriteLock()) {
+      // Given up: the lines go with the next drain, after this thread's next ones.
+      if (std::chrono::steady_clock::now() >= deadline) return;
+      std::this_thread::yield();
+   }
+   {
+      std::lock_guard<LogWriterMutex> lock(batch->mutex);
+      HandOn(batch);
+   }
    _lock.WriteUnlock();
 }
 
 void LogOutputImpl::WriteLine(LogThreadBatches& mine, Logger::CombinedLevel level,
                               const char* data, int length) {
+   mine.HandOnOthers(this);
    int bytes = _batchBytes.load(std::memory_order_relaxed);
    if (bytes > 0 && length <= bytes && (level & kSevereLevels) == 0) {
       LogLineBatch* batch = nullptr;
@@ -164,16 +218,18 @@ void LogOutputImpl::WriteLine(LogThreadBatches& mine, Logger::CombinedLevel leve
       }
       if (batch) {
          batch->mutex.lock();
-         // Read again under the batch's lock: a change of writers sets it before it
-         // hands the batches on, so a line kept here is handed on with them.
-         bool batching = _batchBytes.load(std::memory_order_relaxed) > 0 &&
-                         length <= batch->capacity;
-         if (batching && (batch->size == 0 || (batch->level == level &&
-                                               batch->size + length <= batch->capacity))) {
+         // Read again under the batch's lock, which Close takes after setting it to 0:
+         // a line kept here is handed on there. The size may have shrunk since the batch
+         // was made (a writer with a smaller one joined).
+         int room = std::min(batch->capacity, _batchBytes.load(std::memory_order_relaxed));
+         bool batching = room > 0 && length <= room;
+         if (batching &&
+             (batch->size == 0 || (batch->level == level && batch->size + length <= room))) {
             memcpy(batch->data + batch->size, data, static_cast<size_t>(length));
             batch->size += length;
             batch->level = level;
             batch->mutex.unlock();
+            mine.NoteKept(this);
             return;
          }
          batch->mutex.unlock();
@@ -181,13 +237,15 @@ void LogOutputImpl::WriteLine(LogThreadBatches& mine, Logger::CombinedLevel leve
          _lock.WriteLock();
          batch->mutex.lock();
          HandOn(batch);
-         batching = _batchBytes.load(std::memory_order_relaxed) > 0 && length <= batch->capacity;
+         room = std::min(batch->capacity, _batchBytes.load(std::memory_order_relaxed));
+         batching = room > 0 && length <= room;
          if (batching) {
             memcpy(batch->data, data, static_cast<size_t>(length));
             batch->size = length;
             batch->level = level;
          }
          batch->mutex.unlock();
+         if (batching) mine.NoteKept(this);
          if (!batching) Write(level, data, length);
          _lock.WriteUnlock();
          return;

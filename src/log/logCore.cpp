@@ -197,6 +197,30 @@ void LogOutputLock::ReadLock() {
    }
 }
 
+bool LogOutputLock::TryWriteLock() {
+   const void* self = Self();
+   if (_owner.load(std::memory_order_relaxed) == self) {
+      ++_depth;
+      return true;
+   }
+   uint32_t state = _state.load(std::memory_order_relaxed);
+   for (;;) {
+      if (state & ~kWaiting) {
+         if (!Internal::InReportChild()) return false;
+         // Taken over: its holders do not run in a report child.
+         _state.store(kWriter, std::memory_order_relaxed);
+         break;
+      }
+      if (_state.compare_exchange_weak(state, kWriter | (state & kWaiting),
+                                       std::memory_order_acquire, std::memory_order_relaxed)) {
+         break;
+      }
+   }
+   _owner.store(self, std::memory_order_relaxed);
+   _depth = 1;
+   return true;
+}
+
 bool LogOutputLock::TryReadLock() {
    if (IsWriteLockedByMe()) {
       ++_depth;

@@ -187,6 +187,9 @@ public:
       _depth = 1;
    }
    void ReadUnlock();
+   // WriteLock when it needs no wait: false when another thread holds the lock or this
+   // one holds it for reading. A report child takes a held lock over, as WriteLock does.
+   bool TryWriteLock();
    void WriteUnlock() {
       PELMORA_VERIFY(IsWriteLockedByMe());
       if (--_depth > 0) return;
@@ -250,10 +253,19 @@ public:
    // As Find, making and registering the batch when there is none. Inline for the usual
    // case, the output of the thread's last line.
    LogLineBatch* Get(LogOutputImpl* output, int capacity);
+   // Before a line to `next`: hands on the lines this thread keeps for another output, so
+   // that a writer the two outputs share gets the thread's lines in order. At most one
+   // of the thread's batches holds lines at any time.
+   void HandOnOthers(const LogOutputImpl* next) {
+      if (_keptFor != nullptr && _keptFor != next) HandOnKept();
+   }
+   // A line was kept for `output`.
+   void NoteKept(const LogOutputImpl* output) { _keptFor = output; }
 
 private:
    LogLineBatch* GetOther(LogOutputImpl* output, int capacity);
    LogLineBatch* Make(LogOutputImpl* output, int capacity);
+   void HandOnKept();
 
    struct Entry {
       const LogOutputImpl* output;
@@ -261,6 +273,8 @@ private:
       Ref<LogLineBatch> batch;
    };
    std::vector<Entry> _entries;
+   // The output whose batch may hold lines, or null.
+   const LogOutputImpl* _keptFor = nullptr;
    // The entry found last.
    const LogOutputImpl* _lastOutput = nullptr;
    uint64_t _lastId = 0;
@@ -309,8 +323,13 @@ public:
    // hands on the thread's batch, so that its lines stay in order, and for a severe line
    // every thread's, for a report that may end the process.
    void HandOnBefore(LogThreadBatches& mine, Logger::CombinedLevel level);
-   // Hands every thread's batched lines to the writers.
+   // Hands every thread's batched lines to the writers, unless that needs a wait for the
+   // output's lock (another thread is in a line of several pieces, or this one reads the
+   // writers): then the next drain does it. Never waiting keeps flushes, ring reads and
+   // exit free of lock-order deadlocks between outputs.
    void DrainBatches();
+   // As DrainBatches for `batch` alone, waiting for the lock up to `patience`.
+   void HandOnWithin(LogLineBatch* batch, std::chrono::milliseconds patience);
    uint64_t GetId() const { return _id; }
 
    // The writers at this moment, copied under the read lock.

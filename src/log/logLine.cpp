@@ -129,6 +129,7 @@ public:
 
    void Flush() override {
       if (!_locked) {
+         if (_outputImpl) _batches->HandOnOthers(_outputImpl);
          _output->RecursiveWriteLock();
          _locked = true;
          // The thread's batched lines come before this one's first piece.

@@ -6,8 +6,10 @@
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
+#include <filesystem>
 #include <functional>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <regex>
 #include <sstream>
@@ -308,4 +310,243 @@ TEST(LogBatchDeathTest, APanicReportCarriesTheLinesOtherThreadsKept) {
        text, std::regex("kept by another thread\n(.|\n)*Panic: Assert Failed(.|\n)*"
                         "Recent log lines(.|\n)*kept by another thread")))
        << text;
+}
+
+// ---- handing batches on from a thread that is in the middle of a long line
+
+namespace {
+
+// Formats as "hook" after running `work`: lets a test act while its thread is inside a
+// line that already spans pieces, and so holds its output's write lock.
+class Hook : public ObjectImpl {
+public:
+   explicit Hook(std::function<void()> work) : _work(std::move(work)) {}
+   std::string ToString() const override {
+      _work();
+      return "hook";
+   }
+
+private:
+   std::function<void()> _work;
+};
+
+// A flag one thread raises and another waits on, for at most `limit`.
+class Flag {
+public:
+   void Raise() {
+      std::lock_guard<std::mutex> lock(_mutex);
+      _up = true;
+      _changed.notify_all();
+   }
+   bool Wait(std::chrono::milliseconds limit) {
+      std::unique_lock<std::mutex> lock(_mutex);
+      return _changed.wait_for(lock, limit, [this] { return _up; });
+   }
+
+private:
+   std::mutex _mutex;
+   std::condition_variable _changed;
+   bool _up = false;
+};
+
+// Runs in a death test's child: exits 0 when `work` ends within two seconds, 1 when it
+// hangs (its threads cannot be freed, so the child is the one to go).
+void ExitWhenDone(std::function<void()> work) {
+   auto done = std::make_shared<Flag>();
+   std::thread([work, done] {
+      work();
+      done->Raise();
+   }).detach();
+   _exit(done->Wait(std::chrono::seconds(2)) ? 0 : 1);
+}
+
+// A second output with a batching file writer, at "trivia", on a manager of its own.
+struct BatchedOutput {
+   explicit BatchedOutput(const std::string& name) {
+      LogFileOptions options;
+      options.flushIntervalMs = 60 * 1000;
+      files.AddFile(options, name);
+      files.logger->GetLogOutput()->GetWriter("file", writer);
+      // A kept line registers the output among those that have batches.
+      PELMORA_LOG_INFO(files.logger.Get(), "first");
+   }
+   Files files;
+   Ref<LogWriter> writer;
+};
+
+const std::string kLong(3000, 'x');  // past one piece: the line takes the write lock
+
+}  // namespace
+
+// Two threads each in a long line of its own output, each flushing a file writer from a
+// formatter argument: before batching the flush took the writer's lock alone; now it
+// takes every output's write lock, the other's included.
+TEST(LogBatchDeathTest, FlushingFromInsideLongLinesOfTwoOutputsDoesNotDeadlock) {
+   EXPECT_EXIT(ExitWhenDone([] {
+                  BatchedOutput a("a.log"), b("b.log");
+                  Flag aHolds, bHolds;
+                  Hook hookA([&] {
+                     aHolds.Raise();
+                     bHolds.Wait(std::chrono::seconds(1));
+                     a.writer->Flush();
+                  });
+                  Hook hookB([&] {
+                     bHolds.Raise();
+                     aHolds.Wait(std::chrono::seconds(1));
+                     b.writer->Flush();
+                  });
+                  std::thread other([&] {
+                     PELMORA_LOG_INFO(b.files.logger.Get(), "%1 %2", kLong,
+                                      static_cast<const Object*>(&hookB));
+                  });
+                  PELMORA_LOG_INFO(a.files.logger.Get(), "%1 %2", kLong,
+                                   static_cast<const Object*>(&hookA));
+                  other.join();
+               }),
+               ::testing::ExitedWithCode(0), "");
+}
+
+// A thread in a long line of output A drops the last reference to output B while a drain
+// has counted itself into B and waits for A's lock: B's end waits for that drain.
+TEST(LogBatchDeathTest, DroppingAnOutputFromInsideALongLineDoesNotDeadlock) {
+   EXPECT_EXIT(ExitWhenDone([] {
+                  auto a = std::make_unique<BatchedOutput>("a.log");
+                  auto b = std::make_unique<BatchedOutput>("b.log");
+                  Flag aHolds, draining;
+                  std::thread drainer([&] {
+                     aHolds.Wait(std::chrono::seconds(1));
+                     draining.Raise();
+                     a->writer->Flush();  // counts itself into both, then waits for A
+                  });
+                  Hook hook([&] {
+                     aHolds.Raise();
+                     draining.Wait(std::chrono::seconds(1));
+                     // Long enough for the drain to reach A's lock.
+                     std::this_thread::sleep_for(std::chrono::milliseconds(100));
+                     b.reset();
+                  });
+                  PELMORA_LOG_INFO(a->files.logger.Get(), "%1 %2", kLong,
+                                   static_cast<const Object*>(&hook));
+                  drainer.join();
+               }),
+               ::testing::ExitedWithCode(0), "");
+}
+
+// Flushing a file writer while holding its output's read lock (to look at its writers,
+// say) was fine while Flush took the writer's lock alone.
+TEST(LogBatchDeathTest, FlushingAWriterUnderItsOutputsReadLockDoesNotDeadlock) {
+   EXPECT_EXIT(ExitWhenDone([] {
+                  BatchedOutput a("a.log");
+                  LogOutput* output = a.files.logger->GetLogOutput();
+                  output->RecursiveReadLock();
+                  a.writer->Flush();
+                  output->ReadUnlock();
+               }),
+               ::testing::ExitedWithCode(0), "");
+}
+
+// One file writer on two outputs (two managers' loggers writing one file): a thread's
+// lines to the two are kept in two batches, which are handed on output by output.
+TEST(LogBatchTest, AThreadsLinesToTwoOutputsSharingAWriterStayInOrder) {
+   Files f;
+   LogFileOptions options;
+   options.flushIntervalMs = 60 * 1000;
+   f.AddFile(options, "shared.log");
+   Ref<LogWriter> writer;
+   f.logger->GetLogOutput()->GetWriter("file", writer);
+   Ref<Logger> second;
+   CreateLogger(nullptr, "second", "trivia", nullptr, second);
+   second->GetLogOutput()->AddWriter("file", writer.Get());
+
+   // The second output is the first to keep lines, so drains visit it first.
+   PELMORA_LOG_INFO(second.Get(), "zero");
+   writer->Flush();
+   PELMORA_LOG_INFO(f.logger.Get(), "one");
+   PELMORA_LOG_INFO(second.Get(), "two");
+   PELMORA_LOG_ERROR(second.Get(), "three");
+   writer->Flush();
+   std::vector<std::string> lines = Lines(ReadFile(options.path));
+   ASSERT_EQ(lines.size(), 4u) << ReadFile(options.path);
+   EXPECT_NE(lines[1].find("] one"), std::string::npos) << lines[1];
+   EXPECT_NE(lines[2].find("] two"), std::string::npos) << lines[2];
+   EXPECT_NE(lines[3].find("] three"), std::string::npos) << lines[3];
+}
+
+// A file writer with a smaller thread buffer joins after a thread's batch was made: the
+// thread keeps no more than the new, smaller size.
+TEST(LogBatchTest, AThreadKeepsNoMoreThanTheSmallestThreadBufferOfItsFiles) {
+   Files f;
+   LogFileOptions large;
+   large.flushIntervalMs = 60 * 1000;
+   f.AddFile(large, "large.log");
+   PELMORA_LOG_INFO(f.logger.Get(), "made the batch");
+   LogFileOptions small;
+   small.flushIntervalMs = 60 * 1000;
+   small.bufferSize = 1;  // what reaches this writer is in its file at once
+   small.threadBufferSize = 300;
+   small.path = f.dir + "/small.log";
+   Ref<LogWriter> writer;
+   CreateFileLogWriter("small", small, writer);
+   f.logger->GetLogOutput()->AddWriter("small", writer.Get());
+   const std::string text(60, 'y');
+   for (int i = 0; i < 20; ++i) PELMORA_LOG_INFO(f.logger.Get(), "line %1 %2", i, text);
+   // 20 lines of about 120 bytes: all but the last two or three have been handed on.
+   EXPECT_GE(Lines(ReadFile(small.path)).size(), 15u);
+}
+
+// exit() while another thread is inside a long line (its formatter argument waits for
+// something the exiting thread will never give): flushing the files at exit must not wait
+// for that line's output lock. The alarm ends a hung child.
+TEST(LogBatchDeathTest, ExitDoesNotWaitForAnotherThreadsLongLine) {
+   EXPECT_EXIT(
+       {
+          alarm(2);
+          auto* a = new BatchedOutput("a.log");  // left for the exit-time flush
+          // Runs before that flush (registered later), which still has the file open.
+          static std::string* const dir = new std::string(a->files.dir);
+          atexit([] { std::filesystem::remove_all(*dir); });
+          auto* inside = new Flag;
+          auto* never = new Flag;
+          auto* hook = new Hook([=] {
+             inside->Raise();
+             never->Wait(std::chrono::hours(1));
+          });
+          std::thread([=] {
+             PELMORA_LOG_INFO(a->files.logger.Get(), "%1 %2", kLong,
+                              static_cast<const Object*>(hook));
+          }).detach();
+          inside->Wait(std::chrono::seconds(1));
+          exit(0);
+       },
+       ::testing::ExitedWithCode(0), "");
+}
+
+// One output's slow line (a formatter argument that takes its time while the line holds
+// the output's lock) must not hold up the flush interval of another output's file.
+TEST(LogBatchTest, ALongLineOfOneOutputDoesNotHoldUpAnotherOutputsInterval) {
+   BatchedOutput slow("slow.log");  // first to keep lines: drains visit it first
+   Files quick;
+   LogFileOptions options;
+   options.flushIntervalMs = 20;
+   quick.AddFile(options, "quick.log");
+   Flag inside, release;
+   Hook hook([&] {
+      inside.Raise();
+      release.Wait(std::chrono::seconds(2));
+   });
+   std::thread slowLine([&] {
+      PELMORA_LOG_INFO(slow.files.logger.Get(), "%1 %2", kLong, static_cast<const Object*>(&hook));
+   });
+   ASSERT_TRUE(inside.Wait(std::chrono::seconds(2)));
+   PELMORA_LOG_INFO(quick.logger.Get(), "due within the interval");
+   // Twenty-five intervals.
+   auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(500);
+   bool written = false;
+   while (!written && std::chrono::steady_clock::now() < deadline) {
+      written = ReadFile(options.path).find("due within the interval\n") != std::string::npos;
+      if (!written) std::this_thread::sleep_for(std::chrono::milliseconds(5));
+   }
+   release.Raise();
+   Testing::Join(slowLine, "the slow line");
+   EXPECT_TRUE(written);
 }

@@ -27,13 +27,17 @@ namespace Pelmora::Service {
 // While every writer of a log output is a file writer with a buffer and a flush interval
 // or the in-memory ring (and one is a file writer), each thread keeps its lines of one
 // level for that output, up to the smallest `threadBufferSize` among the files, and hands
-// them on together: when that is full, before its next line of another level or one that
-// spans pieces, with every line at level error or more severe (every thread's then), on
-// the output's Flush, Reopen and Close, this writer's Flush and a read of the ring, and
-// within half a flush interval otherwise. So threads that log at once do not hand a lock
-// to each other on every line; their lines may reach the file and the ring out of time
-// order by up to one batch (a thread's own lines never), and a line waits up to about
-// two flush intervals before it is written.
+// them on together: when that is full, before its next line of another level, to another
+// output or one that spans pieces, with every line at level error or more severe (every
+// thread's then), when the output's writers change or it is closed, and within half a
+// flush interval otherwise; also on the output's Flush and Reopen, this writer's Flush
+// and a read of the ring, except for an output another thread is writing a line of
+// several pieces to at that moment (those never wait for it; the next half interval
+// hands its batches on). So threads that log at once do not hand a lock to each other on
+// every line; their lines may reach the file and the ring out of time order by up to
+// one batch, a thread's own lines not (unless its turn to another output waited 100 ms
+// in vain for a line of several pieces there), and a line waits up to about two flush
+// intervals before it is written.
 // Reopen (the manager's, after an outside rotation renamed the file) writes the buffer
 // to the old file and opens `path` anew.
 // When `path` cannot be opened again (after a roll or Reopen; out of descriptors, say),
