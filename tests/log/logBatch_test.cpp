@@ -37,6 +37,14 @@ std::vector<std::string> Lines(const std::string& text) {
    return lines;
 }
 
+// A flush interval far beyond any test: kept lines reach the file only when something
+// hands them on.
+LogFileOptions Unhurried() {
+   LogFileOptions options;
+   options.flushIntervalMs = 60 * 1000;
+   return options;
+}
+
 bool WaitFor(const std::string& path, const std::string& text) {
    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
    while (ReadFile(path).find(text) == std::string::npos) {
@@ -137,8 +145,7 @@ TEST(LogBatchTest, EachThreadsLinesArriveAllAndInOrderAcrossLevelsAndLongLines) 
 
 TEST(LogBatchTest, SevereLinesFlushesAndTheFlushIntervalHandOnEveryThreadsLines) {
    Files f;
-   LogFileOptions options;
-   options.flushIntervalMs = 60 * 1000;  // the interval's own part comes last
+   LogFileOptions options = Unhurried();
    f.AddFile(options, "severe.log");
    Logging other;
 
@@ -177,8 +184,7 @@ TEST(LogBatchTest, SevereLinesFlushesAndTheFlushIntervalHandOnEveryThreadsLines)
 
 TEST(LogBatchTest, AnotherKindOfWriterTakesEveryLineAtOnceAndBatchesGoToTheirOwnWriters) {
    Files f;
-   LogFileOptions options;
-   options.flushIntervalMs = 60 * 1000;
+   LogFileOptions options = Unhurried();
    f.AddFile(options, "mixed.log");
    LogOutput* output = f.logger->GetLogOutput();
    PELMORA_LOG_INFO(f.logger.Get(), "before the plain writer");
@@ -212,8 +218,7 @@ TEST(LogBatchTest, AnotherKindOfWriterTakesEveryLineAtOnceAndBatchesGoToTheirOwn
    std::string path;
    {
       Files gone;
-      LogFileOptions goneOptions;
-      goneOptions.flushIntervalMs = 60 * 1000;
+      LogFileOptions goneOptions = Unhurried();
       gone.AddFile(goneOptions, "gone.log");
       path = goneOptions.path;
       PELMORA_LOG_INFO(gone.logger.Get(), "kept when the output went");
@@ -233,10 +238,9 @@ TEST(LogBatchTest, AnotherKindOfWriterTakesEveryLineAtOnceAndBatchesGoToTheirOwn
 
 TEST(LogBatchTest, ABatchThatFindsTheFileClosedIsHeldAndDroppedLineByLine) {
    Files f;
-   LogFileOptions options;
+   LogFileOptions options = Unhurried();
    options.maxHeldBytes = 1000;
    options.reopenRetryMs = 0;
-   options.flushIntervalMs = 60 * 1000;
    Ref<FileLogWriter> writer = f.AddFile(options, "closed.log", FileOps::Ops());
    FileOps::failOpen = true;
    f.logger->GetLogManager()->Reopen();
@@ -255,8 +259,7 @@ TEST(LogBatchTest, ABatchThatFindsTheFileClosedIsHeldAndDroppedLineByLine) {
 
 TEST(LogBatchTest, TheRingTakesBatchesAndReadingItHandsEveryThreadsLinesOn) {
    Files f;
-   LogFileOptions options;
-   options.flushIntervalMs = 60 * 1000;
+   LogFileOptions options = Unhurried();
    f.AddFile(options, "ring.log");
    LogOutput* output = f.logger->GetLogOutput();
    Ref<LogWriter> ring;
@@ -287,10 +290,9 @@ TEST(LogBatchDeathTest, APanicReportCarriesTheLinesOtherThreadsKept) {
           LogOutput* output = GetDefaultLogger()->GetLogOutput();
           Ref<LogWriter> console;
           output->RemoveWriter("console", console);
-          LogFileOptions options;
+          LogFileOptions options = Unhurried();
           options.path = "/tmp/pelmora-batch-panic-" + std::to_string(getppid()) + ".log";
           options.level = "trivia";
-          options.flushIntervalMs = 60 * 1000;
           Ref<LogWriter> file;
           CreateFileLogWriter("file", options, file);
           output->AddWriter("file", file.Get());
@@ -363,8 +365,7 @@ void ExitWhenDone(std::function<void()> work) {
 // A second output with a batching file writer, at "trivia", on a manager of its own.
 struct BatchedOutput {
    explicit BatchedOutput(const std::string& name) {
-      LogFileOptions options;
-      options.flushIntervalMs = 60 * 1000;
+      LogFileOptions options = Unhurried();
       files.AddFile(options, name);
       files.logger->GetLogOutput()->GetWriter("file", writer);
       // A kept line registers the output among those that have batches.
@@ -378,10 +379,11 @@ const std::string kLong(3000, 'x');  // past one piece: the line takes the write
 
 }  // namespace
 
-// Two threads each in a long line of its own output, each flushing a file writer from a
-// formatter argument: before batching the flush took the writer's lock alone; now it
-// takes every output's write lock, the other's included.
-TEST(LogBatchDeathTest, FlushingFromInsideLongLinesOfTwoOutputsDoesNotDeadlock) {
+// Flushing a file writer hands on every output's batches. It may come from inside a
+// long line (a formatter argument), which holds that line's output, or under an output's
+// read lock; none of these may wait for ever.
+TEST(LogBatchDeathTest, DrainsNeverWaitForAnOutputsLock) {
+   // Two threads, each in a long line of its own output, each flushing.
    EXPECT_EXIT(ExitWhenDone([] {
                   BatchedOutput a("a.log"), b("b.log");
                   Flag aHolds, bHolds;
@@ -404,11 +406,8 @@ TEST(LogBatchDeathTest, FlushingFromInsideLongLinesOfTwoOutputsDoesNotDeadlock) 
                   other.join();
                }),
                ::testing::ExitedWithCode(0), "");
-}
-
-// A thread in a long line of output A drops the last reference to output B while a drain
-// has counted itself into B and waits for A's lock: B's end waits for that drain.
-TEST(LogBatchDeathTest, DroppingAnOutputFromInsideALongLineDoesNotDeadlock) {
+   // A thread in a long line of output A drops the last reference to output B while a
+   // drain that counted itself into B meets A's lock: B's end waits for that drain.
    EXPECT_EXIT(ExitWhenDone([] {
                   auto a = std::make_unique<BatchedOutput>("a.log");
                   auto b = std::make_unique<BatchedOutput>("b.log");
@@ -416,7 +415,7 @@ TEST(LogBatchDeathTest, DroppingAnOutputFromInsideALongLineDoesNotDeadlock) {
                   std::thread drainer([&] {
                      aHolds.Wait(std::chrono::seconds(1));
                      draining.Raise();
-                     a->writer->Flush();  // counts itself into both, then waits for A
+                     a->writer->Flush();
                   });
                   Hook hook([&] {
                      aHolds.Raise();
@@ -430,11 +429,7 @@ TEST(LogBatchDeathTest, DroppingAnOutputFromInsideALongLineDoesNotDeadlock) {
                   drainer.join();
                }),
                ::testing::ExitedWithCode(0), "");
-}
-
-// Flushing a file writer while holding its output's read lock (to look at its writers,
-// say) was fine while Flush took the writer's lock alone.
-TEST(LogBatchDeathTest, FlushingAWriterUnderItsOutputsReadLockDoesNotDeadlock) {
+   // A flush under the output's own read lock (looking at its writers, say).
    EXPECT_EXIT(ExitWhenDone([] {
                   BatchedOutput a("a.log");
                   LogOutput* output = a.files.logger->GetLogOutput();
@@ -446,11 +441,10 @@ TEST(LogBatchDeathTest, FlushingAWriterUnderItsOutputsReadLockDoesNotDeadlock) {
 }
 
 // One file writer on two outputs (two managers' loggers writing one file): a thread's
-// lines to the two are kept in two batches, which are handed on output by output.
+// lines to the two reach it in the order they were written.
 TEST(LogBatchTest, AThreadsLinesToTwoOutputsSharingAWriterStayInOrder) {
    Files f;
-   LogFileOptions options;
-   options.flushIntervalMs = 60 * 1000;
+   LogFileOptions options = Unhurried();
    f.AddFile(options, "shared.log");
    Ref<LogWriter> writer;
    f.logger->GetLogOutput()->GetWriter("file", writer);
@@ -476,12 +470,10 @@ TEST(LogBatchTest, AThreadsLinesToTwoOutputsSharingAWriterStayInOrder) {
 // thread keeps no more than the new, smaller size.
 TEST(LogBatchTest, AThreadKeepsNoMoreThanTheSmallestThreadBufferOfItsFiles) {
    Files f;
-   LogFileOptions large;
-   large.flushIntervalMs = 60 * 1000;
+   LogFileOptions large = Unhurried();
    f.AddFile(large, "large.log");
    PELMORA_LOG_INFO(f.logger.Get(), "made the batch");
-   LogFileOptions small;
-   small.flushIntervalMs = 60 * 1000;
+   LogFileOptions small = Unhurried();
    small.bufferSize = 1;  // what reaches this writer is in its file at once
    small.threadBufferSize = 300;
    small.path = f.dir + "/small.log";

@@ -22,6 +22,7 @@
 #include "pelmora/exception/exceptions.h"
 #include "pelmora/service.h"
 #include "src/log/logImpl.h"
+#include "tests/support/heap.h"
 #include "tests/support/watchdog.h"
 
 namespace Pelmora::TestSupport {
@@ -168,11 +169,6 @@ inline bool IsValidUtf8(const std::string& text) {
       i += length;
    }
    return true;
-}
-
-inline size_t HeapInUse() {
-   struct mallinfo2 info = mallinfo2();
-   return info.uordblks + info.hblkhd;
 }
 
 }  // namespace Pelmora::TestSupport

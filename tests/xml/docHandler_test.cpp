@@ -2,23 +2,19 @@
 // leaves behind once its document is gone.
 
 #include <gtest/gtest.h>
-#include <malloc.h>
 
 #include <string>
 #include <vector>
 
 #include "pelmora/xml.h"
+#include "tests/support/heap.h"
+#include "tests/xml/nodeBuilders.h"
 
 namespace Pelmora::Xml {
 namespace {
 
-Ref<XMLParser> NewParser(const DocLimits& limits = DocLimits()) {
-   Ref<XMLHandler> handler;
-   CreateXMLDocumentHandler(limits, handler);
-   Ref<XMLParser> parser;
-   CreateXMLParser(handler.Get(), parser);
-   return parser;
-}
+using Testing::NewParser;
+using TestSupport::HeapInUse;
 
 // The root's children: "t:" and the text of a text node, "c" for a comment, "e" for an
 // element, "[" and the texts of a CDATA section's children "]".
@@ -93,30 +89,24 @@ TEST(DocHandlerTest, AnAbortedTextDoesNotLeakIntoTheNextDocument) {
 // A pooled parser lives as long as the process: once a document is gone, the memory of
 // its text must be too, not kept by the handler for the next document.
 TEST(DocHandlerTest, ALargeTextLeavesNoMemoryBehindOnceItsDocumentIsGone) {
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-   GTEST_SKIP() << "the sanitizer's allocator does not report through mallinfo2";
-#endif
+   if (!TestSupport::kHeapIsMeasured) GTEST_SKIP() << "the heap in use is not measured here";
    Ref<XMLHandler> handler;
    CreateXMLDocumentHandler(handler);
    Ref<XMLParser> parser;
    CreateXMLParser(handler.Get(), parser);
-   auto inUse = [] {
-      struct mallinfo2 info = mallinfo2();
-      return info.uordblks + info.hblkhd;
-   };
-   size_t before = inUse();
+   size_t before = HeapInUse();
    {
       Ref<Object> result;
       parser->Parse("<r>" + std::string(size_t(64) << 20, 'x') + "</r>", false, result);
    }
-   EXPECT_LT(inUse(), before + (size_t(8) << 20));
+   EXPECT_LT(HeapInUse(), before + (size_t(8) << 20));
 
    // Nor when the parse stops while the text is being put together from its pieces.
    Ref<XMLParser> limited = NewParser({.maxChars = 32 << 20});
    Ref<Object> result;
    EXPECT_THROW(limited->Parse("<r>" + std::string(size_t(64) << 20, 'x') + "</r>", true, result),
                 XMLParseException);
-   EXPECT_LT(inUse(), before + (size_t(8) << 20));
+   EXPECT_LT(HeapInUse(), before + (size_t(8) << 20));
 }
 
 }  // namespace

@@ -1,7 +1,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <malloc.h>
 
 #include <algorithm>
 #include <memory>
@@ -12,6 +11,7 @@
 #include "pelmora/exception.h"
 #include "src/internal/report.h"
 #include "tests/support/logCapture.h"
+#include "tests/support/heap.h"
 #include "tests/xml/nodeBuilders.h"
 
 namespace Pelmora::Xml {
@@ -34,13 +34,8 @@ protected:
    void TearDown() override { Internal::SetReportSink(nullptr); }
 };
 
-Ref<XMLParser> NewParser(const DocLimits& limits = DocLimits()) {
-   Ref<XMLHandler> handler;
-   CreateXMLDocumentHandler(limits, handler);
-   Ref<XMLParser> parser;
-   CreateXMLParser(handler.Get(), parser);
-   return parser;
-}
+using Testing::NewParser;
+using TestSupport::HeapInUse;
 
 Ref<Document> Parse(XMLParser* parser, const std::string& text, bool restricted = false) {
    Ref<Object> result;
@@ -430,19 +425,13 @@ namespace {
 // grow (its input buffer, its attribute arrays) must go with the document, not stay for
 // every later one.
 TEST(ParserMemoryTest, AHugeStartTagLeavesNoMemoryBehindOnceItsDocumentIsGone) {
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-   GTEST_SKIP() << "the sanitizer's allocator does not report through mallinfo2";
-#endif
-   auto inUse = [] {
-      struct mallinfo2 info = mallinfo2();
-      return info.uordblks + info.hblkhd;
-   };
+   if (!TestSupport::kHeapIsMeasured) GTEST_SKIP() << "the heap in use is not measured here";
    std::string tag = "<r";
    for (int i = 0; i < 200000; ++i) tag += " a" + std::to_string(i) + "='v'";
    const std::string text = tag + "/>";
    Ref<XMLParser> parser = NewParser();
    Parse(parser.Get(), "<warm-up a='1'>x</warm-up>");
-   size_t before = inUse();
+   size_t before = HeapInUse();
    for (int round = 0; round < 2; ++round) {
       {
          Ref<Document> document = Parse(parser.Get(), text);
@@ -450,7 +439,7 @@ TEST(ParserMemoryTest, AHugeStartTagLeavesNoMemoryBehindOnceItsDocumentIsGone) {
          ASSERT_TRUE(document->GetChildElementByTag("r")->GetAttribute("a199999", value));
          EXPECT_EQ(value, "v");
       }
-      EXPECT_LT(inUse(), before + (size_t(1) << 20)) << "round " << round;
+      EXPECT_LT(HeapInUse(), before + (size_t(1) << 20)) << "round " << round;
    }
    // And the parser serves on as before.
    EXPECT_EQ(Reparse(parser.Get(), "<a b='1'><c/></a>"), "<a b=\"1\"><c/></a>");

@@ -30,11 +30,18 @@ inline std::string Write(const Node* node, bool pretty = false) {
    return writer->GetString();
 }
 
-inline Ref<Document> Parse(const std::string& text) {
+// A parser over a standard document handler with `limits`, or the process's defaults.
+inline Ref<XMLParser> NewParser(const DocLimits& limits) {
    Ref<XMLHandler> handler;
-   CreateXMLDocumentHandler(handler);
+   CreateXMLDocumentHandler(limits, handler);
    Ref<XMLParser> parser;
    CreateXMLParser(handler.Get(), parser);
+   return parser;
+}
+inline Ref<XMLParser> NewParser() { return NewParser(GetDefaultDocLimits()); }
+
+inline Ref<Document> Parse(const std::string& text) {
+   Ref<XMLParser> parser = NewParser();
    Ref<Object> result;
    parser->Parse(text, false, result);
    return result.Cast<Document>();
